@@ -1,0 +1,87 @@
+// Cost of adding ranges to a range list. The list is a singly linked list
+// walked from its head on every insertion, so where new spans land decides
+// the cost: at the tail (ascending, disjoint) every insertion walks the
+// whole list; at the head (descending) none does; merging ranges keep the
+// list short.
+
+#include "model/HTRangeList.h"
+
+#include <benchmark/benchmark.h>
+
+#include <algorithm>
+#include <cstdint>
+#include <numeric>
+#include <random>
+#include <vector>
+
+namespace {
+
+constexpr uint64_t kPage = 4096;
+const HTMemoryTotals kDirtyPage{kPage, 0, 0, 0, 0, 0};
+
+// Reports the time of one insertion beside the time of a whole list.
+void countInsertions(benchmark::State& state, int64_t insertions)
+{
+    state.SetItemsProcessed(state.iterations() * insertions);
+    state.counters["per_insert"] = benchmark::Counter(static_cast<double>(insertions),
+                                                      benchmark::Counter::kIsIterationInvariantRate |
+                                                          benchmark::Counter::kInvert);
+}
+
+// Page-sized ranges one page apart stay separate spans.
+void addDisjoint(benchmark::State& state, const std::vector<uint64_t>& pageOrder)
+{
+    for (auto _ : state) {
+        HTRangeList list;
+        for (uint64_t index : pageOrder) list.addRange(2 * index * kPage, kPage, kPage, kDirtyPage);
+        benchmark::DoNotOptimize(list.head());
+    }
+    countInsertions(state, static_cast<int64_t>(pageOrder.size()));
+}
+
+std::vector<uint64_t> ascending(int64_t count)
+{
+    std::vector<uint64_t> order(static_cast<size_t>(count));
+    std::iota(order.begin(), order.end(), uint64_t{0});
+    return order;
+}
+
+void BM_AddAscendingDisjoint(benchmark::State& state) { addDisjoint(state, ascending(state.range(0))); }
+
+void BM_AddDescendingDisjoint(benchmark::State& state)
+{
+    std::vector<uint64_t> order = ascending(state.range(0));
+    std::reverse(order.begin(), order.end());
+    addDisjoint(state, order);
+}
+
+// Spans in random order: the nodes lie scattered in memory relative to list
+// order, so each step of the walk is likely a cache miss. Not run at 100k,
+// where one pass takes close to a minute.
+void BM_AddShuffledDisjoint(benchmark::State& state)
+{
+    std::vector<uint64_t> order = ascending(state.range(0));
+    std::shuffle(order.begin(), order.end(), std::mt19937_64(42));
+    addDisjoint(state, order);
+}
+
+// Two-page ranges each overlapping the previous one by a page: every
+// insertion merges into the single span at the tail.
+void BM_AddOverlappingMerging(benchmark::State& state)
+{
+    const int64_t count = state.range(0);
+    for (auto _ : state) {
+        HTRangeList list;
+        for (int64_t i = 0; i < count; ++i)
+            list.addRange(static_cast<uint64_t>(i) * kPage, 2 * kPage, kPage, kDirtyPage);
+        benchmark::DoNotOptimize(list.head());
+    }
+    countInsertions(state, count);
+}
+
+}  // namespace
+
+BENCHMARK(BM_AddAscendingDisjoint)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_AddDescendingDisjoint)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_AddShuffledDisjoint)->Arg(1000)->Arg(10000)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_AddOverlappingMerging)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);

@@ -1,0 +1,335 @@
+#include "cli/HTHeftArgs.h"
+
+#include "process/HTProcess.h"
+
+#include <getopt.h>
+#include <strings.h>
+
+#include <cctype>
+#include <cstdarg>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+
+namespace {
+
+constexpr const char* kShortOptions = "aj:htp:x:svf:yw";
+
+// Values getopt_long reports for long options without a short letter; they
+// lie above every character value so that they cannot clash with one.
+enum : int {
+    OptionPhysHeft = 256,
+    OptionVmObjectDirty = 257,
+    OptionSwapped = 258,
+    OptionWired = 259,
+    OptionSort = 260,
+    OptionUnmapped = 261,
+};
+
+std::string stringWithFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));
+
+std::string stringWithFormat(const char* format, ...)
+{
+    va_list arguments;
+    va_start(arguments, format);
+    va_list copy;
+    va_copy(copy, arguments);
+    int length = std::vsnprintf(nullptr, 0, format, copy);
+    va_end(copy);
+    std::string text(length > 0 ? static_cast<size_t>(length) : 0, '\0');
+    if (length > 0) std::vsnprintf(text.data(), text.size() + 1, format, arguments);
+    va_end(arguments);
+    return text;
+}
+
+// Fills the caller's error slot, if any, and reports failure.
+bool fail(HTError* error, int64_t code, std::optional<std::string> description = std::nullopt)
+{
+    if (error) *error = HTError(HTHeftErrorDomain, code, std::move(description));
+    return false;
+}
+
+// The sort columns in lower case, joined by ", ", for the --sort error.
+std::string lowerCaseSortColumnList()
+{
+    std::string list;
+    for (const auto& column : HTHeftArgs::sortColumns()) {
+        if (!list.empty()) list += ", ";
+        for (char c : column) list.push_back(static_cast<char>(std::tolower(static_cast<unsigned char>(c))));
+    }
+    return list;
+}
+
+// getopt keeps its position in globals, and a process may parse more than
+// one command line (the tests do). glibc has no optreset: setting optind to
+// 0 instead of 1 makes its next call reinitialise everything, including the
+// position inside a group of short options and the permutation state, and
+// start again at argv[1].
+void resetOptionParser()
+{
+    optind = 0;
+    optarg = nullptr;
+    // The parser writes its own diagnostic for unknown options and missing
+    // arguments; the caller only prints the usage text after it.
+    opterr = 1;
+}
+
+}  // namespace
+
+const std::vector<std::string>& HTHeftArgs::sortColumns()
+{
+    static const std::vector<std::string> columns = {"Dirty",   "Swapped", "Clean",   "Reclaimable",
+                                                     "Wired",   "Regions", "Category"};
+    return columns;
+}
+
+const std::string& HTHeftArgs::defaultSortColumn() { return sortColumns().front(); }
+
+std::unique_ptr<HTHeftArgs> HTHeftArgs::initWithArgc(int argc, char** argv, HTError* error)
+{
+    if (error) *error = HTError();
+    auto args = std::make_unique<HTHeftArgs>();
+
+    // --proc and --pid report through flags rather than a value: getopt_long
+    // returns 0 and sets one of these.
+    int procFlag = 0;
+    int pidFlag = 0;
+    const struct option longOptions[] = {
+        {"all", no_argument, nullptr, 'a'},
+        {"json", required_argument, nullptr, 'j'},
+        {"help", no_argument, nullptr, 'h'},
+        {"targetChildren", no_argument, nullptr, 't'},
+        {"proc", required_argument, &procFlag, 1},
+        {"exclude", required_argument, nullptr, 'x'},
+        {"pid", required_argument, &pidFlag, 1},
+        {"skip", no_argument, nullptr, 's'},
+        {"format", required_argument, nullptr, 'f'},
+        {"sort", required_argument, nullptr, OptionSort},
+        {"summary", no_argument, nullptr, 'y'},
+        {"physHeft", no_argument, nullptr, OptionPhysHeft},
+        {"vmObjectDirty", no_argument, nullptr, OptionVmObjectDirty},
+        {"wide", no_argument, nullptr, 'w'},
+        {"swapped", no_argument, nullptr, OptionSwapped},
+        {"wired", no_argument, nullptr, OptionWired},
+        {"unmapped", no_argument, nullptr, OptionUnmapped},
+        {nullptr, 0, nullptr, 0},
+    };
+
+    resetOptionParser();
+    int option;
+    while ((option = getopt_long(argc, argv, kShortOptions, longOptions, nullptr)) != -1) {
+        if (option == 0) {
+            if (procFlag) {
+                procFlag = 0;
+                args->potentialTargetProcesses_.add(optarg);
+            } else if (pidFlag) {
+                pidFlag = 0;
+                if (!args->_applyPid(optarg, error)) return nullptr;
+            }
+            continue;
+        }
+        if (!args->_applyOption(option, optarg, error)) return nullptr;
+    }
+    args->_settleUnmapped();
+
+    // Operands are told apart (pid, name, snapfile) only at target selection.
+    for (int i = optind; i < argc; ++i) args->potentialTargetProcesses_.add(argv[i]);
+    return args;
+}
+
+bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
+{
+    switch (option) {
+    case 'a': targetAll_ = true; break;
+    case 'j': JSONOutputFile_ = argument; break;
+    case 'h': return fail(error, HTHeftErrorCodeHelp);
+    case 't': targetChildren_ = true; break;
+    case 'p': potentialTargetProcesses_.add(argument); break;
+    case 'x': excludedPidsOrProcesses_.add(argument); break;
+    case 's': skipIdleExitClean_ = true; break;
+    case 'v':
+        // The full listing replaces the summary; no option brings it back.
+        spanlistLikeOutput_ = true;
+        summarize_ = false;
+        break;
+    case 'f': return _applyFormat(argument, error);
+    case OptionSort: return _applySort(argument, error);
+    case 'y':
+        std::fprintf(stderr, "WARNING: -y/--summary options are deprecated because summary is the default mode\n");
+        break;
+    case OptionPhysHeft:
+        std::fprintf(stderr, "WARNING: --physHeft option is deprecated because it is the default mode\n");
+        break;
+    case OptionVmObjectDirty:
+        shouldGetPhysHeftBreakdown_ = false;
+        didSetShouldGetPhysHeftBreakdown_ = true;
+        break;
+    case 'w': textOptions_ |= HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide; break;
+    case OptionSwapped: textOptions_ |= HTTextOptionSwapped; break;
+    case OptionWired: textOptions_ |= HTTextOptionWired; break;
+    case OptionUnmapped: searchForUnmapped_ = true; break;
+    default:
+        // An unknown option or a missing argument: getopt_long has already
+        // said which.
+        return fail(error, HTHeftErrorCodeOption);
+    }
+    return true;
+}
+
+bool HTHeftArgs::_applyPid(const char* argument, HTError* error)
+{
+    // Like every pid on the command line, read as strtol reads it: leading
+    // blanks and a sign allowed, trailing characters ignored.
+    char* end = nullptr;
+    long value = std::strtol(argument, &end, 10);
+    if (end == argument)
+        return fail(error, HTHeftErrorCodePid,
+                    stringWithFormat("'%s' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
+                                     "specify a process name.",
+                                     argument));
+    targetPids_.set(static_cast<int32_t>(value), std::nullopt);
+    return true;
+}
+
+bool HTHeftArgs::_applySort(const char* argument, HTError* error)
+{
+    for (const auto& column : sortColumns()) {
+        if (strcasecmp(argument, column.c_str()) == 0) {
+            textSort_ = column;
+            return true;
+        }
+    }
+    return fail(error, HTHeftErrorCodeSort,
+                stringWithFormat("Unrecognized argument '%s' to --sort.\nAccepted arguments: %s", argument,
+                                 lowerCaseSortColumnList().c_str()));
+}
+
+bool HTHeftArgs::_applyFormat(const char* argument, HTError* error)
+{
+    static const char* const formats[] = {"bytes", "formatted", "pages"};
+    for (int64_t format = HTSummaryFormatBytes; format <= HTSummaryFormatPages; ++format) {
+        if (std::strcmp(argument, formats[format]) == 0) {
+            summaryFormat_ = format;
+            return true;
+        }
+    }
+    return fail(error, HTHeftErrorCodeFormat,
+                "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.");
+}
+
+void HTHeftArgs::_settleUnmapped()
+{
+    if (!searchForUnmapped_) return;
+    if (!shouldGetPhysHeftBreakdown_) {
+        // Owners of VM objects are only known in the breakdown mode.
+        std::fprintf(stderr, "WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' "
+                             "does not support unmapped owned VM objects\n");
+        searchForUnmapped_ = false;
+    } else if (targetAll_) {
+        // -a analyses every process anyway.
+        std::fprintf(stderr, "NOTICE: '--unmapped' is redundant when using -a/--all\n");
+        searchForUnmapped_ = false;
+    }
+}
+
+// --- target selection -------------------------------------------------------
+
+std::optional<std::vector<std::shared_ptr<HTProcess>>> HTHeftArgs::targetProcessesAndError(
+    const std::shared_ptr<HTPlatform>& platform, HTError* error)
+{
+    if (error) *error = HTError();
+    HTProcess::ProcessMap result;
+
+    // Snapfile pass: operands that name existing files are opened as
+    // snapfiles before anything else, and their processes enter `result`.
+    // Until heft reads snapfiles, every operand goes on to process discovery.
+
+    if (targetPids_.empty() && potentialTargetProcesses_.empty() && result.empty() && !targetAll_) {
+        fail(error, HTHeftErrorCodeNoTarget, "Must specify at least one process or snapfile");
+        return std::nullopt;
+    }
+
+    std::set<int32_t> excluded = _excludedPids(*platform);
+    if (targetAll_) {
+        // Every live process but the excluded ones; the operands and any
+        // snapfiles are not used.
+        result = HTProcess::allProcessesExcludingPids(platform, excluded).value_or(HTProcess::ProcessMap());
+    } else {
+        _resolvePotentialTargets(*platform);
+        for (int32_t pid : excluded) targetPids_.erase(pid);
+        // After the exclusions on purpose: -t reaches every descendant, even
+        // an excluded one.
+        if (targetChildren_) _addDescendantsOfTargets(*platform);
+        if (searchForUnmapped_) result = _hiddenProcessesForUnmapped(platform, excluded);
+        _addTargetProcesses(platform, result);
+    }
+    if (skipIdleExitClean_) result = HTProcess::removeIdleExitCleanProcessesFrom(result);
+
+    std::vector<std::shared_ptr<HTProcess>> processes;
+    processes.reserve(result.size());
+    for (const auto& entry : result) processes.push_back(entry.second);
+    return processes;
+}
+
+std::set<int32_t> HTHeftArgs::_excludedPids(HTPlatform& platform) const
+{
+    std::set<int32_t> excluded;
+    if (excludeSelf_) excluded.insert(platform.getpid());
+    if (!excludedPidsOrProcesses_.empty()) {
+        // Exclusions that match nothing are not worth a message.
+        auto pids = HTProcess::pidsForStringDescriptions(platform, excludedPidsOrProcesses_.values(), nullptr);
+        if (pids)
+            for (const auto& entry : *pids) excluded.insert(entry.first);
+    }
+    return excluded;
+}
+
+void HTHeftArgs::_resolvePotentialTargets(HTPlatform& platform)
+{
+    if (potentialTargetProcesses_.empty()) return;
+    std::vector<std::string> errors;
+    auto pids = HTProcess::pidsForStringDescriptions(platform, potentialTargetProcesses_.values(), &errors);
+    if (pids)
+        for (const auto& [pid, name] : *pids) targetPids_.set(pid, name);
+    // An operand that matches nothing does not stop the others.
+    for (const auto& message : errors) std::fprintf(stderr, "%s\n", message.c_str());
+}
+
+void HTHeftArgs::_addDescendantsOfTargets(HTPlatform& platform)
+{
+    auto pids = HTProcess::childPidsForPids(platform, targetPids_.keys());
+    if (!pids) return;
+    // Targets found by name lose their name here: from now on they are
+    // reported by pid, like the descendants.
+    for (int32_t pid : *pids) targetPids_.set(pid, std::nullopt);
+}
+
+HTProcess::ProcessMap HTHeftArgs::_hiddenProcessesForUnmapped(const std::shared_ptr<HTPlatform>& platform,
+                                                              const std::set<int32_t>& excluded) const
+{
+    // Every other process is analysed for memory that a target owns without
+    // mapping it; those processes are not reported themselves. The kernel
+    // owns nothing a user process could have unmapped, so it stays out.
+    std::set<int32_t> skipped = excluded;
+    for (int32_t pid : targetPids_.keys()) skipped.insert(pid);
+    skipped.insert(0);
+    auto others = HTProcess::allProcessesExcludingPids(platform, skipped);
+    if (!others) return {};
+    for (const auto& entry : *others) entry.second->setHiddenFromDisplay(true);
+    return std::move(*others);
+}
+
+void HTHeftArgs::_addTargetProcesses(const std::shared_ptr<HTPlatform>& platform,
+                                     HTProcess::ProcessMap& result) const
+{
+    for (const auto& [pid, name] : targetPids_) {
+        if (auto process = HTProcess::processWithPid(platform, pid)) {
+            result.set(pid, std::move(process));
+        } else if (name) {
+            std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", name->c_str(),
+                         static_cast<long>(pid));
+        } else {
+            std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", static_cast<long>(pid));
+        }
+    }
+}

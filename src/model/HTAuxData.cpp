@@ -1,0 +1,3 @@
+#include "model/HTAuxData.h"
+
+HTAuxJSONValue HTAuxData::jsonRepresentation() const { return HTAuxJSONValue::makeNumber(value_); }

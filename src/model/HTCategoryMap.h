@@ -1,0 +1,40 @@
+#pragma once
+
+#include <memory>
+#include <string>
+#include <unordered_map>
+#include <utility>
+#include <vector>
+
+class HTMemoryCategory;
+
+// Categories of one table under their keys (a short or a full name). Keys
+// iterate in the order they were first added, so that the same input gives
+// the same report byte for byte.
+class HTCategoryMap {
+public:
+    using Entry = std::pair<std::string, std::shared_ptr<HTMemoryCategory>>;
+
+    // The category under the key, or null.
+    HTMemoryCategory* find(const std::string& key) const
+    {
+        auto found = index_.find(key);
+        return found == index_.end() ? nullptr : entries_[found->second].second.get();
+    }
+
+    // Stores a category under a key that is not yet present.
+    void add(std::string key, std::shared_ptr<HTMemoryCategory> category)
+    {
+        index_.emplace(key, entries_.size());
+        entries_.emplace_back(std::move(key), std::move(category));
+    }
+
+    size_t size() const { return entries_.size(); }
+    bool empty() const { return entries_.empty(); }
+    std::vector<Entry>::const_iterator begin() const { return entries_.begin(); }
+    std::vector<Entry>::const_iterator end() const { return entries_.end(); }
+
+private:
+    std::vector<Entry> entries_;
+    std::unordered_map<std::string, size_t> index_;
+};

@@ -1,0 +1,65 @@
+#pragma once
+
+#include "model/HTIdentitySet.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+
+class HTMemoryObject;
+class HTMemoryRegion;
+
+// One line of a report: memory objects filed under one name, with the sums
+// of their totals and the union of their regions. A summary category groups
+// objects by short name only and so has no detailed name of its own.
+//
+// Built and read on the driver's thread only.
+class HTMemoryCategory {
+public:
+    using ObjectSet = HTIdentitySet<HTMemoryObject>;
+    using RegionSet = HTIdentitySet<HTMemoryRegion>;
+
+    explicit HTMemoryCategory(uint8_t segment, bool summary = false);
+
+    bool isSummary() const { return isSummary_; }
+    uint8_t segment() const { return segment_; }
+    const ObjectSet& memoryObjects() const { return memoryObjects_; }
+    const RegionSet& memoryRegions() const { return memoryRegions_; }
+
+    uint64_t totalDirtySize() const { return totalDirtySize_; }
+    void setTotalDirtySize(uint64_t value) { totalDirtySize_ = value; }
+    uint64_t totalSwappedSize() const { return totalSwappedSize_; }
+    void setTotalSwappedSize(uint64_t value) { totalSwappedSize_ = value; }
+    uint64_t totalCleanSize() const { return totalCleanSize_; }
+    void setTotalCleanSize(uint64_t value) { totalCleanSize_ = value; }
+    uint64_t totalReclaimableSize() const { return totalReclaimableSize_; }
+    void setTotalReclaimableSize(uint64_t value) { totalReclaimableSize_ = value; }
+    uint64_t totalWiredSize() const { return totalWiredSize_; }
+    void setTotalWiredSize(uint64_t value) { totalWiredSize_ = value; }
+    // Regions shared by several members count once.
+    int32_t totalRegions() const { return static_cast<int32_t>(memoryRegions_.size()); }
+
+    // Adds an object and its totals and regions; an object that is already
+    // a member (the same instance) is not counted again.
+    void addMemoryObject(const std::shared_ptr<HTMemoryObject>& object);
+
+    // All members are filed under one key, so any member names the category.
+    // nullopt when there is no member.
+    std::optional<std::string> name() const;
+    // nullopt for a summary category, whatever its members say.
+    std::optional<std::string> detailedName() const;
+    // A summary category's full name is its name.
+    std::optional<std::string> fullName() const;
+
+private:
+    bool isSummary_;
+    ObjectSet memoryObjects_;
+    uint8_t segment_;
+    uint64_t totalDirtySize_ = 0;
+    uint64_t totalSwappedSize_ = 0;
+    uint64_t totalCleanSize_ = 0;
+    uint64_t totalReclaimableSize_ = 0;
+    uint64_t totalWiredSize_ = 0;
+    RegionSet memoryRegions_;
+};

@@ -1,0 +1,50 @@
+#include "platform/linux/HTProcBuffer.h"
+
+#include <cerrno>
+#include <cstring>
+#include <fcntl.h>
+#include <unistd.h>
+
+namespace {
+constexpr size_t kInitialCapacity = 4096;
+}
+
+void HTProcBuffer::grow(size_t minimum)
+{
+    size_t capacity = capacity_ == 0 ? kInitialCapacity : capacity_;
+    while (capacity < minimum) capacity *= 2;
+    if (capacity == capacity_) return;
+    std::unique_ptr<char[]> data(new char[capacity]);
+    if (size_ != 0) std::memcpy(data.get(), data_.get(), size_);
+    data_ = std::move(data);
+    capacity_ = capacity;
+}
+
+bool HTProcBuffer::readDescriptor(int fd)
+{
+    size_ = 0;
+    grow(kInitialCapacity);
+    for (;;) {
+        if (size_ == capacity_) grow(capacity_ * 2);
+        ssize_t count = ::read(fd, data_.get() + size_, capacity_ - size_);
+        if (count < 0) {
+            if (errno == EINTR) continue;
+            size_ = 0;
+            return false;
+        }
+        if (count == 0) return true;
+        size_ += static_cast<size_t>(count);
+    }
+}
+
+bool HTProcBuffer::readFile(int dirfd, const char* path)
+{
+    size_ = 0;
+    int fd = ::openat(dirfd, path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return false;
+    bool read = readDescriptor(fd);
+    int savedErrno = errno;
+    ::close(fd);
+    errno = savedErrno;
+    return read;
+}

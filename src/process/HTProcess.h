@@ -1,0 +1,123 @@
+#pragma once
+
+#include "base/HTPidMap.h"
+#include "platform/HTPlatform.h"
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <set>
+#include <string>
+#include <vector>
+
+class HTMemoryRegion;
+class HTAuxDataMap;
+
+// Idle-exit status of a process.
+enum : int32_t {
+    HTIdleExitStatusUnknown = 0,
+    HTIdleExitStatusNotControlled = 1,
+    HTIdleExitStatusClean = 2,
+    HTIdleExitStatusDirty = 3,
+};
+
+// A process as the analysis sees it: a live user process, the kernel, a
+// corpse or a saved snapfile. Subclasses fill memoryRegions in gatherData.
+// The class-level operations discover the processes of the running system.
+class HTProcess {
+public:
+    // Map from pid to the name it was found by, or nullopt when it was given
+    // as a number.
+    using PidDescriptionMap = HTPidMap<std::optional<std::string>>;
+    using ProcessMap = HTPidMap<std::shared_ptr<HTProcess>>;
+
+    explicit HTProcess(std::shared_ptr<HTPlatform> platform);
+    virtual ~HTProcess();
+    HTProcess(const HTProcess&) = delete;
+    HTProcess& operator=(const HTProcess&) = delete;
+
+    // Fills the identity from the record and opens the process; false when
+    // the process cannot be read (the object is then to be discarded).
+    // Subclasses run this first and add their own steps.
+    virtual bool initWithBsdInfo(const proc_bsdinfo& info);
+
+    // --- overridable behaviour -----------------------------------------
+    virtual bool _populateTask();
+    virtual uint64_t _gatherPageSize();
+    virtual void gatherData();
+    virtual bool _isAlive();
+    // Null stands for "no auxiliary data".
+    virtual std::shared_ptr<HTAuxDataMap> auxData();
+    virtual bool breakDownPhysHeft();
+
+    // --- fields ----------------------------------------------------------
+    int32_t pid() const { return pid_; }
+    void setPid(int32_t pid) { pid_ = pid; }
+    bool is64bit() const { return is64bit_; }
+    void setIs64bit(bool value) { is64bit_ = value; }
+    int32_t idleExitStatus() const { return idleExitStatus_; }
+    // A snapshot copy.
+    std::vector<std::string> errors() const { return errors_; }
+    std::vector<std::string>& warnings() { return warnings_; }
+    const std::vector<std::string>& warnings() const { return warnings_; }
+    bool hiddenFromDisplay() const { return hiddenFromDisplay_; }
+    void setHiddenFromDisplay(bool value) { hiddenFromDisplay_ = value; }
+    const std::string& name() const { return name_; }
+    void setName(std::string value) { name_ = std::move(value); }
+    // Empty until gathered; hasMemoryRegions() tells "none" from "no regions".
+    const std::vector<std::shared_ptr<HTMemoryRegion>>& memoryRegions() const;
+    bool hasMemoryRegions() const { return memoryRegions_.has_value(); }
+    void setMemoryRegions(std::optional<std::vector<std::shared_ptr<HTMemoryRegion>>> regions);
+    const std::string& displayString() const { return displayString_; }
+    void setDisplayString(std::string value) { displayString_ = std::move(value); }
+    uint64_t pageSize() const { return pageSize_; }
+    void setPageSize(uint64_t value) { pageSize_ = value; }
+
+    // "HTProcess[pid]".
+    std::string description() const;
+    // Processes are equal by pid, whatever their kind.
+    bool isEqual(const HTProcess& other) const { return pid_ == other.pid_; }
+    size_t hash() const { return static_cast<size_t>(pid_); }
+
+    HTPlatform& platform() const { return *platform_; }
+    const std::shared_ptr<HTPlatform>& sharedPlatform() const { return platform_; }
+
+    // --- process discovery ---------------------------------------------
+    static std::shared_ptr<HTProcess> processWithBsdInfo(const std::shared_ptr<HTPlatform>& platform,
+                                                         const proc_bsdinfo& info);
+    static std::shared_ptr<HTProcess> processWithPid(const std::shared_ptr<HTPlatform>& platform, int32_t pid);
+    static std::string _nameForBsdInfo(HTPlatform& platform, const proc_bsdinfo& info);
+    static std::string _nameForBsdInfoCommName(const proc_bsdinfo& info);
+    // nullopt when the system process list cannot be read.
+    static std::optional<ProcessMap> allProcessesExcludingPids(const std::shared_ptr<HTPlatform>& platform,
+                                                               const std::set<int32_t>& excludedPids);
+    static std::optional<PidDescriptionMap> pidsForStringDescriptions(HTPlatform& platform,
+                                                                      const std::vector<std::string>& descriptions,
+                                                                      std::vector<std::string>* errors);
+    static std::optional<std::vector<int32_t>> childPidsForPids(HTPlatform& platform,
+                                                                const std::vector<int32_t>& pids);
+    static ProcessMap removeIdleExitCleanProcessesFrom(const ProcessMap& processes);
+
+    // The program-wide list of errors not tied to one process. Written on
+    // the main thread only.
+    static void _addGlobalError(std::string error);
+    static std::vector<std::string> globalErrors();
+    static void _clearGlobalErrors();
+
+protected:
+    void addError(std::string error) { errors_.push_back(std::move(error)); }
+    void setIdleExitStatus(int32_t status) { idleExitStatus_ = status; }
+
+private:
+    std::shared_ptr<HTPlatform> platform_;
+    int32_t pid_ = 0;
+    bool is64bit_ = false;
+    int32_t idleExitStatus_ = HTIdleExitStatusUnknown;
+    std::vector<std::string> errors_;
+    std::vector<std::string> warnings_;
+    bool hiddenFromDisplay_ = false;
+    std::string name_;
+    std::optional<std::vector<std::shared_ptr<HTMemoryRegion>>> memoryRegions_;
+    std::string displayString_;
+    uint64_t pageSize_ = 0;
+};

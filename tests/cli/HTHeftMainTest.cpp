@@ -1,0 +1,90 @@
+#include "cli/HTHeftMain.h"
+#include "platform/fake/HTFakePlatform.h"
+#include "process/HTProcess.h"
+
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+namespace {
+
+constexpr const char* kSelfRegionHeft = "vm.self_region_heft";
+
+// The run up to the analysis, against a scripted system. The exact texts
+// a user sees are checked end to end on the built program; here the checks
+// are about what the run does to the system and in which order.
+class HTHeftMainTest : public testing::Test {
+protected:
+    void SetUp() override
+    {
+        HTProcess::_clearGlobalErrors();
+        platform_ = std::make_shared<HTFakePlatform>();
+        platform_->ownPid = 500;
+        platform_->addProcess(1, 0, "init", "/sbin/init");
+        platform_->addProcess(42, 1, "worker", "/usr/bin/worker");
+        platform_->sysctlValues[kSelfRegionHeft] = 0;
+    }
+
+    void TearDown() override { HTProcess::_clearGlobalErrors(); }
+
+    struct Run {
+        int status = -1;
+        std::string standardOutput;
+        std::string standardError;
+    };
+
+    Run run(std::vector<std::string> arguments)
+    {
+        arguments.insert(arguments.begin(), "heft");
+        std::vector<char*> argv;
+        for (auto& argument : arguments) argv.push_back(argument.data());
+        argv.push_back(nullptr);
+
+        Run result;
+        testing::internal::CaptureStdout();
+        testing::internal::CaptureStderr();
+        result.status = heftMain(static_cast<int>(arguments.size()), argv.data(), platform_);
+        result.standardError = testing::internal::GetCapturedStderr();
+        result.standardOutput = testing::internal::GetCapturedStdout();
+        return result;
+    }
+
+    std::shared_ptr<HTFakePlatform> platform_;
+};
+
+TEST_F(HTHeftMainTest, TurnsTheBreakdownModeOnUnlessVmObjectDirty)
+{
+    Run result = run({"--vmObjectDirty", "42"});
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 0);
+
+    result = run({"42"});
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.standardOutput, "");
+    EXPECT_EQ(result.standardError, "");
+    EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 1);
+}
+
+TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRoot)
+{
+    platform_->euid = 1000;
+    for (std::vector<std::string> arguments : {std::vector<std::string>{"-a"}, {"--unmapped", "42"}}) {
+        Run result = run(arguments);
+        EXPECT_EQ(result.status, 1) << arguments[0];
+        EXPECT_EQ(result.standardError, "Must run as root.\n");
+        EXPECT_EQ(result.standardOutput, "");
+    }
+
+    // Naming processes needs no privilege of its own.
+    Run result = run({"worker"});
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.standardError, "");
+
+    // A command-line error is reported before privileges are looked at.
+    result = run({"-a", "-f", "bad"});
+    EXPECT_EQ(result.status, 1);
+    EXPECT_EQ(result.standardError.rfind("Unrecognized argument to -f", 0), 0u) << result.standardError;
+}
+
+}  // namespace

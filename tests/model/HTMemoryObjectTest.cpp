@@ -1,0 +1,212 @@
+#include "analysis/HTHeft.h"
+#include "model/HTMemoryObject.h"
+#include "model/HTMemoryRegion.h"
+#include "platform/fake/HTFakePlatform.h"
+#include "process/HTProcess.h"
+
+#include <gtest/gtest.h>
+
+#include <memory>
+
+namespace {
+
+constexpr uint64_t kPage = 4096;
+
+// A mapping of `pages` pages at page `offsetPages` of object `objectId`,
+// with `dirtyPages` dirty and `swappedPages` swapped.
+std::shared_ptr<HTMemoryRegion> region(uint64_t objectId, uint64_t offsetPages, uint64_t pages, uint64_t dirtyPages,
+                                       uint64_t swappedPages = 0, uint8_t shareMode = SM_SHARED)
+{
+    auto made = std::make_shared<HTMemoryRegion>();
+    made->setObject_id(objectId);
+    made->setOffset(offsetPages * kPage);
+    made->setSize(pages * kPage);
+    made->setDirtySize(dirtyPages * kPage);
+    made->setSwappedSize(swappedPages * kPage);
+    made->setShare_mode(shareMode);
+    made->setName("shared memory");
+    return made;
+}
+
+// Processes whose platform answers the per-region heft setting. HTHeft
+// caches that setting program-wide, so the cache is reset on the way out.
+class Processes {
+public:
+    explicit Processes(bool regionHeft) : platform_(std::make_shared<HTFakePlatform>())
+    {
+        platform_->sysctlValues["vm.self_region_heft"] = regionHeft ? 1 : 0;
+        HTHeft::setBreakDownPhysHeft(*platform_, regionHeft);
+    }
+    ~Processes()
+    {
+        HTFakePlatform unset;
+        HTHeft::setBreakDownPhysHeft(unset, false);
+    }
+    std::shared_ptr<HTProcess> operator()(int32_t pid)
+    {
+        auto made = std::make_shared<HTProcess>(platform_);
+        made->setPid(pid);
+        made->setPageSize(kPage);
+        return made;
+    }
+
+private:
+    std::shared_ptr<HTFakePlatform> platform_;
+};
+
+// p1 maps two pages twice and its regions report them twice; p2 maps the
+// page after them. Counted by pages: three dirty pages, one swapped.
+std::shared_ptr<HTMemoryObject> mappedTwiceByOne(HTProcess& p1, HTProcess& p2)
+{
+    auto object = std::make_shared<HTMemoryObject>();
+    object->addRegion(region(5, 0, 2, 2), p1);
+    object->addRegion(region(5, 0, 2, 2, 1), p1);
+    object->addRegion(region(5, 2, 1, 1), p2);
+    return object;
+}
+
+}  // namespace
+
+TEST(HTMemoryObject, TotalsCountEachPageOnce)
+{
+    Processes process(false);
+    auto p1 = process(1);
+    auto object = std::make_shared<HTMemoryObject>();
+    object->addRegion(region(5, 0, 4, 4), *p1);
+    object->addRegion(region(5, 2, 4, 4), *p1);
+    // Only a region's sub-ranges count once it has some.
+    auto pieces = region(5, 16, 4, 4);
+    pieces->addSubrange(16 * kPage, kPage, HTMemoryTotals{0, 0, kPage, 0, 0, 0}, kPage);
+    object->addRegion(pieces, *p1);
+    EXPECT_EQ(pieces->subrangeList(), nullptr);
+    // Without an object id a region names the object but counts nothing.
+    object->addRegion(region(0, 0, 8, 8), *p1);
+
+    object->finalize(false);
+    EXPECT_EQ(object->totalDirtySize(), 6 * kPage);
+    EXPECT_EQ(object->totalCleanSize(), kPage);
+    EXPECT_EQ(object->memoryRegions().size(), 4u);
+    EXPECT_EQ(object->rangeList(), nullptr);
+    // A single process sees the object whole.
+    EXPECT_FALSE(object->processMemoryRegions());
+    EXPECT_EQ(object->viewForProcess(*p1, false), object);
+}
+
+TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
+{
+    Processes process(false);
+    auto p1 = process(1);
+    auto p2 = process(2);
+    auto object = std::make_shared<HTMemoryObject>();
+    object->addRegion(region(5, 0, 1, 1, 0, SM_PRIVATE), *p1);
+    EXPECT_FALSE(object->processMemoryRegions()) << "a private region starts no map";
+    object->addRegion(region(5, 0, 1, 1), *p2);
+    // Once the map exists every region is recorded, eligible or not.
+    object->addRegion(region(5, 1, 1, 1, 0, SM_PRIVATE), *p1);
+    object->addRegion(region(5, 0, 1, 1), kPage);
+    ASSERT_TRUE(object->processMemoryRegions());
+    ASSERT_EQ(object->processMemoryRegions()->keys(), (std::vector<int32_t>{2, 1}));
+    EXPECT_EQ(object->processMemoryRegions()->find(1)->size(), 1u);
+
+    // Two processes, one region each, equal to the totals: dropped.
+    auto equal = std::make_shared<HTMemoryObject>();
+    equal->addRegion(region(5, 0, 2, 2), *p1);
+    equal->addRegion(region(5, 0, 2, 2), *p2);
+    equal->finalize(false);
+    EXPECT_FALSE(equal->processMemoryRegions());
+
+    // One region each, but one differs from the totals: kept.
+    auto differing = std::make_shared<HTMemoryObject>();
+    differing->addRegion(region(5, 0, 2, 2), *p1);
+    differing->addRegion(region(5, 0, 2, 1), *p2);
+    differing->finalize(false);
+    EXPECT_TRUE(differing->processMemoryRegions());
+}
+
+TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
+{
+    Processes process(true);
+    auto p1 = process(1);
+    auto p2 = process(2);
+    auto pageCounted = mappedTwiceByOne(*p1, *p2);
+    pageCounted->finalize(false);
+    EXPECT_EQ(pageCounted->totalDirtySize(), 3 * kPage);
+
+    // With the switch on no process is charged less than its regions say.
+    auto object = mappedTwiceByOne(*p1, *p2);
+    object->finalize(true);
+    EXPECT_EQ(object->totalDirtySize(), 4 * kPage);
+    EXPECT_EQ(object->totalSwappedSize(), kPage);
+
+    // p1's regions report per-region heft: its view sums them as reported.
+    auto view1 = object->viewForProcess(*p1, true);
+    EXPECT_EQ(view1->totalDirtySize(), 4 * kPage);
+    EXPECT_EQ(view1->memoryRegions().size(), 2u);
+    EXPECT_EQ(object->viewForProcess(*p2, true)->totalDirtySize(), kPage);
+    EXPECT_EQ(object->viewForProcess(*process(3), true), object) << "no list of its own";
+}
+
+TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
+{
+    Processes process(false);
+    auto owner = process(7);
+    auto other = process(9);
+    auto object = std::make_shared<HTMemoryObject>();
+    auto mapped = region(5, 0, 4, 2, 1);
+    mapped->setCleanNonSpecSize(kPage);
+    mapped->setReclaimableSize(kPage);
+    mapped->setWired(true);
+    object->addRegion(mapped, *owner);
+    object->setOwnerPid(7);
+    object->finalize(false);
+
+    EXPECT_EQ(object->viewForProcess(*owner, false), object);
+    auto seen = object->viewForProcess(*other, false);
+    EXPECT_EQ(seen->totalDirtySize() + seen->totalSwappedSize() + seen->totalReclaimableSize(), 0u);
+    EXPECT_EQ(seen->totalCleanSize(), 4 * kPage);
+    EXPECT_EQ(&seen->memoryRegions(), &object->memoryRegions()) << "a copy shares the region set";
+
+    // Outside a kept per-process map a process sees the object whole, owned or not.
+    auto kept = mappedTwiceByOne(*process(1), *owner);
+    kept->setOwnerPid(7);
+    kept->finalize(false);
+    EXPECT_EQ(kept->viewForProcess(*other, false), kept);
+}
+
+TEST(HTMemoryObject, NamesComeFromTheCanonicalRegion)
+{
+    auto fake = region(5, 0, 1, 1);
+    fake->setUser_tag(HTFakeRegionTag);
+    fake->setName("Owned physical heft (unmapped)");
+    auto mapped = region(5, 0, 1, 1);
+    mapped->setName("mapped file");
+    mapped->setDetailedName("/tmp/data");
+    auto owned = std::make_shared<HTMemoryObject>();
+    EXPECT_EQ(owned->name(), std::nullopt);
+    owned->addRegion(fake, kPage);
+    owned->addRegion(mapped, kPage);
+    owned->setOwnerPid(7);
+    owned->finalize(false);
+    EXPECT_EQ(fake->fullName(), "mapped file /tmp/data");
+
+    // Shared-cache objects are named by an image piece, not an unused area.
+    auto unused = region(0, 0, 1, 0);
+    unused->setInSharedCache(true);
+    unused->setUnusedSharedCacheRegion(true);
+    auto piece = region(0, 1, 1, 0);
+    piece->setInSharedCache(true);
+    piece->setName("__TEXT");
+    auto cache = std::make_shared<HTMemoryObject>();
+    cache->addRegion(unused, kPage);
+    cache->addRegion(piece, kPage);
+    EXPECT_EQ(cache->name(), "__TEXT");
+}
+
+TEST(HTMemoryObject, MisuseStopsTheProgram)
+{
+    auto object = std::make_shared<HTMemoryObject>();
+    EXPECT_DEATH(object->copy(), "HTMemoryObject");
+    object->finalize(false);
+    EXPECT_DEATH(object->finalize(false), "HTMemoryObject");
+    EXPECT_DEATH(object->addRegion(region(5, 0, 1, 0), kPage), "HTMemoryObject");
+}

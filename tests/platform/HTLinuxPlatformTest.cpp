@@ -1,0 +1,304 @@
+#include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/HTTestChildren.h"
+
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <climits>
+#include <cstring>
+#include <fcntl.h>
+#include <string>
+#include <sys/stat.h>
+#include <vector>
+
+namespace {
+
+std::string field(const char* chars, size_t capacity)
+{
+    return std::string(chars, strnlen(chars, capacity));
+}
+
+std::vector<int32_t> listAll(HTPlatform& platform)
+{
+    int bound = platform.proc_listallpids(nullptr, 0);
+    EXPECT_GT(bound, 0);
+    std::vector<int32_t> pids(static_cast<size_t>(bound) + 20);
+    int count = platform.proc_listallpids(pids.data(), static_cast<int>(pids.size() * sizeof(int32_t)));
+    EXPECT_GT(count, 0);
+    EXPECT_LE(count, bound + 20);
+    pids.resize(static_cast<size_t>(std::max(count, 0)));
+    return pids;
+}
+
+bool contains(const std::vector<int32_t>& pids, int32_t pid)
+{
+    return std::find(pids.begin(), pids.end(), pid) != pids.end();
+}
+
+// The argument area of a process through the platform; empty with errno
+// on failure.
+std::string procArgs(HTPlatform& platform, int32_t pid)
+{
+    int name[3] = {CTL_KERN, KERN_PROCARGS2, pid};
+    std::vector<char> area(1 << 20);
+    size_t length = area.size();
+    if (platform.sysctl(name, 3, area.data(), &length, nullptr, 0) != 0) return {};
+    return std::string(area.data(), length);
+}
+
+std::string readWhole(const char* path)
+{
+    std::string text;
+    int fd = ::open(path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) return text;
+    char chunk[4096];
+    ssize_t count;
+    while ((count = ::read(fd, chunk, sizeof(chunk))) > 0) text.append(chunk, static_cast<size_t>(count));
+    ::close(fd);
+    return text;
+}
+
+}  // namespace
+
+TEST(HTLinuxPlatform, RecordOfTheTestItselfAndOfTheKernel)
+{
+    HTLinuxPlatform platform;
+    proc_bsdinfo info{};
+    ASSERT_EQ(platform.proc_pidinfo(::getpid(), PROC_PIDTBSDINFO, 0, &info, sizeof(info)), (int)sizeof(info));
+    EXPECT_EQ(info.pbi_pid, static_cast<uint32_t>(::getpid()));
+    EXPECT_EQ(info.pbi_ppid, static_cast<uint32_t>(::getppid()));
+    EXPECT_EQ(info.pbi_status, SRUN);  // it is running: it is reading its own record
+    EXPECT_EQ(info.pbi_flags & PROC_FLAG_SYSTEM, 0u);
+    EXPECT_EQ((info.pbi_flags & PROC_FLAG_LP64) != 0, sizeof(void*) == 8);
+    EXPECT_EQ(info.pbi_uid, ::geteuid());
+    std::string comm = readWhole("/proc/self/comm");
+    ASSERT_FALSE(comm.empty());
+    comm.pop_back();
+    EXPECT_EQ(field(info.pbi_name, sizeof(info.pbi_name)), comm);
+    EXPECT_EQ(field(info.pbi_comm, sizeof(info.pbi_comm)), comm.substr(0, 16));
+
+    proc_bsdshortinfo shortInfo{};
+    ASSERT_EQ(platform.proc_pidinfo(::getpid(), PROC_PIDT_SHORTBSDINFO, 1, &shortInfo, sizeof(shortInfo)),
+              (int)sizeof(shortInfo));
+    EXPECT_EQ(shortInfo.pbsi_ppid, info.pbi_ppid);
+    EXPECT_EQ(0, std::memcmp(shortInfo.pbsi_comm, info.pbi_comm, sizeof(info.pbi_comm)));
+
+    proc_bsdinfo kernel{};
+    ASSERT_EQ(platform.proc_pidinfo(0, PROC_PIDTBSDINFO, 0, &kernel, sizeof(kernel)), (int)sizeof(kernel));
+    EXPECT_EQ(kernel.pbi_pid, 0u);
+    EXPECT_EQ(kernel.pbi_ppid, 0u);
+    EXPECT_NE(kernel.pbi_flags & PROC_FLAG_SYSTEM, 0u);
+    EXPECT_EQ(field(kernel.pbi_name, sizeof(kernel.pbi_name)), "kernel");
+}
+
+TEST(HTLinuxPlatform, ChildThroughStoppedZombieAndGone)
+{
+    HTLinuxPlatform platform;
+    // The child stops itself, then exits once continued; waiting for each
+    // state makes every check below independent of timing.
+    HTTestChild child = HTTestChild::fork([] {
+        ::raise(SIGSTOP);
+        return 0;
+    });
+    ASSERT_TRUE(child.valid());
+    int status = 0;
+    ASSERT_EQ(::waitpid(child.pid(), &status, WUNTRACED), child.pid());
+    ASSERT_TRUE(WIFSTOPPED(status));
+
+    proc_bsdinfo info{};
+    ASSERT_EQ(platform.proc_pidinfo(child.pid(), PROC_PIDTBSDINFO, 0, &info, sizeof(info)), (int)sizeof(info));
+    EXPECT_EQ(info.pbi_pid, static_cast<uint32_t>(child.pid()));
+    EXPECT_EQ(info.pbi_ppid, static_cast<uint32_t>(::getpid()));
+    EXPECT_EQ(info.pbi_status, SSTOP);
+    std::shared_ptr<HTTaskPort> task;
+    EXPECT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
+    task.reset();
+
+    ::kill(child.pid(), SIGCONT);
+    ASSERT_TRUE(child.waitForZombie());
+    proc_bsdshortinfo shortInfo{};
+    ASSERT_EQ(platform.proc_pidinfo(child.pid(), PROC_PIDT_SHORTBSDINFO, 1, &shortInfo, sizeof(shortInfo)),
+              (int)sizeof(shortInfo));
+    EXPECT_EQ(shortInfo.pbsi_status, SZOMB);
+    ASSERT_EQ(platform.proc_pidinfo(child.pid(), PROC_PIDTBSDINFO, 0, &info, sizeof(info)), (int)sizeof(info));
+    EXPECT_EQ(info.pbi_status, SZOMB);
+    // A zombie has no executable any more.
+    errno = 0;
+    EXPECT_EQ(procArgs(platform, child.pid()), "");
+    EXPECT_EQ(errno, ENOENT);
+
+    int32_t pid = child.pid();
+    child.reap();
+    errno = 0;
+    EXPECT_EQ(platform.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof(info)), 0);
+    EXPECT_EQ(errno, ESRCH);
+    errno = 0;
+    EXPECT_EQ(platform.proc_pidinfo(pid, PROC_PIDT_SHORTBSDINFO, 1, &shortInfo, sizeof(shortInfo)), 0);
+    EXPECT_EQ(errno, ESRCH);
+    errno = 0;
+    EXPECT_EQ(procArgs(platform, pid), "");
+    EXPECT_EQ(errno, ESRCH);
+    EXPECT_EQ(platform.task_for_pid(pid, &task), HT_KERN_ERRNO_BASE | ESRCH);
+    EXPECT_EQ(task, nullptr);
+}
+
+TEST(HTLinuxPlatform, ListingHoldsKernelAndProcessesButNoKernelThreads)
+{
+    HTLinuxPlatform platform;
+    std::vector<int32_t> pids = listAll(platform);
+    ASSERT_FALSE(pids.empty());
+    EXPECT_EQ(pids.front(), 0);
+    EXPECT_TRUE(contains(pids, ::getpid()));
+    EXPECT_TRUE(contains(pids, ::getppid()));
+    EXPECT_EQ(std::count(pids.begin(), pids.end(), ::getpid()), 1);
+
+    // A buffer with room for two pids gets two.
+    int32_t two[3] = {-1, -1, -1};
+    EXPECT_EQ(platform.proc_listallpids(two, 2 * sizeof(int32_t)), 2);
+    EXPECT_EQ(two[0], 0);
+    EXPECT_EQ(two[2], -1);
+
+    // Outside a pid namespace, pid 2 is kthreadd, the parent of every
+    // kernel thread.
+    std::string kthreadd = readWhole("/proc/2/stat");
+    if (kthreadd.rfind("2 (kthreadd) ", 0) != 0) GTEST_SKIP() << "no kernel threads visible in this pid namespace";
+    EXPECT_FALSE(contains(pids, 2));
+    proc_bsdinfo info{};
+    errno = 0;
+    EXPECT_EQ(platform.proc_pidinfo(2, PROC_PIDTBSDINFO, 0, &info, sizeof(info)), 0);
+    EXPECT_EQ(errno, ESRCH);
+}
+
+TEST(HTLinuxPlatform, ArgumentAreaOfTheTestItself)
+{
+    HTLinuxPlatform platform;
+    int argmaxName[2] = {CTL_KERN, KERN_ARGMAX};
+    int32_t argmax = 0;
+    size_t length = sizeof(argmax);
+    ASSERT_EQ(platform.sysctl(argmaxName, 2, &argmax, &length, nullptr, 0), 0);
+    EXPECT_GE(argmax, 4096);
+    EXPECT_LE(argmax, 1 << 20);
+
+    std::string area = procArgs(platform, ::getpid());
+    ASSERT_GT(area.size(), 8u);
+    char exe[PATH_MAX];
+    ssize_t exeLength = ::readlink("/proc/self/exe", exe, sizeof(exe));
+    ASSERT_GT(exeLength, 0);
+    std::string cmdline = readWhole("/proc/self/cmdline");
+    int32_t argc;
+    std::memcpy(&argc, area.data(), sizeof(argc));
+    EXPECT_EQ(argc, std::count(cmdline.begin(), cmdline.end(), '\0'));
+    EXPECT_EQ(std::string(area.c_str() + 4), std::string(exe, static_cast<size_t>(exeLength)));
+    EXPECT_TRUE(area.ends_with(cmdline));
+    // Between path and arguments only NUL bytes.
+    size_t pathEnd = 4 + static_cast<size_t>(exeLength);
+    std::string padding = area.substr(pathEnd, area.size() - cmdline.size() - pathEnd);
+    EXPECT_FALSE(padding.empty());
+    EXPECT_EQ(padding, std::string(padding.size(), '\0'));
+
+    // Asked for its size, then into a buffer too small for the path.
+    int name[3] = {CTL_KERN, KERN_PROCARGS2, ::getpid()};
+    size_t needed = 0;
+    ASSERT_EQ(platform.sysctl(name, 3, nullptr, &needed, nullptr, 0), 0);
+    EXPECT_EQ(needed, area.size());
+    char small[8];
+    length = sizeof(small);
+    errno = 0;
+    EXPECT_EQ(platform.sysctl(name, 3, small, &length, nullptr, 0), -1);
+    EXPECT_EQ(errno, ENOMEM);
+
+    // The kernel has no argument area.
+    name[2] = 0;
+    EXPECT_EQ(procArgs(platform, 0), "");
+}
+
+TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
+{
+    // Unprivileged, another user's executable and memory maps are closed:
+    // the failures carry EACCES, while the process record stays readable.
+    auto check = [](int32_t target) -> int {
+        HTLinuxPlatform platform;
+        int failures = 0;
+        errno = 0;
+        if (!procArgs(platform, target).empty() || errno != EACCES) failures |= 1;
+        std::shared_ptr<HTTaskPort> task;
+        if (platform.task_for_pid(target, &task) != (HT_KERN_ERRNO_BASE | EACCES)) failures |= 2;
+        proc_bsdinfo info{};
+        if (platform.proc_pidinfo(target, PROC_PIDTBSDINFO, 0, &info, sizeof(info)) != sizeof(info)) failures |= 4;
+        return failures;
+    };
+    if (::geteuid() != 0) {
+        struct stat init {};
+        if (::stat("/proc/1", &init) != 0 || init.st_uid == ::geteuid())
+            GTEST_SKIP() << "needs root, or a pid 1 of another user";
+        EXPECT_EQ(check(1), 0) << "1: argument area, 2: task port, 4: record";
+        return;
+    }
+    // As root: a child that gives up root looks at the test process.
+    int32_t parent = ::getpid();
+    HTTestChild child = HTTestChild::fork([&] {
+        if (::setgid(65534) != 0 || ::setuid(65534) != 0) return 100;
+        return check(parent);
+    });
+    int status = 0;
+    ASSERT_EQ(::waitpid(child.pid(), &status, 0), child.pid());
+    child = HTTestChild();
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(WEXITSTATUS(status), 0) << "1: argument area, 2: task port, 4: record";
+}
+
+TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
+{
+    HTLinuxPlatform platform;
+    std::shared_ptr<HTTaskPort> task;
+    ASSERT_EQ(platform.task_for_pid(::getpid(), &task), KERN_SUCCESS);
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(task.get());
+    ASSERT_NE(linuxTask, nullptr);
+    EXPECT_EQ(linuxTask->pid(), ::getpid());
+    // The directory descriptor reads the process's files.
+    EXPECT_EQ(::faccessat(linuxTask->procDirFd(), "smaps", R_OK, 0), 0);
+    EXPECT_GE(linuxTask->pidFd(), 0);
+    int dirFd = linuxTask->procDirFd();
+    task.reset();
+    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle closes its descriptors";
+
+    EXPECT_NE(platform.task_for_pid(0, &task), KERN_SUCCESS);
+    EXPECT_EQ(task, nullptr);
+
+    testing::internal::CaptureStderr();
+    platform.mach_error("task_for_pid", HT_KERN_ERRNO_BASE | ESRCH);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              std::string("task_for_pid: ") + std::strerror(ESRCH) + " (0xe000003)\n");
+    EXPECT_EQ(platform.mach_error_string(MACH_SEND_INVALID_DEST), "process is gone");
+}
+
+TEST(HTLinuxPlatform, SettingsHeftKeepsItself)
+{
+    HTLinuxPlatform platform;
+    const char* name = "vm.self_region_heft";
+    int32_t value = -1;
+    size_t length = sizeof(value);
+    ASSERT_EQ(platform.sysctlbyname(name, &value, &length, nullptr, 0), 0);
+    EXPECT_EQ(value, 0);
+    EXPECT_EQ(length, sizeof(value));
+
+    // A write answers the old value, a later read the new one.
+    int32_t on = 1;
+    length = sizeof(value);
+    ASSERT_EQ(platform.sysctlbyname(name, &value, &length, &on, sizeof(on)), 0);
+    EXPECT_EQ(value, 0);
+    ASSERT_EQ(platform.sysctlbyname(name, &value, &length, nullptr, 0), 0);
+    EXPECT_EQ(value, 1);
+
+    for (const char* absent : {"vm.get_owned_vmobjects", "kern.nothing"}) {
+        errno = 0;
+        length = sizeof(value);
+        EXPECT_EQ(platform.sysctlbyname(absent, &value, &length, nullptr, 0), -1) << absent;
+        EXPECT_EQ(errno, ENOENT) << absent;
+    }
+
+    // No idle-exit control on Linux.
+    uint32_t flags = 7;
+    EXPECT_EQ(platform.proc_get_dirty(::getpid(), &flags), ENOTSUP);
+}
