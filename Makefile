@@ -2,6 +2,9 @@
 JOBS ?= $(shell nproc)
 BUILD_DIR ?= build
 TEST_DIR ?= build-asan
+TSAN_DIR ?= build-tsan
+# The tests that run threads of the gathering.
+TSAN_TESTS ?= HTHeftGather*
 
 .PHONY: all setup build run test bench clean
 
@@ -18,8 +21,12 @@ build: setup
 run: build
 	$(BUILD_DIR)/heft -a
 
-# Builds the suite under AddressSanitizer and UndefinedBehaviorSanitizer and runs it.
+# Runs the parallel gathering under ThreadSanitizer, then builds the whole
+# suite under AddressSanitizer and UndefinedBehaviorSanitizer and runs it.
 test: setup
+	cmake -S . -B $(TSAN_DIR) -DCMAKE_BUILD_TYPE=Debug -DHEFT_SANITIZE=thread
+	cmake --build $(TSAN_DIR) -j $(JOBS) --target heft_tests
+	$(TSAN_DIR)/tests/heft_tests --gtest_filter='$(TSAN_TESTS)'
 	cmake -S . -B $(TEST_DIR) -DCMAKE_BUILD_TYPE=Debug -DHEFT_SANITIZE=address
 	cmake --build $(TEST_DIR) -j $(JOBS)
 	cd $(TEST_DIR) && ctest --output-on-failure -j $(JOBS)

@@ -1,8 +1,26 @@
 #include "analysis/HTHeft.h"
 
+#include "analysis/HTHeftSharingData.h"
+#include "analysis/HTMemoryObjectMap.h"
+#include "analysis/HTProcessGroup.h"
+#include "base/HTAssert.h"
+#include "model/HTAuxDataMap.h"
+#include "model/HTMemoryCategory.h"
+#include "model/HTMemoryObject.h"
+#include "model/HTMemoryRegion.h"
+#include "output/HTOutputFormatter.h"
+#include "platform/HTSignalSource.h"
+#include "platform/HTWorkQueue.h"
+#include "process/HTProcess.h"
+
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <csignal>
 #include <cstdio>
+#include <string>
+#include <unordered_map>
+#include <unordered_set>
 
 namespace {
 
@@ -50,4 +68,438 @@ bool HTHeft::isSharingAnalysisDisabled()
 void HTHeft::setSharingAnalysisDisabled(bool disabled)
 {
     sharingAnalysisDisabled.store(disabled, std::memory_order_relaxed);
+}
+
+// --- setting up --------------------------------------------------------------
+
+namespace {
+
+constexpr uint64_t kAllOnes = UINT64_MAX;
+// Capacity hints of the object maps: most objects are ordinary ones, a
+// process maps one __TEXT and one __LINKEDIT object per image, and the
+// shared cache is cut into a few hundred pieces at most.
+constexpr size_t kObjectsPerProcess = 100;
+constexpr size_t kImageObjectsPerProcess = 2;
+constexpr size_t kSharedCache64Capacity = 512;
+
+// The key under which an object is filed in a category map. An object whose
+// representative region carries no name still holds memory that the table
+// and its total must show, so it is filed under one fixed key rather than
+// left out; an empty key would look like a real, blank name.
+std::string categoryKey(const HTMemoryObject& object, bool summarize)
+{
+    std::optional<std::string> name = summarize ? object.name() : object.fullName();
+    return name ? *std::move(name) : std::string("unknown");
+}
+
+// The category of the key, created with `segment` when absent.
+HTMemoryCategory& categoryFor(HTCategoryMap& categories, const std::string& key, uint8_t segment, bool summarize)
+{
+    if (HTMemoryCategory* found = categories.find(key)) return *found;
+    auto made = std::make_shared<HTMemoryCategory>(segment, summarize);
+    HTMemoryCategory& category = *made;
+    categories.add(key, std::move(made));
+    return category;
+}
+
+}  // namespace
+
+HTHeft::HTHeft(ProcessList processes, std::shared_ptr<HTPlatform> platform)
+    : platform_(std::move(platform)), processes_(std::move(processes))
+{
+    const size_t count = processes_.size();
+    memoryObjects_ = std::make_unique<HTMemoryObjectMap>(count * kObjectsPerProcess);
+    sharedCache64MemoryObjects_ = std::make_unique<HTMemoryObjectMap>(kSharedCache64Capacity);
+    sharedCache32MemoryObjects_ = std::make_unique<HTMemoryObjectMap>();
+    textMemoryObjects_ = std::make_unique<HTMemoryObjectMap>(count * kImageObjectsPerProcess);
+    linkeditMemoryObjects_ = std::make_unique<HTMemoryObjectMap>(count * kImageObjectsPerProcess);
+}
+
+HTHeft::~HTHeft() = default;
+
+std::unique_ptr<HTSignalSource> HTHeft::installCancelHandler(HTPlatform& platform, std::function<void()> callback)
+{
+    // On a terminal Ctrl-C ends the program at once, as the user expects;
+    // with the report going elsewhere it stops the gathering instead, and
+    // the report of what was gathered still follows.
+    if (platform.isatty(1)) return nullptr;
+    return HTSignalSource::create(SIGINT, std::move(callback));
+}
+
+void HTHeft::addOutputFormatter(std::shared_ptr<HTOutputFormatter> formatter)
+{
+    outputFormatters_.push_back(std::move(formatter));
+}
+
+// --- gathering and routing ---------------------------------------------------
+
+void HTHeft::gatherData()
+{
+    // Largest pid first; the routing below keeps the order given.
+    const ProcessList sorted = _processesBySortingPidDesc(processes_);
+    {
+        const unsigned threads =
+            static_cast<unsigned>(std::clamp<size_t>(sorted.size(), 1, HTWorkQueue::defaultThreadCount()));
+        HTWorkQueue queue(kGatherQueueLabel, threads);
+        queue.parallelFor(sorted.size(), [this, &sorted](size_t index) {
+            // A process whose gathering has begun finishes; the rest are
+            // skipped once the run is cancelled.
+            if (earlyExit()) return;
+            sorted[index]->gatherData();
+        });
+    }
+
+    if (earlyExit()) HTProcess::_addGlobalError(kEarlyExitError);
+
+    // Processes skipped by cancellation are routed too, with whatever
+    // regions they have.
+    for (const auto& process : processes_) _addProcess(process);
+    finalizeObjects();
+    _buildProcessToHeftMap();
+}
+
+void HTHeft::_addProcess(const std::shared_ptr<HTProcess>& processPointer)
+{
+    HT_ASSERT("HTHeft", memoryObjects_ != nullptr, "_memoryObjects");
+    HTProcess& process = *processPointer;
+    const bool sharingDisabled = isSharingAnalysisDisabled();
+    const bool breakDown = breakDownPhysHeft(*platform_);
+    const uint64_t pidBits = static_cast<uint64_t>(static_cast<uint32_t>(process.pid())) << 32;
+
+    for (const auto& region : process.memoryRegions()) {
+        uint64_t key;
+        HTMemoryObjectMap* map;
+        if (region->inSharedCache()) {
+            // Shared cache pieces are told apart by address, and the 32-bit
+            // and 64-bit caches are different mappings.
+            key = region->start();
+            map = process.is64bit() ? sharedCache64MemoryObjects_.get() : sharedCache32MemoryObjects_.get();
+        } else {
+            key = region->object_id();
+            if (region->segment() == HTSegmentText)
+                map = textMemoryObjects_.get();
+            else if (region->segment() == HTSegmentLinkEdit)
+                map = linkeditMemoryObjects_.get();
+            else
+                map = memoryObjects_.get();
+        }
+
+        // Copy-on-write memory that a process has touched is that process's
+        // own copy: the pid in the high half keeps it apart from the others'.
+        if (key != kAllOnes && region->share_mode() == SM_COW &&
+            (region->dirtySize() != 0 || region->swappedSize() != 0))
+            key ^= pidBits;
+
+        std::shared_ptr<HTMemoryObject> object;
+        if (key == 0 || key == kAllOnes) {
+            // No identity to share by.
+            object = std::make_shared<HTMemoryObject>();
+            uniqueMemoryObjects_.push_back(object);
+        } else {
+            object = map->objectForKey(key);
+        }
+
+        if (sharingDisabled)
+            object->addRegion(region, process.pageSize());
+        else
+            object->addRegion(region, process);
+        if (breakDown && region->ownedExclusivelyByParentProcess()) object->setOwnerPid(process.pid());
+        region->setMemoryObject(object);
+    }
+}
+
+void HTHeft::finalizeObjects()
+{
+    const bool breakDown = breakDownPhysHeft(*platform_);
+    auto finalizeMap = [breakDown](const std::unique_ptr<HTMemoryObjectMap>& map) {
+        if (!map) return;
+        for (const auto& entry : *map) entry.second->finalize(breakDown);
+    };
+    finalizeMap(memoryObjects_);
+    finalizeMap(sharedCache32MemoryObjects_);
+    finalizeMap(sharedCache64MemoryObjects_);
+    for (const auto& object : uniqueMemoryObjects_) object->finalize(breakDown);
+    finalizeMap(textMemoryObjects_);
+    finalizeMap(linkeditMemoryObjects_);
+}
+
+void HTHeft::releaseMemoryObjectMaps()
+{
+    memoryObjects_.reset();
+    sharedCache64MemoryObjects_.reset();
+    sharedCache32MemoryObjects_.reset();
+    textMemoryObjects_.reset();
+    linkeditMemoryObjects_.reset();
+    uniqueMemoryObjects_.clear();
+    uniqueMemoryObjects_.shrink_to_fit();
+}
+
+// --- heft, categories and orders -------------------------------------------
+
+uint64_t HTHeft::_calculateHeftForProcess(HTProcess& process)
+{
+    uint64_t heft = 0;
+    if (breakDownPhysHeft(*platform_)) {
+        // The kernel's per-region figures already say what this process is
+        // charged, region by region.
+        for (const auto& region : process.memoryRegions()) heft += region->dirtySize() + region->swappedSize();
+        return heft;
+    }
+    // Each object counts once and whole: memory shared with others counts
+    // in full in each of their hefts.
+    std::unordered_set<const HTMemoryObject*> seen;
+    for (const auto& region : process.memoryRegions()) {
+        std::shared_ptr<HTMemoryObject> object = region->memoryObject();
+        if (!object || !seen.insert(object.get()).second) continue;
+        heft += object->totalDirtySize() + object->totalSwappedSize();
+    }
+    return heft;
+}
+
+void HTHeft::_buildProcessToHeftMap()
+{
+    pidToHeft_.clear();
+    for (const auto& process : _notHiddenProcesses())
+        pidToHeft_.set(process->pid(), _calculateHeftForProcess(*process));
+}
+
+HTHeft::ProcessList HTHeft::_notHiddenProcesses() const
+{
+    ProcessList visible;
+    visible.reserve(processes_.size());
+    for (const auto& process : processes_)
+        if (!process->hiddenFromDisplay()) visible.push_back(process);
+    return visible;
+}
+
+HTHeft::ProcessList HTHeft::_processesBySortingPidDesc(const ProcessList& processes)
+{
+    ProcessList sorted = processes;
+    std::stable_sort(sorted.begin(), sorted.end(),
+                     [](const auto& a, const auto& b) { return a->pid() > b->pid(); });
+    return sorted;
+}
+
+HTHeft::ProcessList HTHeft::_processesBySortingHeft(const ProcessList& processes) const
+{
+    struct Ranked {
+        uint64_t heft;
+        std::shared_ptr<HTProcess> process;
+    };
+    std::vector<Ranked> ranked;
+    ranked.reserve(processes.size());
+    for (const auto& process : processes) {
+        const uint64_t* heft = pidToHeft_.find(process->pid());
+        ranked.push_back({heft ? *heft : 0, process});
+    }
+    std::stable_sort(ranked.begin(), ranked.end(), [](const Ranked& a, const Ranked& b) {
+        if (a.heft != b.heft) return a.heft > b.heft;
+        return a.process->pid() > b.process->pid();
+    });
+    ProcessList sorted;
+    sorted.reserve(ranked.size());
+    for (auto& entry : ranked) sorted.push_back(std::move(entry.process));
+    return sorted;
+}
+
+HTCategoryMap HTHeft::_categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
+                                            bool summarize)
+{
+    const bool breakDown = breakDownPhysHeft(*platform_);
+    HTCategoryMap categories;
+    bool ownView = false;
+    for (const auto& object : objects) {
+        const uint8_t segment =
+            object->memoryRegions().empty() ? HTSegmentNotSet : object->memoryRegions().front()->segment();
+        HTMemoryCategory& category = categoryFor(categories, categoryKey(*object, summarize), segment, summarize);
+        std::shared_ptr<HTMemoryObject> view = object->viewForProcess(process, breakDown);
+        if (view != object) ownView = true;
+        category.addMemoryObject(view);
+    }
+    if (hasProcessView) *hasProcessView = ownView;
+    return categories;
+}
+
+HTCategoryMap HTHeft::_categoriesForAllProcessesShouldSummarize(bool summarize)
+{
+    HTCategoryMap categories;
+    std::unordered_set<const HTMemoryObject*> seen;
+    for (const auto& process : _notHiddenProcesses()) {
+        for (const auto& region : process->memoryRegions()) {
+            std::shared_ptr<HTMemoryObject> object = region->memoryObject();
+            if (!object || !seen.insert(object.get()).second) continue;
+            categoryFor(categories, categoryKey(*object, summarize), region->segment(), summarize)
+                .addMemoryObject(object);
+        }
+    }
+    return categories;
+}
+
+void HTHeft::_totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* outTotal)
+{
+    HTMemoryTotals total;
+    for (const auto& [key, category] : categories) {
+        total.dirty += category->totalDirtySize();
+        total.swapped += category->totalSwappedSize();
+        total.clean += category->totalCleanSize();
+        total.reclaimable += category->totalReclaimableSize();
+        total.wired += category->totalWiredSize();
+        total.regions += static_cast<uint32_t>(category->totalRegions());
+    }
+    *outTotal = total;
+}
+
+// --- sharing analysis --------------------------------------------------------
+
+std::unique_ptr<HTHeftSharingData> HTHeft::_sharingData()
+{
+    std::unordered_set<int32_t> visiblePids;
+    for (const auto& process : _notHiddenProcesses()) visiblePids.insert(process->pid());
+
+    // Each object with the set of processes that map it, in the order the
+    // objects are first met, so that the report is the same run after run.
+    std::vector<std::pair<std::shared_ptr<HTMemoryObject>, std::shared_ptr<HTProcessGroup>>> objectGroups;
+    std::unordered_map<const HTMemoryObject*, size_t> objectIndex;
+    for (const auto& process : processes_) {
+        const bool hidden = process->hiddenFromDisplay();
+        for (const auto& region : process->memoryRegions()) {
+            std::shared_ptr<HTMemoryObject> object = region->memoryObject();
+            if (!object) continue;
+            // A hidden process is only of interest where it maps memory that
+            // a reported process owns and that exists beyond any mapping.
+            if (hidden && !(object->ownerPid() != -1 && visiblePids.count(object->ownerPid()) != 0 &&
+                            object->containsFakeRegion()))
+                continue;
+            auto [found, inserted] = objectIndex.emplace(object.get(), objectGroups.size());
+            if (inserted) objectGroups.emplace_back(std::move(object), std::make_shared<HTProcessGroup>());
+            objectGroups[found->second].second->addProcess(process);
+        }
+    }
+
+    // One frozen representative per set of processes. Every group got its
+    // members in the order of `processes`, so equal sets hash alike; the
+    // representative compares itself with the open candidate by members.
+    std::unordered_map<uint64_t, std::vector<std::shared_ptr<HTProcessGroup>>> representatives;
+    representatives.reserve(6 * visiblePids.size());
+    for (auto& entry : objectGroups) {
+        std::shared_ptr<HTProcessGroup>& group = entry.second;
+        auto& bucket = representatives[group->hash()];
+        auto equal = std::find_if(bucket.begin(), bucket.end(),
+                                  [&group](const auto& representative) { return representative->isEqual(*group); });
+        if (equal != bucket.end()) {
+            group = *equal;
+        } else {
+            group->freeze();
+            bucket.push_back(group);
+        }
+    }
+
+    HTHeftSharingData::ProcessToProcessGroups processToProcessGroups;
+    HTProcessGroupObjectMap processGroupToObjects;
+    // A group's members learn of it when it is first met; meeting it again
+    // would change nothing, as an ordered set keeps a group once.
+    std::unordered_set<const HTProcessGroup*> announced;
+    for (const auto& [object, group] : objectGroups) {
+        processGroupToObjects.objectsForGroup(group).insert(object);
+        if (!announced.insert(group.get()).second) continue;
+        const bool isPrivate = group->count() == 1;
+        for (const auto& member : group->processes()) {
+            HTProcessGroupOrderedSet* groups = processToProcessGroups.find(member->pid());
+            if (!groups) {
+                processToProcessGroups.set(member->pid(), HTProcessGroupOrderedSet());
+                groups = processToProcessGroups.find(member->pid());
+            }
+            // A process's private group leads its list.
+            if (isPrivate)
+                groups->insertAtFront(group);
+            else
+                groups->append(group);
+        }
+    }
+    return std::make_unique<HTHeftSharingData>(std::move(processToProcessGroups), std::move(processGroupToObjects));
+}
+
+// --- the report --------------------------------------------------------------
+
+void HTHeft::printSpanlistLikeOutputForProcesses(const ProcessList& processes)
+{
+    FormatterList listing;
+    for (const auto& formatter : outputFormatters_)
+        if (formatter->respondsToSpanlistLikeOutput()) listing.push_back(formatter);
+    if (listing.empty()) return;
+    for (const auto& process : processes)
+        for (const auto& formatter : listing)
+            formatter->printSpanlistLikeOutputForProcess(*process, process->memoryRegions());
+}
+
+void HTHeft::printOutputVerbose(bool verbose, bool summarize)
+{
+    const ProcessList reported = _processesBySortingHeft(_notHiddenProcesses());
+    if (verbose) printSpanlistLikeOutputForProcesses(reported);
+
+    const std::unique_ptr<HTHeftSharingData> sharing = _sharingData();
+    // From here on the sharing result holds every object a reported process
+    // maps; objects that only hidden processes map go with the maps.
+    releaseMemoryObjectMaps();
+
+    ProcessList processesWithWarnings;
+    ProcessList processesWithErrors;
+    std::shared_ptr<HTAuxDataMap> mergedAuxData;
+
+    for (const auto& process : reported) {
+        const bool hasErrors = !process->errors().empty();
+        const std::shared_ptr<HTAuxDataMap> auxData = process->auxData();
+        if (!process->warnings().empty()) processesWithWarnings.push_back(process);
+        if (hasErrors)
+            processesWithErrors.push_back(process);
+        else if (auxData)
+            mergedAuxData = auxData->mergeWithData(mergedAuxData);
+
+        const uint64_t* heft = pidToHeft_.find(process->pid());
+        for (const auto& formatter : outputFormatters_) {
+            formatter->printProcessHeader(*process);
+            if (!hasErrors) formatter->printProcessTotal(heft ? *heft : 0, *process);
+            formatter->endProcessHeader(*process);
+        }
+
+        const HTProcessGroupOrderedSet* groups =
+            hasErrors ? nullptr : sharing->processToProcessGroups().find(process->pid());
+        if (groups) {
+            for (const auto& group : *groups) {
+                static const ObjectSet kNoObjects;
+                const ObjectSet* objects = sharing->processGroupToObjects().find(*group);
+                bool hasProcessView = false;
+                const HTCategoryMap categories =
+                    _categoriesForObjects(objects ? *objects : kNoObjects, *process, &hasProcessView, summarize);
+                HTMemoryTotals total;
+                _totalForCategories(categories, &total);
+                for (const auto& formatter : outputFormatters_) {
+                    if (group->count() == 1)
+                        formatter->printProcessCategories(categories, total);
+                    else
+                        formatter->printSharedCategories(categories, *group, *process, hasProcessView, total);
+                }
+            }
+        } else {
+            const HTCategoryMap noCategories;
+            const HTMemoryTotals zero;
+            for (const auto& formatter : outputFormatters_) formatter->printProcessCategories(noCategories, zero);
+        }
+
+        for (const auto& formatter : outputFormatters_) formatter->printProcessAuxData(auxData);
+    }
+
+    const std::vector<std::string> globalErrors = HTProcess::globalErrors();
+    for (const auto& formatter : outputFormatters_)
+        formatter->printProcessesWithWarnings(processesWithWarnings, processesWithErrors, globalErrors);
+
+    const HTCategoryMap summary = _categoriesForAllProcessesShouldSummarize(summarize);
+    HTMemoryTotals summaryTotal;
+    _totalForCategories(summary, &summaryTotal);
+    const bool hadErrors = !globalErrors.empty() || !processesWithErrors.empty();
+    for (const auto& formatter : outputFormatters_) {
+        formatter->printSummaryCategories(summary, summaryTotal, hadErrors);
+        formatter->printGlobalAuxData(mergedAuxData);
+        formatter->end();
+    }
 }

@@ -1,11 +1,51 @@
 #pragma once
 
+#include "base/HTPidMap.h"
+#include "model/HTCategoryMap.h"
+#include "model/HTIdentitySet.h"
+#include "model/HTMemoryTotals.h"
 #include "platform/HTPlatform.h"
 
-// The analysis driver. For now: the two class-level switches that change
-// how memory is counted, read by the model and the process sources.
+#include <atomic>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <vector>
+
+class HTHeftSharingData;
+class HTMemoryObject;
+class HTMemoryObjectMap;
+class HTOutputFormatter;
+class HTProcess;
+class HTSignalSource;
+
+// The analysis driver. It gathers every target process's regions in
+// parallel, routes every region to the memory object behind it so that
+// memory mapped by several regions or processes counts once, finalises the
+// objects, computes each process's heft, and feeds the report to the
+// attached formatters: every process's private and shared memory, by
+// category, and the summary across processes.
+//
+// An instance gathers once and prints once, on one thread; only cancel()
+// may be called from another thread.
 class HTHeft {
 public:
+    using ProcessList = std::vector<std::shared_ptr<HTProcess>>;
+    using ObjectList = std::vector<std::shared_ptr<HTMemoryObject>>;
+    using ObjectSet = HTIdentitySet<HTMemoryObject>;
+    using FormatterList = std::vector<std::shared_ptr<HTOutputFormatter>>;
+
+    // The label of the gathering threads.
+    static constexpr const char* kGatherQueueLabel = "heft.gatherdata";
+    static constexpr const char* kEarlyExitError =
+        "Heft exited early due to SIGINT and did not finish gathering all data";
+
+    // The targets, in the order given; that order is kept for routing.
+    HTHeft(ProcessList processes, std::shared_ptr<HTPlatform> platform);
+    ~HTHeft();
+    HTHeft(const HTHeft&) = delete;
+    HTHeft& operator=(const HTHeft&) = delete;
+
     // Whether the kernel reports per-region physical heft for this program
     // (the breakdown mode). The value lives in the kernel setting
     // "vm.self_region_heft"; the class caches what it last read.
@@ -16,4 +56,90 @@ public:
     // that no per-process views arise.
     static bool isSharingAnalysisDisabled();
     static void setSharingAnalysisDisabled(bool disabled);
+
+    // With standard output redirected, turns SIGINT into a call of
+    // `callback` on a thread of its own, so that an interrupted run still
+    // writes its report; null when standard output is a terminal, where
+    // Ctrl-C keeps ending the program at once. Cancel the source on the
+    // thread that installed it once gathering is over.
+    static std::unique_ptr<HTSignalSource> installCancelHandler(HTPlatform& platform, std::function<void()> callback);
+
+    const ProcessList& processes() const { return processes_; }
+    // The heft of every visible process, filled by gatherData.
+    const HTPidMap<uint64_t>& pidToHeft() const { return pidToHeft_; }
+
+    // The object maps, null once the report has released them: ordinary
+    // regions by VM object id; shared cache regions of 64-bit and of 32-bit
+    // processes by start address; image __TEXT and __LINKEDIT segments by
+    // VM object id.
+    const HTMemoryObjectMap* memoryObjects() const { return memoryObjects_.get(); }
+    const HTMemoryObjectMap* sharedCache64MemoryObjects() const { return sharedCache64MemoryObjects_.get(); }
+    const HTMemoryObjectMap* sharedCache32MemoryObjects() const { return sharedCache32MemoryObjects_.get(); }
+    const HTMemoryObjectMap* textMemoryObjects() const { return textMemoryObjects_.get(); }
+    const HTMemoryObjectMap* linkeditMemoryObjects() const { return linkeditMemoryObjects_.get(); }
+    // Objects of one region each, never looked up.
+    const ObjectList& uniqueMemoryObjects() const { return uniqueMemoryObjects_; }
+
+    const FormatterList& outputFormatters() const { return outputFormatters_; }
+    void addOutputFormatter(std::shared_ptr<HTOutputFormatter> formatter);
+
+    // Makes gathering skip the processes it has not begun. Safe to call from
+    // any thread, at any time.
+    void cancel() { earlyExit_.store(true, std::memory_order_relaxed); }
+    bool earlyExit() const { return earlyExit_.load(std::memory_order_relaxed); }
+
+    // Gathers every process's data in parallel, largest pid first, then
+    // routes the regions, finalises the objects and computes the hefts.
+    // Called once.
+    void gatherData();
+    // Finalises every memory object once.
+    void finalizeObjects();
+
+    // Sends the report to every formatter. With `verbose`, every process's
+    // region listing comes first; with `summarize`, categories are keyed by
+    // short names. Called once, after gatherData: it releases the object
+    // maps.
+    void printOutputVerbose(bool verbose, bool summarize);
+    void printSpanlistLikeOutputForProcesses(const ProcessList& processes);
+
+protected:
+    // Routes every region of the process to its memory object.
+    void _addProcess(const std::shared_ptr<HTProcess>& process);
+
+    // Which processes map which objects, grouped by sets of processes.
+    std::unique_ptr<HTHeftSharingData> _sharingData();
+
+    // The objects as `process` sees them, in categories. `hasProcessView`,
+    // when given, learns whether any object looked different to this process
+    // than it is as a whole.
+    HTCategoryMap _categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
+                                        bool summarize);
+    // Every object a visible process maps, once, whole.
+    HTCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize);
+    static void _totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* outTotal);
+
+    // Dirty plus swapped bytes charged to the process.
+    uint64_t _calculateHeftForProcess(HTProcess& process);
+    void _buildProcessToHeftMap();
+
+    // The processes that are reported, in the order given.
+    ProcessList _notHiddenProcesses() const;
+    static ProcessList _processesBySortingPidDesc(const ProcessList& processes);
+    // Largest heft first; equal hefts larger pid first.
+    ProcessList _processesBySortingHeft(const ProcessList& processes) const;
+
+private:
+    void releaseMemoryObjectMaps();
+
+    std::shared_ptr<HTPlatform> platform_;
+    ProcessList processes_;
+    HTPidMap<uint64_t> pidToHeft_;
+    std::unique_ptr<HTMemoryObjectMap> memoryObjects_;
+    std::unique_ptr<HTMemoryObjectMap> sharedCache64MemoryObjects_;
+    std::unique_ptr<HTMemoryObjectMap> sharedCache32MemoryObjects_;
+    std::unique_ptr<HTMemoryObjectMap> textMemoryObjects_;
+    std::unique_ptr<HTMemoryObjectMap> linkeditMemoryObjects_;
+    ObjectList uniqueMemoryObjects_;
+    FormatterList outputFormatters_;
+    std::atomic<bool> earlyExit_{false};
 };

@@ -207,7 +207,7 @@ bool HTHeftArgs::_applySort(const char* argument, HTError* error)
 bool HTHeftArgs::_applyFormat(const char* argument, HTError* error)
 {
     static const char* const formats[] = {"bytes", "formatted", "pages"};
-    for (int64_t format = HTSummaryFormatBytes; format <= HTSummaryFormatPages; ++format) {
+    for (int64_t format = HTTextFormatBytes; format <= HTTextFormatPages; ++format) {
         if (std::strcmp(argument, formats[format]) == 0) {
             summaryFormat_ = format;
             return true;

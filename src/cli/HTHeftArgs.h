@@ -3,6 +3,7 @@
 #include "base/HTError.h"
 #include "base/HTPidMap.h"
 #include "cli/HTOrderedStringSet.h"
+#include "output/HTOutputFormatterText.h"
 #include "platform/HTPlatform.h"
 #include "process/HTProcess.h"
 
@@ -25,20 +26,6 @@ enum : int64_t {
     HTHeftErrorCodeSnapfileMode = 6,      // snapfiles disagree on the analysis mode
     HTHeftErrorCodeSnapfileOpen = 7,      // an existing file that is no snapfile and no process
     HTHeftErrorCodeNoTarget = 8,          // nothing to analyse
-};
-
-// textOptions bits.
-enum : int64_t {
-    HTTextOptionWired = 1,
-    HTTextOptionSwapped = 2,
-    HTTextOptionWide = 4,
-};
-
-// summaryFormat values.
-enum : int64_t {
-    HTSummaryFormatBytes = 0,
-    HTSummaryFormatFormatted = 1,
-    HTSummaryFormatPages = 2,
 };
 
 // Everything the command line says: which processes to analyse and which
@@ -131,7 +118,7 @@ private:
     bool didSetShouldGetPhysHeftBreakdown_ = false;
     bool searchForUnmapped_ = false;
     bool excludeSelf_ = true;
-    int64_t summaryFormat_ = HTSummaryFormatFormatted;
+    int64_t summaryFormat_ = HTTextFormatFormatted;
     int64_t textOptions_ = 0;
     std::string textSort_ = defaultSortColumn();
     std::optional<std::string> JSONOutputFile_;

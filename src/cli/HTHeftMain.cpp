@@ -3,6 +3,9 @@
 #include "analysis/HTHeft.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
+#include "output/HTOutputFormatterJSON.h"
+#include "output/HTOutputFormatterText.h"
+#include "platform/HTSignalSource.h"
 
 #include <cstdio>
 
@@ -21,6 +24,32 @@ int reportArgumentError(const HTError& error)
 
 // -a and --unmapped read every process of the system.
 bool needsRoot(const HTHeftArgs& args) { return args.targetAll() || args.searchForUnmapped(); }
+
+// The JSON file is opened before the analysis, so that a path that cannot
+// be written is reported at once; the run then goes on without it.
+std::shared_ptr<HTOutputFormatterJSON> openJSONFormatter(const HTHeftArgs& args, HTPlatform& platform)
+{
+    if (!args.JSONOutputFile()) return nullptr;
+    std::string errorText;
+    auto formatter = HTOutputFormatterJSON::initWithPath(*args.JSONOutputFile(), HTHeft::breakDownPhysHeft(platform),
+                                                         platform.vm_kernel_page_size(), &errorText);
+    if (!formatter) std::fprintf(stderr, "%s\n", errorText.c_str());
+    return formatter;
+}
+
+// Gathers every target; with standard output redirected, SIGINT stops the
+// gathering early and the report of what was gathered still follows.
+void gather(HTHeft& heft, HTPlatform& platform)
+{
+    auto source = HTHeft::installCancelHandler(platform, [&heft] {
+        heft.cancel();
+        std::fprintf(stderr, "Exiting early due to SIGINT\n");
+    });
+    heft.gatherData();
+    // Cancelling restores SIGINT's default action: a second Ctrl-C while
+    // printing ends the program at once.
+    if (source) source->cancel();
+}
 
 }  // namespace
 
@@ -51,6 +80,13 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform)
         return 1;
     }
 
-    // The analysis of the selected processes and the report attach here.
+    auto jsonFormatter = openJSONFormatter(*args, *platform);
+    HTHeft heft(std::move(*targets), platform);
+    gather(heft, *platform);
+
+    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(
+        args->summaryFormat(), args->textOptions(), args->textSort(), HTHeft::breakDownPhysHeft(*platform)));
+    if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
+    heft.printOutputVerbose(args->spanlistLikeOutput(), args->summarize());
     return 0;
 }

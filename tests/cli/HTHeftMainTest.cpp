@@ -61,7 +61,8 @@ TEST_F(HTHeftMainTest, TurnsTheBreakdownModeOnUnlessVmObjectDirty)
 
     result = run({"42"});
     EXPECT_EQ(result.status, 0);
-    EXPECT_EQ(result.standardOutput, "");
+    // The selected process is analysed and reported.
+    EXPECT_NE(result.standardOutput.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << result.standardOutput;
     EXPECT_EQ(result.standardError, "");
     EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 1);
 }

@@ -1,0 +1,393 @@
+#include "output/HTOutputFormatterText.h"
+
+#include "analysis/HTProcessGroup.h"
+#include "base/HTAssert.h"
+#include "model/HTAuxData.h"
+#include "model/HTAuxDataMap.h"
+#include "model/HTCategoryMap.h"
+#include "model/HTMemoryCategory.h"
+#include "model/HTMemoryRegion.h"
+#include "process/HTProcess.h"
+
+#include <bsd/libutil.h>
+
+#include <algorithm>
+#include <functional>
+
+namespace {
+
+constexpr const char* kModule = "HTOutputFormatterText";
+constexpr const char* kEquals = "==========";
+constexpr const char* kDashes = "---";
+
+// Whole pages holding `bytes`, rounded up; no pages without a page size.
+uint64_t pagesForSize(uint64_t bytes, uint64_t pageSize)
+{
+    if (pageSize == 0) return 0;
+    return bytes / pageSize + (bytes % pageSize != 0 ? 1 : 0);
+}
+
+// The sort columns and the rows they order; every comparison is "a comes
+// before b".
+using CategoryOrder = std::function<bool(const HTCategoryMap::Entry&, const HTCategoryMap::Entry&)>;
+
+template <typename Field>
+CategoryOrder descendingBy(Field field)
+{
+    return [field](const HTCategoryMap::Entry& a, const HTCategoryMap::Entry& b) {
+        return field(*a.second) > field(*b.second);
+    };
+}
+
+uint64_t dirtyPlusSwapped(const HTMemoryCategory& category)
+{
+    return category.totalDirtySize() + category.totalSwappedSize();
+}
+
+CategoryOrder orderForSortColumn(const std::string& sort)
+{
+    if (sort == "Dirty") {
+        return [](const HTCategoryMap::Entry& a, const HTCategoryMap::Entry& b) {
+            const HTMemoryCategory& x = *a.second;
+            const HTMemoryCategory& y = *b.second;
+            if (dirtyPlusSwapped(x) != dirtyPlusSwapped(y)) return dirtyPlusSwapped(x) > dirtyPlusSwapped(y);
+            if (x.totalReclaimableSize() != y.totalReclaimableSize())
+                return x.totalReclaimableSize() > y.totalReclaimableSize();
+            return x.totalCleanSize() > y.totalCleanSize();
+        };
+    }
+    if (sort == "Swapped") return descendingBy([](const HTMemoryCategory& c) { return c.totalSwappedSize(); });
+    if (sort == "Clean") return descendingBy([](const HTMemoryCategory& c) { return c.totalCleanSize(); });
+    if (sort == "Reclaimable")
+        return descendingBy([](const HTMemoryCategory& c) { return c.totalReclaimableSize(); });
+    if (sort == "Wired") return descendingBy([](const HTMemoryCategory& c) { return c.totalWiredSize(); });
+    if (sort == "Regions") return descendingBy([](const HTMemoryCategory& c) { return c.totalRegions(); });
+    if (sort == "Category") {
+        // std::string compares characters as unsigned codes.
+        return [](const HTCategoryMap::Entry& a, const HTCategoryMap::Entry& b) { return a.first < b.first; };
+    }
+    HT_FATAL(kModule, "Unhandled text sort column");
+}
+
+}  // namespace
+
+HTOutputFormatterText::HTOutputFormatterText(int64_t summaryFormat, int64_t options, std::string sort,
+                                             bool breakDownPhysHeft, FILE* output)
+    : summaryFormat_(summaryFormat), sort_(std::move(sort)), output_(output), breakDownPhysHeft_(breakDownPhysHeft)
+{
+    setOptions(options);
+}
+
+void HTOutputFormatterText::setOptions(int64_t value)
+{
+    options_ = value;
+    swappedColumnName_.reset();
+    wiredColumnName_.reset();
+    if (options_ & HTTextOptionSwapped) swappedColumnName_ = "(Swapped)";
+    if (options_ & HTTextOptionWired) wiredColumnName_ = "(Wired)";
+}
+
+std::string HTOutputFormatterText::formattedStringForSize(uint64_t size) const
+{
+    char buffer[64];
+    switch (summaryFormat_) {
+    case HTTextFormatBytes:
+        std::snprintf(buffer, sizeof(buffer), "%lld B", static_cast<long long>(size));
+        return buffer;
+    case HTTextFormatFormatted: {
+        // Eight bytes leave room for four digits, a space and a two-letter unit.
+        char humanized[8];
+        humanize_number(humanized, sizeof(humanized), static_cast<int64_t>(size), "B", HN_AUTOSCALE, 0);
+        return humanized;
+    }
+    case HTTextFormatPages:
+        std::snprintf(buffer, sizeof(buffer), "%llu pages",
+                      static_cast<unsigned long long>(pagesForSize(size, pageSize_)));
+        return buffer;
+    default:
+        HT_FATAL(kModule, "Unhandled summary format");
+    }
+}
+
+std::optional<std::string> HTOutputFormatterText::_truncatedNameForString(const std::optional<std::string>& name) const
+{
+    if (!name || (options_ & HTTextOptionWide)) return name;
+    const std::string& whole = *name;
+    size_t end = whole.find_last_not_of('/');
+    // Nothing but slashes (or nothing at all): there is no shorter form.
+    if (end == std::string::npos) return name;
+    size_t slash = whole.rfind('/', end);
+    size_t begin = slash == std::string::npos ? 0 : slash + 1;
+    std::string last = whole.substr(begin, end + 1 - begin);
+    if (last.size() == whole.size()) return name;
+    return ".../" + last;
+}
+
+std::vector<std::string> HTOutputFormatterText::_sortedKeysForCategories(const HTCategoryMap& categories) const
+{
+    CategoryOrder order = orderForSortColumn(sort_);
+    std::vector<HTCategoryMap::Entry> entries(categories.begin(), categories.end());
+    // Stable, so that equal rows keep the map's order and the report does
+    // not change from run to run.
+    std::stable_sort(entries.begin(), entries.end(), order);
+    std::vector<std::string> keys;
+    keys.reserve(entries.size());
+    for (auto& entry : entries) keys.push_back(std::move(entry.first));
+    return keys;
+}
+
+HTOutputFormatterText::ColumnWidths HTOutputFormatterText::columnWidths() const
+{
+    const bool narrow = summaryFormat_ == HTTextFormatFormatted;
+    const int extra = narrow ? 11 : 14;
+    return ColumnWidths{
+        narrow ? 7 : 11,
+        swappedColumnName_ ? extra : 0,
+        narrow ? 11 : 14,
+        narrow ? 13 : 14,
+        wiredColumnName_ ? extra : 0,
+    };
+}
+
+void HTOutputFormatterText::printHeadingRow()
+{
+    const ColumnWidths w = columnWidths();
+    std::fprintf(output_, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, "Dirty", w.swapped,
+                 swappedColumnName_ ? swappedColumnName_->c_str() : "", w.clean, "Clean", w.reclaimable,
+                 "Reclaimable", w.wired, wiredColumnName_ ? wiredColumnName_->c_str() : "", "Regions", "Category");
+}
+
+void HTOutputFormatterText::printDashRow()
+{
+    const ColumnWidths w = columnWidths();
+    std::fprintf(output_, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, kDashes, w.swapped,
+                 swappedColumnName_ ? kDashes : "", w.clean, kDashes, w.reclaimable, kDashes, w.wired,
+                 wiredColumnName_ ? kDashes : "", kDashes, kDashes);
+}
+
+void HTOutputFormatterText::printSizeRow(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable,
+                                         uint64_t wired, long long regions, const std::string& name,
+                                         const std::string& detail)
+{
+    const ColumnWidths w = columnWidths();
+    const std::string swappedText = swappedColumnName_ ? formattedStringForSize(swapped) : "";
+    const std::string wiredText = wiredColumnName_ ? formattedStringForSize(wired) : "";
+    std::fprintf(output_, "%*s%*s%*s%*s%*s %10lld    %s%s\n", w.dirty, formattedStringForSize(dirty).c_str(),
+                 w.swapped, swappedText.c_str(), w.clean, formattedStringForSize(clean).c_str(), w.reclaimable,
+                 formattedStringForSize(reclaimable).c_str(), w.wired, wiredText.c_str(), regions, name.c_str(),
+                 detail.c_str());
+}
+
+void HTOutputFormatterText::_printCategories(const HTCategoryMap& categories)
+{
+    for (const std::string& key : _sortedKeysForCategories(categories)) {
+        const HTMemoryCategory& category = *categories.find(key);
+        std::optional<std::string> name = category.name();
+        std::optional<std::string> detail = _truncatedNameForString(category.detailedName());
+        printSizeRow(category.totalDirtySize() + category.totalSwappedSize(), category.totalSwappedSize(),
+                     category.totalCleanSize(), category.totalReclaimableSize(), category.totalWiredSize(),
+                     category.totalRegions(), name ? *name : key, detail ? " " + *detail : std::string());
+    }
+}
+
+void HTOutputFormatterText::_printTotalFooter(const HTMemoryTotals& total)
+{
+    printDashRow();
+    printSizeRow(total.dirty + total.swapped, total.swapped, total.clean, total.reclaimable, total.wired,
+                 total.regions, "TOTAL", "");
+}
+
+void HTOutputFormatterText::_printPhysHeftBreakdownEnabled()
+{
+    if (!breakDownPhysHeft_) std::fprintf(output_, "VM Object Dirty Analysis: Enabled\n");
+}
+
+void HTOutputFormatterText::printEqualsRule()
+{
+    std::fprintf(output_, "%s%s%s%*s%s%s%*s%s%s", kEquals, kEquals, kEquals, swappedColumnName_ ? 10 : 0,
+                 swappedColumnName_ ? kEquals : "", kEquals, kEquals, wiredColumnName_ ? 10 : 0,
+                 wiredColumnName_ ? kEquals : "", kEquals, kEquals);
+}
+
+void HTOutputFormatterText::printTable(const HTCategoryMap& categories, const HTMemoryTotals& total)
+{
+    printHeadingRow();
+    printDashRow();
+    _printCategories(categories);
+    _printTotalFooter(total);
+}
+
+void HTOutputFormatterText::printProcessCategories(const HTCategoryMap& categories, const HTMemoryTotals& total)
+{
+    printTable(categories, total);
+    std::fputc('\n', output_);
+}
+
+void HTOutputFormatterText::printSharedCategories(const HTCategoryMap& categories, const HTProcessGroup& sharedWith,
+                                                  const HTProcess& forProcess, bool hasProcessView,
+                                                  const HTMemoryTotals& total)
+{
+    const auto& members = sharedWith.processes();
+    if (members.size() < 21) {
+        std::vector<const HTProcess*> others;
+        for (const auto& member : members) {
+            if (!member->isEqual(forProcess)) others.push_back(member.get());
+        }
+        std::fprintf(output_, "Shared with");
+        for (size_t i = 0; i < others.size(); ++i) {
+            std::fprintf(output_, " %s%s", others[i]->displayString().c_str(), i + 1 < others.size() ? "," : "");
+        }
+        std::fprintf(output_, ":\n");
+    } else {
+        std::fprintf(output_, "Shared with %lu processes:\n", static_cast<unsigned long>(members.size()));
+    }
+    printProcessCategories(categories, total);
+}
+
+void HTOutputFormatterText::printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total,
+                                                   bool hadErrors)
+{
+    _printPhysHeftBreakdownEnabled();
+    // A one-process report has said everything in the process's own table.
+    if (processCount_ == 1) return;
+    printEqualsRule();
+    std::fprintf(output_, "\n");
+    std::fprintf(output_, "Summary Heft: %s%s\n", formattedStringForSize(total.dirty + total.swapped).c_str(),
+                 hadErrors ? " (may be invalid due to errors)" : "");
+    printEqualsRule();
+    std::fprintf(output_, "\n\n");
+    printTable(categories, total);
+}
+
+void HTOutputFormatterText::end() { std::fflush(output_); }
+
+void HTOutputFormatterText::printSpanlistLikeOutputForProcess(const HTProcess& process, const RegionList& regions)
+{
+    const bool swapped = swappedColumnName_.has_value();
+    const bool wired = wiredColumnName_.has_value();
+    std::fprintf(output_, "%s\n\n", process.displayString().c_str());
+    std::fprintf(output_,
+                 "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
+                 "(detail)\n",
+                 swapped ? 8 : 0, swapped ? "     SWP" : "", wired ? 8 : 0, wired ? "    WIRE" : "");
+    std::fprintf(output_,
+                 "      ----------         ----------  ----------    -----   -----%*s   -----   -----%*s   "
+                 "------------\n",
+                 swapped ? 8 : 0, swapped ? "   -----" : "", wired ? 8 : 0, wired ? "   -----" : "");
+
+    const uint64_t pageSize = process.pageSize();
+    auto pages = [pageSize](uint64_t bytes) { return static_cast<unsigned long long>(pagesForSize(bytes, pageSize)); };
+    for (const auto& region : regions) {
+        const unsigned long long objectId = region->object_id() & 0xffffffffffULL;
+        if (region->start() != HTNoAddress) {
+            std::fprintf(output_, "%16llx - %16llx [%10llx]", static_cast<unsigned long long>(region->start()),
+                         static_cast<unsigned long long>(region->start() + region->size()), objectId);
+        } else {
+            std::fprintf(output_, "        unmapped -         unmapped [%10llx]", objectId);
+        }
+        std::fprintf(output_, " %7llu %7llu", pages(region->size()),
+                     pages(region->dirtySize() + region->swappedSize()));
+        if (swapped) std::fprintf(output_, " %7llu", pages(region->swappedSize()));
+        std::fprintf(output_, " %7llu %7llu", pages(region->cleanNonSpecSize()), pages(region->reclaimableSize()));
+        if (wired) std::fprintf(output_, " %7llu", pages(region->wiredSize()));
+
+        const std::optional<std::string>& name = region->name();
+        std::optional<std::string> detail = _truncatedNameForString(region->detailedName());
+        std::fprintf(output_, "   %s%s%s\n", name ? name->c_str() : "", detail ? " " : "",
+                     detail ? detail->c_str() : "");
+    }
+    std::fprintf(output_, "\n");
+}
+
+void HTOutputFormatterText::printProcessHeader(const HTProcess& process)
+{
+    if (processCount_ < 2) ++processCount_;
+    pageSize_ = process.pageSize();
+
+    printEqualsRule();
+    std::fprintf(output_, "\n");
+    // The line stays open: without warnings or errors the heft follows on it.
+    std::fprintf(output_, "%s: %s-bit", process.displayString().c_str(), process.is64bit() ? "64" : "32");
+
+    const auto& warnings = process.warnings();
+    if (!warnings.empty()) {
+        std::fprintf(output_, "\nWarnings were encountered while examining the process.\n");
+        for (const auto& warning : warnings) std::fprintf(output_, "\t%s\n", warning.c_str());
+    }
+    const auto errors = process.errors();
+    if (!errors.empty()) {
+        std::fprintf(output_, "\nErrors were encountered while examining the process. No results gathered.\n");
+        for (const auto& error : errors) std::fprintf(output_, "\t%s\n", error.c_str());
+    }
+}
+
+void HTOutputFormatterText::printProcessTotal(uint64_t processHeft, const HTProcess& process)
+{
+    std::fprintf(output_, "\tHeft: %s (%lu bytes per page)\n", formattedStringForSize(processHeft).c_str(),
+                 static_cast<unsigned long>(process.pageSize()));
+}
+
+void HTOutputFormatterText::endProcessHeader(const HTProcess& process)
+{
+    printEqualsRule();
+    std::fprintf(output_, "\n\n");
+}
+
+void HTOutputFormatterText::printProcessesWithWarnings(const ProcessList& processesWithWarnings,
+                                                       const ProcessList& processesWithErrors,
+                                                       const std::vector<std::string>& globalErrors)
+{
+    if (!processesWithWarnings.empty()) {
+        std::fprintf(output_, "\nWarnings were encountered while examining the following processes:\n");
+        for (const auto& process : processesWithWarnings) std::fprintf(output_, "\t%s\n", process->name().c_str());
+    }
+    if (!processesWithErrors.empty()) {
+        std::fprintf(output_, "\nErrors were encountered while examining the following processes:\n");
+        for (const auto& process : processesWithErrors) std::fprintf(output_, "\t%s\n", process->name().c_str());
+    }
+    if (!globalErrors.empty()) {
+        std::fprintf(output_, "\nErrors were encountered:\n");
+        for (const auto& error : globalErrors) std::fprintf(output_, "\t%s\n", error.c_str());
+    }
+    if (!processesWithErrors.empty() || !globalErrors.empty())
+        std::fprintf(output_, "\nDue to errors, summary results may be invalid\n");
+}
+
+void HTOutputFormatterText::printProcessAuxData(const std::shared_ptr<HTAuxDataMap>& auxData)
+{
+    if (!auxData) return;
+    printAuxData(*auxData);
+    std::fprintf(output_, "\n");
+}
+
+void HTOutputFormatterText::printGlobalAuxData(const std::shared_ptr<HTAuxDataMap>& auxData)
+{
+    // A one-process report has printed the same data already.
+    if (processCount_ == 1) return;
+    std::fprintf(output_, "\n");
+    if (auxData && !auxData->empty()) {
+        printAuxData(*auxData);
+        std::fprintf(output_, "\n");
+    }
+}
+
+void HTOutputFormatterText::printAuxData(const HTAuxDataMap& auxData)
+{
+    std::fprintf(output_, "Auxiliary data:\n");
+    _printAuxData(auxData, 1);
+}
+
+void HTOutputFormatterText::_printAuxData(const HTAuxDataMap& auxData, uint32_t indent)
+{
+    for (const auto& [key, value] : auxData) {
+        for (uint32_t i = 0; i < indent; ++i) std::fputc('\t', output_);
+        if (value->isContainer()) {
+            std::fprintf(output_, "%s:\n", key.c_str());
+            _printAuxData(static_cast<const HTAuxDataMap&>(*value), indent + 1);
+        } else {
+            const auto& datum = static_cast<const HTAuxData&>(*value);
+            std::fprintf(output_, "%s: %s\n", key.c_str(),
+                         formattedStringForSize(static_cast<uint64_t>(datum.value())).c_str());
+        }
+    }
+}

@@ -1,0 +1,109 @@
+#pragma once
+
+#include "output/HTOutputFormatter.h"
+
+#include <cstdint>
+#include <cstdio>
+#include <optional>
+#include <string>
+#include <vector>
+
+class HTAuxDataMap;
+
+// Option bits of the text report.
+inline constexpr int64_t HTTextOptionWired = 1;     // show the wired column
+inline constexpr int64_t HTTextOptionSwapped = 2;   // show the swapped column
+inline constexpr int64_t HTTextOptionWide = 4;      // never shorten names
+
+// How the text report writes a size.
+inline constexpr int64_t HTTextFormatBytes = 0;
+inline constexpr int64_t HTTextFormatFormatted = 1;
+inline constexpr int64_t HTTextFormatPages = 2;
+
+// The human-readable report: the region listings, each process's header,
+// its category tables and auxiliary data, the run's diagnostics, and the
+// summary across processes. Sizes are written in bytes, with a unit prefix
+// or in pages after the summary format; the listing always counts pages.
+class HTOutputFormatterText : public HTOutputFormatter {
+public:
+    // `breakDownPhysHeft` is the run-wide counting mode, passed in because a
+    // formatter never asks the platform; with it off the summary says so.
+    HTOutputFormatterText(int64_t summaryFormat, int64_t options, std::string sort, bool breakDownPhysHeft,
+                          FILE* output = stdout);
+
+    int64_t summaryFormat() const { return summaryFormat_; }
+    void setSummaryFormat(int64_t value) { summaryFormat_ = value; }
+    int64_t options() const { return options_; }
+    // Also switches the swapped and wired columns after the new bits.
+    void setOptions(int64_t value);
+    const std::string& sort() const { return sort_; }
+    void setSort(std::string value) { sort_ = std::move(value); }
+    FILE* output() const { return output_; }
+    void setOutput(FILE* value) { output_ = value; }
+    uint64_t pageSize() const { return pageSize_; }
+    void setPageSize(uint64_t value) { pageSize_ = value; }
+    // 0, 1, or 2 for two or more process headers printed.
+    uint8_t processCount() const { return processCount_; }
+    bool breakDownPhysHeft() const { return breakDownPhysHeft_; }
+
+    // A size as the summary format writes it: "16384 B", "16 KB", "4 pages".
+    std::string formattedStringForSize(uint64_t size) const;
+
+    // --- HTOutputFormatter ---------------------------------------------------
+    bool respondsToSpanlistLikeOutput() const override { return true; }
+    void printSpanlistLikeOutputForProcess(const HTProcess& process, const RegionList& regions) override;
+    void printProcessHeader(const HTProcess& process) override;
+    void printProcessTotal(uint64_t processHeft, const HTProcess& process) override;
+    void endProcessHeader(const HTProcess& process) override;
+    void printProcessCategories(const HTCategoryMap& categories, const HTMemoryTotals& total) override;
+    void printSharedCategories(const HTCategoryMap& categories, const HTProcessGroup& sharedWith,
+                               const HTProcess& forProcess, bool hasProcessView,
+                               const HTMemoryTotals& total) override;
+    void printProcessAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
+    void printProcessesWithWarnings(const ProcessList& processesWithWarnings, const ProcessList& processesWithErrors,
+                                    const std::vector<std::string>& globalErrors) override;
+    void printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total,
+                                bool hadErrors) override;
+    void printGlobalAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
+    void end() override;
+
+    // "Auxiliary data:" and the map's keys below it, one tab in.
+    void printAuxData(const HTAuxDataMap& auxData);
+
+protected:
+    // Without the wide option, a path is shortened to ".../" and its last
+    // component; a name without "/" stays whole.
+    std::optional<std::string> _truncatedNameForString(const std::optional<std::string>& name) const;
+    // The keys in row order after the sort column; rows that compare equal
+    // keep the map's order.
+    std::vector<std::string> _sortedKeysForCategories(const HTCategoryMap& categories) const;
+    void _printCategories(const HTCategoryMap& categories);
+    void _printTotalFooter(const HTMemoryTotals& total);
+    void _printPhysHeftBreakdownEnabled();
+    void _printAuxData(const HTAuxDataMap& auxData, uint32_t indent);
+
+private:
+    // The widths of the five size columns, 0 for a column that is off.
+    struct ColumnWidths {
+        int dirty, swapped, clean, reclaimable, wired;
+    };
+    ColumnWidths columnWidths() const;
+    void printHeadingRow();
+    void printDashRow();
+    // One row of five sizes, a region count and a name, with `detail` (which
+    // carries its own leading space) or nothing after it.
+    void printSizeRow(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable, uint64_t wired,
+                      long long regions, const std::string& name, const std::string& detail);
+    void printTable(const HTCategoryMap& categories, const HTMemoryTotals& total);
+    void printEqualsRule();
+
+    uint8_t processCount_ = 0;
+    uint64_t pageSize_ = 0;
+    std::optional<std::string> swappedColumnName_;
+    std::optional<std::string> wiredColumnName_;
+    int64_t summaryFormat_;
+    int64_t options_ = 0;
+    std::string sort_;
+    FILE* output_;
+    bool breakDownPhysHeft_;
+};

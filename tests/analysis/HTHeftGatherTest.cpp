@@ -1,0 +1,166 @@
+// The parallel gathering and its cancellation by SIGINT. These tests start
+// threads and deliver real signals; they also run under ThreadSanitizer.
+
+#include "analysis/HTHeftTestSupport.h"
+#include "platform/HTSignalSource.h"
+#include "platform/HTWorkQueue.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <chrono>
+#include <csignal>
+#include <mutex>
+#include <pthread.h>
+#include <set>
+#include <sys/resource.h>
+#include <sys/syscall.h>
+#include <thread>
+#include <unistd.h>
+
+namespace {
+
+using namespace std::chrono_literals;
+using HTHeftGatherTest = HTAnalysisTest;
+
+int currentThreadNice()
+{
+    return getpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)));
+}
+
+bool sigintBlockedHere()
+{
+    sigset_t mask;
+    pthread_sigmask(SIG_BLOCK, nullptr, &mask);
+    return sigismember(&mask, SIGINT) == 1;
+}
+
+bool sigintHasDefaultAction()
+{
+    struct sigaction action {};
+    sigaction(SIGINT, nullptr, &action);
+    return action.sa_handler == SIG_DFL;
+}
+
+TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
+{
+    HTWorkQueue queue("heft.gatherdata", 3);
+    EXPECT_EQ(queue.threadCount(), 3u);
+    const int callerNice = currentThreadNice();
+    const auto caller = std::this_thread::get_id();
+
+    // Two loops on one pool: workers join each loop afresh.
+    for (size_t count : {size_t{1000}, size_t{7}}) {
+        std::vector<std::atomic<int>> runs(count);
+        std::mutex mutex;
+        std::set<std::string> workerNames;
+        std::set<int> workerNices;
+        queue.parallelFor(count, [&](size_t i) {
+            runs[i].fetch_add(1);
+            if (std::this_thread::get_id() == caller) return;
+            char name[16] = {};
+            pthread_getname_np(pthread_self(), name, sizeof(name));
+            std::lock_guard<std::mutex> lock(mutex);
+            workerNames.insert(name);
+            workerNices.insert(currentThreadNice());
+        });
+        for (size_t i = 0; i < count; ++i) EXPECT_EQ(runs[i].load(), 1) << "index " << i;
+        for (const auto& name : workerNames) EXPECT_EQ(name, "heft.gatherdata");
+        for (int nice : workerNices) EXPECT_EQ(nice, std::min(callerNice + HTWorkQueue::kNiceIncrement, 19));
+    }
+    queue.parallelFor(0, [](size_t) { ADD_FAILURE() << "no iteration expected"; });
+    EXPECT_EQ(currentThreadNice(), callerNice);
+}
+
+TEST(HTHeftGatherSignalSourceTest, DeliversSigintToAThreadAndRestoresItOnCancel)
+{
+    ASSERT_FALSE(sigintBlockedHere());
+    HTGate handled;
+    std::atomic<int> calls{0};
+    std::thread::id handlerThread;
+    auto source = HTSignalSource::create(SIGINT, [&] {
+        handlerThread = std::this_thread::get_id();
+        if (calls.fetch_add(1) == 1) handled.open();
+    });
+    ASSERT_NE(source, nullptr);
+    EXPECT_TRUE(sigintBlockedHere());
+    EXPECT_FALSE(sigintHasDefaultAction());
+
+    // A process-directed signal, as Ctrl-C sends, twice.
+    kill(getpid(), SIGINT);
+    while (calls.load() == 0) std::this_thread::sleep_for(1ms);
+    kill(getpid(), SIGINT);
+    ASSERT_TRUE(handled.waitFor(10s));
+    EXPECT_NE(handlerThread, std::this_thread::get_id());
+
+    source->cancel();
+    EXPECT_EQ(calls.load(), 2);
+    EXPECT_FALSE(sigintBlockedHere());
+    EXPECT_TRUE(sigintHasDefaultAction());
+    source->cancel();  // a second cancel changes nothing
+
+    // Without any signal, cancelling (here by destruction) stops it as well.
+    HTSignalSource::create(SIGINT, [] { ADD_FAILURE() << "no signal was sent"; }).reset();
+    EXPECT_FALSE(sigintBlockedHere());
+}
+
+TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
+{
+    // Every process waits at a gate until the SIGINT handler has cancelled
+    // the run, so at most one process per thread has begun by then; the
+    // first one started sends the signal.
+    const size_t threads = HTWorkQueue::defaultThreadCount() + 1;  // the workers and the caller
+    const size_t count = threads + 3;
+    auto gate = std::make_shared<HTGate>();
+    std::once_flag signalled;
+    auto sendSigint = [&] { std::call_once(signalled, [] { kill(getpid(), SIGINT); }); };
+
+    std::vector<std::shared_ptr<HTScriptedProcess>> scripted;
+    HTHeft::ProcessList processes;
+    for (size_t i = 0; i < count; ++i) {
+        const auto pid = static_cast<int32_t>(100 + i);
+        scripted.push_back(
+            std::make_shared<HTGatedProcess>(platform_, pid, std::vector{dirtyPages(pid, 1)}, gate, sendSigint));
+        processes.push_back(scripted.back());
+    }
+
+    // On a terminal Ctrl-C keeps its default action.
+    platform_->terminals = {1};
+    EXPECT_EQ(HTHeft::installCancelHandler(*platform_, [] {}), nullptr);
+    platform_->terminals.clear();
+
+    HTHeftProbe heft(processes, platform_);
+    std::unique_ptr<HTSignalSource> source = HTHeft::installCancelHandler(*platform_, [&] {
+        heft.cancel();
+        gate->open();
+    });
+    ASSERT_NE(source, nullptr);
+    heft.gatherData();
+    source->cancel();
+    EXPECT_TRUE(sigintHasDefaultAction());
+
+    EXPECT_TRUE(heft.earlyExit());
+    size_t gatheredCount = 0;
+    for (const auto& p : scripted) gatheredCount += p->gatherCount();
+    EXPECT_GE(gatheredCount, 1u);
+    EXPECT_LE(gatheredCount, threads);
+    EXPECT_THAT(HTProcess::globalErrors(), ::testing::ElementsAre(HTHeft::kEarlyExitError));
+
+    // Every process still has its block, and the report ends.
+    auto log = std::make_shared<HTRecordingFormatter::Log>();
+    heft.addOutputFormatter(std::make_shared<HTRecordingFormatter>("X", log));
+    heft.printOutputVerbose(false, false);
+    size_t headers = 0, auxLines = 0;
+    for (const auto& line : *log) {
+        headers += line.rfind("X header", 0) == 0;
+        auxLines += line.rfind("X aux", 0) == 0;
+    }
+    EXPECT_EQ(headers, count);
+    EXPECT_EQ(auxLines, count);
+    EXPECT_THAT(*log, ::testing::Contains(::testing::HasSubstr(HTHeft::kEarlyExitError)));
+    EXPECT_THAT(*log, ::testing::Contains(::testing::HasSubstr("hadErrors")));
+    EXPECT_EQ(log->back(), "X end");
+}
+
+}  // namespace
