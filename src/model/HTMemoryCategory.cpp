@@ -13,7 +13,23 @@ void HTMemoryCategory::addMemoryObject(const std::shared_ptr<HTMemoryObject>& ob
     totalCleanSize_ += object->totalCleanSize();
     totalReclaimableSize_ += object->totalReclaimableSize();
     totalWiredSize_ += object->totalWiredSize();
-    memoryRegions_.unite(object->memoryRegions());
+    // Every region is routed to one memory object; objects that hold the
+    // same regions (an object's copies) share one region set. Counting each
+    // distinct set once therefore counts each region once, without merging
+    // thousands of regions per shared library for every process's table.
+    const RegionSet& regions = object->memoryRegions();
+    if (memberRegionSets_.insert(&regions).second) regionCount_ += regions.size();
+    memoryRegionsBuilt_ = false;
+}
+
+const HTMemoryCategory::RegionSet& HTMemoryCategory::memoryRegions() const
+{
+    if (!memoryRegionsBuilt_) {
+        memoryRegions_ = RegionSet();
+        for (const auto& object : memoryObjects_) memoryRegions_.unite(object->memoryRegions());
+        memoryRegionsBuilt_ = true;
+    }
+    return memoryRegions_;
 }
 
 std::optional<std::string> HTMemoryCategory::name() const

@@ -6,6 +6,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <unordered_set>
 
 class HTMemoryObject;
 class HTMemoryRegion;
@@ -25,7 +26,8 @@ public:
     bool isSummary() const { return isSummary_; }
     uint8_t segment() const { return segment_; }
     const ObjectSet& memoryObjects() const { return memoryObjects_; }
-    const RegionSet& memoryRegions() const { return memoryRegions_; }
+    // The union of the members' regions, built when first asked for.
+    const RegionSet& memoryRegions() const;
 
     uint64_t totalDirtySize() const { return totalDirtySize_; }
     void setTotalDirtySize(uint64_t value) { totalDirtySize_ = value; }
@@ -38,7 +40,7 @@ public:
     uint64_t totalWiredSize() const { return totalWiredSize_; }
     void setTotalWiredSize(uint64_t value) { totalWiredSize_ = value; }
     // Regions shared by several members count once.
-    int32_t totalRegions() const { return static_cast<int32_t>(memoryRegions_.size()); }
+    int32_t totalRegions() const { return static_cast<int32_t>(regionCount_); }
 
     // Adds an object and its totals and regions; an object that is already
     // a member (the same instance) is not counted again.
@@ -61,5 +63,9 @@ private:
     uint64_t totalCleanSize_ = 0;
     uint64_t totalReclaimableSize_ = 0;
     uint64_t totalWiredSize_ = 0;
-    RegionSet memoryRegions_;
+    // Region sets of the members already counted, by identity.
+    std::unordered_set<const RegionSet*> memberRegionSets_;
+    uint64_t regionCount_ = 0;
+    mutable RegionSet memoryRegions_;
+    mutable bool memoryRegionsBuilt_ = true;
 };
