@@ -59,13 +59,7 @@ constexpr std::string_view kReplacementCharacter = "\xEF\xBF\xBD";
 
 std::string formatOpenError(const std::string& path, int error)
 {
-    const char* format = "Unable to open JSON output file '%s': %s";
-    const char* reason = std::strerror(error);
-    int length = std::snprintf(nullptr, 0, format, path.c_str(), reason);
-    std::string text(static_cast<size_t>(length) + 1, '\0');
-    std::snprintf(text.data(), text.size(), format, path.c_str(), reason);
-    text.resize(static_cast<size_t>(length));
-    return text;
+    return "Unable to open JSON output file '" + path + "': " + std::strerror(error);
 }
 
 }  // namespace
