@@ -13,6 +13,8 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <string>
 #include <vector>
@@ -343,6 +345,41 @@ TEST(HTCommandLineE2ETest, SelectingALiveProcessSucceeds)
     EXPECT_EQ(outcome.status, 1);
     EXPECT_EQ(outcome.standardError, kNoProcesses);
     EXPECT_EQ(outcome.standardOutput, "");
+}
+
+}  // namespace
+
+namespace {
+
+// A JSON file that cannot be created is reported before the analysis, and
+// the text report is still written; a writable one receives a document.
+TEST(HTCommandLineE2ETest, JSONFileIsWrittenOrItsFailureReported)
+{
+    IdleChild child;
+    ASSERT_GT(child.pid(), 0);
+    std::string pid = std::to_string(child.pid());
+
+    Outcome outcome = runHeft({"-j", "/nonexistent-heft-dir/out.json", pid});
+    EXPECT_EQ(outcome.status, 0);
+    EXPECT_EQ(outcome.standardError,
+              "Unable to open JSON output file '/nonexistent-heft-dir/out.json': No such file or directory\n");
+    EXPECT_NE(outcome.standardOutput.find(" [" + pid + "]: 64-bit\tHeft: "), std::string::npos);
+
+    char directory[] = "/tmp/heft-json-XXXXXX";
+    ASSERT_NE(mkdtemp(directory), nullptr);
+    std::string path = std::string(directory) + "/out.json";
+    outcome = runHeft({"--json", path, pid});
+    EXPECT_EQ(outcome.status, 0) << outcome.standardError;
+    FILE* file = std::fopen(path.c_str(), "r");
+    ASSERT_NE(file, nullptr);
+    char head[64] = {};
+    size_t length = std::fread(head, 1, sizeof(head) - 1, file);
+    std::fclose(file);
+    EXPECT_EQ(std::string(head, length).rfind("{\"unit\":\"byte\",\"bytes per unit\":1,\"processes\":[{\"name\":", 0),
+              0u)
+        << head;
+    std::remove(path.c_str());
+    rmdir(directory);
 }
 
 }  // namespace
