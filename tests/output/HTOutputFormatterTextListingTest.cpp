@@ -9,6 +9,8 @@
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
+#include "output/HTOutputCapture.h"
+
 #include <gtest/gtest.h>
 
 #include <cstdio>
@@ -21,31 +23,7 @@
 
 namespace {
 
-// Everything written to a memory stream; take() returns what came since the
-// last take().
-class Capture {
-public:
-    Capture() : file_(open_memstream(&data_, &size_)) {}
-    ~Capture()
-    {
-        std::fclose(file_);
-        std::free(data_);
-    }
-    FILE* file() const { return file_; }
-    std::string take()
-    {
-        std::fflush(file_);
-        std::string text(data_ + taken_, size_ - taken_);
-        taken_ = size_;
-        return text;
-    }
-
-private:
-    char* data_ = nullptr;
-    size_t size_ = 0;
-    FILE* file_;
-    size_t taken_ = 0;
-};
+using Capture = HTOutputCapture;
 
 // A process source that failed: errors can only be added from inside.
 class FailedProcess : public HTProcess {

@@ -12,6 +12,8 @@
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
+#include "output/HTOutputCapture.h"
+
 #include <gtest/gtest.h>
 
 #include <cstdio>
@@ -25,31 +27,7 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
-// Everything written to a memory stream; take() returns what came since the
-// last take().
-class Capture {
-public:
-    Capture() : file_(open_memstream(&data_, &size_)) {}
-    ~Capture()
-    {
-        std::fclose(file_);
-        std::free(data_);
-    }
-    FILE* file() const { return file_; }
-    std::string take()
-    {
-        std::fflush(file_);
-        std::string text(data_ + taken_, size_ - taken_);
-        taken_ = size_;
-        return text;
-    }
-
-private:
-    char* data_ = nullptr;
-    size_t size_ = 0;
-    FILE* file_;
-    size_t taken_ = 0;
-};
+using Capture = HTOutputCapture;
 
 // Exposes the protected helpers.
 class TextFormatter : public HTOutputFormatterText {
