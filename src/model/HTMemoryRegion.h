@@ -2,6 +2,7 @@
 
 #include "model/HTMemoryTotals.h"
 #include "model/HTRangeList.h"
+#include "platform/HTPlatformTypes.h"  // share modes
 
 #include <cstdint>
 #include <memory>
@@ -9,16 +10,6 @@
 #include <string>
 
 class HTMemoryObject;
-
-// Share modes of a mapping, as the kernel reports them.
-inline constexpr uint8_t SM_COW = 1;
-inline constexpr uint8_t SM_PRIVATE = 2;
-inline constexpr uint8_t SM_EMPTY = 3;
-inline constexpr uint8_t SM_SHARED = 4;
-inline constexpr uint8_t SM_TRUESHARED = 5;
-inline constexpr uint8_t SM_PRIVATE_ALIASED = 6;
-inline constexpr uint8_t SM_SHARED_ALIASED = 7;
-inline constexpr uint8_t SM_LARGE_PAGE = 8;
 
 // Segment codes, shared by regions, images and categories.
 inline constexpr uint8_t HTSegmentNotSet = 0;

@@ -12,10 +12,27 @@
 #include "platform/HTPlatformTypes.h"
 #include "platform/HTTaskPort.h"
 
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <memory>
+#include <optional>
 #include <string>
+#include <vector>
+
+// One loaded image (executable or library) of a task, with its segments,
+// as the image-inventory service lists it.
+struct HTPlatformImageSegment {
+    std::string name;
+    uint64_t start = 0;
+    uint64_t size = 0;
+};
+struct HTPlatformImage {
+    std::string path;
+    uint64_t baseAddress = 0;
+    std::vector<HTPlatformImageSegment> segments;
+};
 
 class HTPlatform {
 public:
@@ -50,10 +67,64 @@ public:
     // Writes "label: text (0xcode)" and a line feed to standard error.
     virtual void mach_error(const char* label, kern_return_t code) = 0;
 
+    // --- a task's address space ----------------------------------------
+    // The calls below answer "not supported" unless a backend overrides
+    // them, the way a kernel without the facility would.
+    // The region at or after *address, descending into submaps; *count is
+    // VM_REGION_SUBMAP_INFO_COUNT_64 in and the words filled out.
+    // KERN_INVALID_ADDRESS: no region at or above the address;
+    // MACH_SEND_INVALID_DEST: the process has gone away.
+    virtual kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                                 uint32_t* depth, vm_region_submap_info_64* info,
+                                                 uint32_t* count) { return KERN_FAILURE; }
+    // The top-level region at or after *address (flavor
+    // VM_REGION_BASIC_INFO_64).
+    virtual kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                         vm_region_basic_info_64* info, uint32_t* count) { return KERN_FAILURE; }
+    // VM_PURGABLE_GET_STATE of the object at the address.
+    virtual kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
+                                                   int32_t* state) { return KERN_FAILURE; }
+    // One disposition per page of [address, address + size); *count is the
+    // room in and the entries filled out. KERN_INVALID_ARGUMENT when the
+    // process has gone away.
+    virtual kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
+                                                   int32_t* dispositions, uint64_t* count) { return KERN_FAILURE; }
+    // The path of the file mapped at the address: the bytes written (not
+    // terminated), 0 when none.
+    virtual int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) { return 0; }
+
+    // --- per-process figures -------------------------------------------
+    // 0, or -1 and errno.
+    virtual int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) { return unsupported(); }
+    // LEDGER_TEMPLATE_INFO: fills at most *count template entries and sets
+    // *count to the number of entries the template has (capped at the room
+    // given). LEDGER_ENTRY_INFO: the same for the entries of a pid. -1 and
+    // errno on failure.
+    virtual int ledger_template(ledger_template_info* entries, int* count) { return unsupported(); }
+    virtual int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) { return unsupported(); }
+
+    // --- images ----------------------------------------------------------
+    // Calls `callback` once per image of the task; false when the task's
+    // image list cannot be opened.
+    virtual bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
+                                  const std::function<void(const HTPlatformImage&)>& callback) { return false; }
+    // The path with symbolic links resolved; nullopt when it cannot be.
+    virtual std::optional<std::string> realpath(const std::string& path) { return std::nullopt; }
+    // The platform's text for a VM tag, when it has one.
+    virtual std::optional<std::string> describeRegionType(uint32_t tag) { return std::nullopt; }
+
     // --- the calling program -------------------------------------------
     virtual int32_t getpid() = 0;
     virtual uint32_t geteuid() = 0;
     virtual bool isatty(int fd) = 0;
     // Whether stat() succeeds on the path.
     virtual bool stat(const char* path) = 0;
+
+protected:
+    // -1 with errno ENOSYS.
+    static int unsupported()
+    {
+        errno = ENOSYS;
+        return -1;
+    }
 };

@@ -43,6 +43,110 @@ inline constexpr int KERN_PROCARGS2 = 49;
 
 inline constexpr int MAXCOMLEN = 16;
 
+// Share modes of a mapping.
+inline constexpr uint8_t SM_COW = 1;
+inline constexpr uint8_t SM_PRIVATE = 2;
+inline constexpr uint8_t SM_EMPTY = 3;
+inline constexpr uint8_t SM_SHARED = 4;
+inline constexpr uint8_t SM_TRUESHARED = 5;
+inline constexpr uint8_t SM_PRIVATE_ALIASED = 6;
+inline constexpr uint8_t SM_SHARED_ALIASED = 7;
+inline constexpr uint8_t SM_LARGE_PAGE = 8;
+
+// Protection bits.
+inline constexpr uint32_t VM_PROT_READ = 0x1;
+inline constexpr uint32_t VM_PROT_WRITE = 0x2;
+inline constexpr uint32_t VM_PROT_EXECUTE = 0x4;
+
+// Inheritance.
+inline constexpr uint32_t VM_INHERIT_SHARE = 0;
+inline constexpr uint32_t VM_INHERIT_COPY = 1;
+inline constexpr uint32_t VM_INHERIT_NONE = 2;
+
+// Purgeable states and the control that reads one.
+inline constexpr int VM_PURGABLE_GET_STATE = 1;
+inline constexpr int32_t VM_PURGABLE_NONVOLATILE = 0;
+inline constexpr int32_t VM_PURGABLE_VOLATILE = 1;
+inline constexpr int32_t VM_PURGABLE_EMPTY = 2;
+inline constexpr int32_t VM_PURGABLE_DENY = 3;
+
+// Page dispositions.
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_PRESENT = 0x1;
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_DIRTY = 0x8;
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_PAGED_OUT = 0x10;
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_EXTERNAL = 0x80;
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_REUSABLE = 0x800;
+
+// Platform codes of the shared region; 5 is Linux, whose shared region is
+// empty.
+inline constexpr int HTPlatformLinux = 5;
+
+// A region as the address-space walk reports it. The count of a reply is
+// in 32-bit words: a kernel that answers with fewer than the full count
+// leaves out object_id_full.
+inline constexpr uint32_t VM_REGION_SUBMAP_INFO_COUNT_64 = 19;
+struct vm_region_submap_info_64 {
+    uint32_t protection;
+    uint32_t max_protection;
+    uint32_t inheritance;
+    uint64_t offset;
+    uint32_t user_tag;
+    uint32_t pages_resident;
+    uint32_t pages_shared_now_private;
+    uint32_t pages_swapped_out;
+    uint32_t pages_dirtied;
+    uint32_t ref_count;
+    uint16_t shadow_depth;
+    uint8_t external_pager;
+    uint8_t share_mode;
+    uint32_t is_submap;
+    int32_t behavior;
+    uint32_t object_id;
+    uint16_t user_wired_count;
+    uint32_t pages_reusable;
+    uint64_t object_id_full;
+};
+
+// A top-level region, without descending into submaps.
+inline constexpr uint32_t VM_REGION_BASIC_INFO_64 = 9;
+inline constexpr uint32_t VM_REGION_BASIC_INFO_COUNT_64 = 9;
+struct vm_region_basic_info_64 {
+    uint32_t protection;
+    uint32_t max_protection;
+    uint32_t inheritance;
+    uint32_t shared;
+    uint32_t reserved;
+    uint64_t offset;
+    int32_t behavior;
+    uint16_t user_wired_count;
+};
+
+// The resource-usage figures heft reads: the physical heft of a process
+// and its lifetime maximum, in bytes.
+inline constexpr int RUSAGE_INFO_V4 = 4;
+struct rusage_info_v4 {
+    uint64_t ri_phys_heft;
+    uint64_t ri_lifetime_max_phys_heft;
+};
+
+// Ledger records: a template entry names an entry; an entry holds its
+// balance.
+inline constexpr int LEDGER_ENTRY_INFO = 1;
+inline constexpr int LEDGER_TEMPLATE_INFO = 2;
+struct ledger_template_info {
+    char lti_name[32];
+    char lti_group[32];
+    char lti_units[32];
+};
+struct ledger_entry_info {
+    int64_t lei_balance;
+    int64_t lei_credit;
+    int64_t lei_debit;
+    int64_t lei_limit;
+    int64_t lei_refill_period;
+    int64_t lei_last_refill;
+};
+
 // The process information record (136 bytes).
 struct proc_bsdinfo {
     uint32_t pbi_flags;
