@@ -89,6 +89,12 @@ public:
     // process has gone away.
     virtual kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
                                                    int32_t* dispositions, uint64_t* count) { return KERN_FAILURE; }
+    // The address of the first page in [start, end) that is resident or
+    // swapped out, or `end` when there is none. A backend that cannot tell
+    // answers `start`: then no page is skipped. Page queries use it to step
+    // over the unpopulated stretches of huge sparse reservations, whose
+    // pages would all answer no disposition.
+    virtual uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) { return start; }
     // The path of the file mapped at the address: the bytes written (not
     // terminated), 0 when none.
     virtual int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) { return 0; }

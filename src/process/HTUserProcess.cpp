@@ -1,6 +1,178 @@
 #include "process/HTUserProcess.h"
 
+#include "analysis/HTHeft.h"
+#include "base/HTAssert.h"
+#include "model/HTAuxData.h"
+#include "model/HTAuxDataMap.h"
+#include "model/HTMemoryRegion.h"
+#include "process/HTImage.h"
+#include "process/HTImageEnumerator.h"
+
+#include <algorithm>
+#include <cerrno>
 #include <cstdio>
+#include <cstring>
+#include <iterator>
+#include <mutex>
+#include <string_view>
+
+namespace {
+
+constexpr const char* kModule = "HTUserProcess";
+constexpr const char* kOwnedVmObjectsSetting = "vm.get_owned_vmobjects";
+// Room for 16 more owned-object records each time the list is asked for,
+// for objects created between two asks.
+constexpr size_t kOwnedVmObjectsHeadroom = 16 * sizeof(HTOwnedVmObject);
+// The bisection for the end of the private address space stops once its
+// interval is this small.
+constexpr uint64_t kBisectionResolution = 0x1000000;
+constexpr uint32_t kIOKitTag = 87;
+constexpr size_t kRegionPathLength = 1024;
+
+// The shared region that each platform code implies.
+struct SharedRegionLayout {
+    uint64_t base;
+    uint64_t size;
+};
+constexpr SharedRegionLayout kSharedRegions[] = {
+    {0x90000000, 0x20000000},      // 0: 32-bit x86
+    {0x7FFF00000000, 0xFFE00000},  // 1: 64-bit x86
+    {0x40000000, 0x40000000},      // 2: 32-bit ARM
+    {0x180000000, 0x100000000},    // 3: 64-bit ARM
+    {0x1A000000, 0x40000000},      // 4: 64-bit ARM with 32-bit pointers
+    {0, 0},                        // 5: Linux, which has no shared library cache
+};
+
+uint64_t roundDown(uint64_t value, uint64_t unit) { return value / unit * unit; }
+uint64_t roundUp(uint64_t value, uint64_t unit) { return (value + unit - 1) / unit * unit; }
+
+// A page of a shared-cache piece counts as dirty when the kernel says so or
+// when it is resident anonymous memory.
+bool countsAsDirty(int32_t disposition)
+{
+    return (disposition & VM_PAGE_QUERY_PAGE_DIRTY) ||
+           ((disposition & VM_PAGE_QUERY_PAGE_PRESENT) && !(disposition & VM_PAGE_QUERY_PAGE_EXTERNAL));
+}
+
+// Page kinds of sub-ranges.
+enum PageKind { PageNone, PageDirty, PageSwapped, PageReclaimable, PageClean };
+
+PageKind pageKind(int32_t disposition, int32_t purgeState)
+{
+    if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT) return PageSwapped;
+    if (disposition & VM_PAGE_QUERY_PAGE_DIRTY) return PageDirty;
+    // A volatile object may lose any present page; elsewhere only pages
+    // marked reusable can be taken back.
+    int32_t reclaimableBit =
+        purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
+    if (disposition & reclaimableBit) return PageReclaimable;
+    if (disposition & VM_PAGE_QUERY_PAGE_PRESENT) return PageClean;
+    return PageNone;
+}
+
+// strerror_r comes in two flavours; both give the text here.
+[[maybe_unused]] const char* errnoText(int result, const char* buffer) { return result == 0 ? buffer : "Unknown error"; }
+[[maybe_unused]] const char* errnoText(const char* result, const char*) { return result; }
+
+// The ledger template, read once per run by whichever process asks first.
+struct LedgerTemplate {
+    bool read = false;
+    bool known = false;
+    int entryCount = 0;
+    std::optional<size_t> pageTableIndex;
+};
+std::mutex ledgerTemplateLock;
+LedgerTemplate ledgerTemplateState;
+
+LedgerTemplate ledgerTemplate(HTPlatform& platform)
+{
+    std::lock_guard<std::mutex> guard(ledgerTemplateLock);
+    if (ledgerTemplateState.read) return ledgerTemplateState;
+    ledgerTemplateState = LedgerTemplate{};
+    ledgerTemplateState.read = true;
+
+    int room = 80;
+    std::vector<ledger_template_info> entries;
+    int count = 0;
+    while (true) {
+        entries.assign(static_cast<size_t>(room), ledger_template_info{});
+        count = room;
+        if (platform.ledger_template(entries.data(), &count) < 0) {
+            std::perror("Unable to retrieve ledger template info");
+            return ledgerTemplateState;
+        }
+        // A full array may have left entries out.
+        if (count < room) break;
+        room *= 2;
+    }
+    ledgerTemplateState.known = true;
+    ledgerTemplateState.entryCount = count;
+    for (int i = 0; i < count; ++i) {
+        const char* name = entries[static_cast<size_t>(i)].lti_name;
+        if (std::string_view(name, strnlen(name, sizeof(entries[0].lti_name))) == "page_table") {
+            ledgerTemplateState.pageTableIndex = static_cast<size_t>(i);
+            break;
+        }
+    }
+    return ledgerTemplateState;
+}
+
+}  // namespace
+
+// --- owned VM objects ------------------------------------------------------------
+
+uint64_t HTOwnedVmObject::ownedDirtySize() const
+{
+    if (flags & 0x1) return 0;
+    switch ((flags >> 4) & 0x3) {
+    case VM_PURGABLE_VOLATILE:
+    case VM_PURGABLE_EMPTY:
+        return wired_size;
+    default:
+        return resident_size > reusable_size ? resident_size - reusable_size : 0;
+    }
+}
+
+uint64_t HTOwnedVmObject::ownedSwappedSize() const
+{
+    if (flags & 0x1) return 0;
+    switch ((flags >> 4) & 0x3) {
+    case VM_PURGABLE_VOLATILE:
+    case VM_PURGABLE_EMPTY:
+        return 0;
+    default:
+        return compressed_size;
+    }
+}
+
+void HTOwnedVmObjectMap::set(const HTOwnedVmObject& object)
+{
+    auto found = index_.find(object.object_id);
+    if (found != index_.end()) {
+        entries_[found->second] = object;
+        return;
+    }
+    index_.emplace(object.object_id, entries_.size());
+    entries_.emplace_back(object);
+}
+
+std::optional<HTOwnedVmObject> HTOwnedVmObjectMap::take(uint64_t objectId)
+{
+    auto found = index_.find(objectId);
+    if (found == index_.end()) return std::nullopt;
+    std::optional<HTOwnedVmObject> taken;
+    taken.swap(entries_[found->second]);
+    index_.erase(found);
+    return taken;
+}
+
+void HTOwnedVmObjectMap::forEach(const std::function<void(const HTOwnedVmObject&)>& visit) const
+{
+    for (const auto& entry : entries_)
+        if (entry) visit(*entry);
+}
+
+// --- creation ---------------------------------------------------------------------
 
 HTUserProcess::HTUserProcess(std::shared_ptr<HTPlatform> platform) : HTProcess(std::move(platform)) {}
 
@@ -9,7 +181,12 @@ HTUserProcess::~HTUserProcess() = default;
 bool HTUserProcess::initWithBsdInfo(const proc_bsdinfo& info)
 {
     if (!HTProcess::initWithBsdInfo(info)) return false;
+    _setSharedRegionFromPlatform(_platformCode());
+    images_.clear();
+    _gatherPhysHeft();
+    _gatherLedgers();
     _gatherIdleExitStatus();
+    sharedRegionAlignmentSize_ = 4096;
     return true;
 }
 
@@ -31,6 +208,61 @@ bool HTUserProcess::_isAlive()
     return true;
 }
 
+// A live process on Linux maps no shared library cache, whatever its
+// architecture: the Linux code's empty shared region keeps every mapping on
+// the ordinary path. The Mach codes stay for snapshots taken on a system
+// that has such a cache.
+int HTUserProcess::_platformCode()
+{
+    return HTPlatformLinux;
+}
+
+bool HTUserProcess::_setSharedRegionFromPlatform(int platformCode)
+{
+    if (platformCode < 0 || platformCode >= static_cast<int>(std::size(kSharedRegions))) {
+        std::fprintf(stderr, "Unable to determine platform architecture of target\n");
+        return false;
+    }
+    sharedRegionBase_ = kSharedRegions[platformCode].base;
+    sharedRegionSize_ = kSharedRegions[platformCode].size;
+    return true;
+}
+
+// --- figures read at creation and before gathering --------------------------------
+
+void HTUserProcess::_gatherPhysHeft()
+{
+    if (!_isAlive()) return;
+    rusage_info_v4 usage{};
+    if (platform().proc_pid_rusage(pid(), RUSAGE_INFO_V4, &usage) != 0) return;
+    phys_heft_ = usage.ri_phys_heft;
+    phys_heft_peak_ = usage.ri_lifetime_max_phys_heft;
+}
+
+void HTUserProcess::_forgetLedgerTemplate()
+{
+    std::lock_guard<std::mutex> guard(ledgerTemplateLock);
+    ledgerTemplateState = LedgerTemplate{};
+}
+
+void HTUserProcess::_gatherLedgers()
+{
+    if (!breakDownPhysHeft() || !_isAlive()) return;
+    LedgerTemplate layout = ledgerTemplate(platform());
+    if (!layout.known || !layout.pageTableIndex) return;
+
+    std::vector<ledger_entry_info> entries(static_cast<size_t>(layout.entryCount));
+    int count = layout.entryCount;
+    if (platform().ledger_entries(pid(), entries.data(), &count) < 0) {
+        _addErrnoWarningWithDescription("Unable to retrieve ledger entry info");
+        return;
+    }
+    HT_ASSERT(kModule, count >= 0 && *layout.pageTableIndex < static_cast<size_t>(count),
+              "page_table ledger index < entry count");
+    int64_t balance = entries[*layout.pageTableIndex].lei_balance;
+    ledgers_[0] = balance < 0 ? 0 : static_cast<uint64_t>(balance);
+}
+
 void HTUserProcess::_gatherIdleExitStatus()
 {
     // A process whose flags cannot be read is not under idle-exit control.
@@ -48,4 +280,654 @@ void HTUserProcess::_setIdleExitStatusFromDirtyFlags(uint32_t flags)
         setIdleExitStatus(HTIdleExitStatusDirty);
     else
         setIdleExitStatus(HTIdleExitStatusClean);
+}
+
+void HTUserProcess::_gatherImageData()
+{
+    if (!task_) return;
+    images_ = HTImage::gatherImages(platform(), *task_, sharedRegionBase_, sharedRegionSize_);
+}
+
+std::optional<HTOwnedVmObjectMap> HTUserProcess::_gatherOwnedVmObjects()
+{
+    if (!breakDownPhysHeft()) return std::nullopt;
+    const int32_t target = task_ ? task_->pid() : pid();
+
+    size_t length = 0;
+    if (platform().sysctlbyname(kOwnedVmObjectsSetting, nullptr, &length, &target, sizeof(target)) != 0) {
+        // A kernel without the facility: the process owns nothing to report.
+        if (errno != ENOENT) _addErrnoWarningWithDescription(kOwnedVmObjectsSetting);
+        return std::nullopt;
+    }
+    HTOwnedVmObjectMap objects;
+    if (length == 0) return objects;
+
+    // Objects may appear between two asks: ask again while the answer
+    // fills the buffer to the last byte.
+    std::vector<unsigned char> buffer;
+    size_t answered = 0;
+    do {
+        length += kOwnedVmObjectsHeadroom;
+        buffer.resize(length);
+        answered = length;
+        if (platform().sysctlbyname(kOwnedVmObjectsSetting, buffer.data(), &answered, &target, sizeof(target)) !=
+            0) {
+            _addErrnoWarningWithDescription(kOwnedVmObjectsSetting);
+            return std::nullopt;
+        }
+    } while (answered == length);
+
+    if (answered == 0) return objects;
+    HT_ASSERT(kModule, answered >= sizeof(uint64_t), "owned object list holds its count");
+    uint64_t count = 0;
+    std::memcpy(&count, buffer.data(), sizeof(count));
+    HT_ASSERT(kModule, count <= (answered - sizeof(uint64_t)) / sizeof(HTOwnedVmObject),
+              "owned object list holds count records");
+    for (uint64_t i = 0; i < count; ++i) {
+        HTOwnedVmObject object;
+        std::memcpy(&object, buffer.data() + sizeof(uint64_t) + i * sizeof(HTOwnedVmObject), sizeof(object));
+        objects.set(object);
+    }
+    return objects;
+}
+
+// --- diagnostics -------------------------------------------------------------------
+
+void HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
+{
+    const char* suffix = "";
+    bool asWarning = false;
+    if (code == expectedOnExit && _isAlive()) {
+        proc_bsdshortinfo info{};
+        errno = 0;
+        int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
+        if (filled == static_cast<int>(sizeof(info))) {
+            if (info.pbsi_status == SZOMB) {
+                suffix = " (zombie)";
+                asWarning = true;
+            }
+        } else if (filled <= 0 && errno == ESRCH) {
+            suffix = " (process exited)";
+            asWarning = true;
+        }
+    }
+    char message[1024];
+    std::snprintf(message, sizeof(message), "%s: %s%s", displayString().c_str(),
+                  platform().mach_error_string(code).c_str(), suffix);
+    if (asWarning)
+        warnings().push_back(message);
+    else
+        addError(message);
+}
+
+void HTUserProcess::_addErrnoWarningWithDescription(const std::string& description)
+{
+    const int error = errno;
+    char text[256];
+    const char* errorText = errnoText(strerror_r(error, text, sizeof(text)), text);
+    char message[1024];
+    std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), errorText);
+    std::fprintf(stderr, "%s\n", message);
+    warnings().push_back(message);
+}
+
+// --- the address-space walk --------------------------------------------------------
+
+uint64_t HTUserProcess::_lastNonSharedCacheRegion()
+{
+    // With no shared region there is nothing to skip to.
+    if (sharedRegionSize_ == 0 || !task_) return 0;
+    const uint64_t page = pageSize();
+    uint64_t lo = 0;
+    uint64_t hi = sharedRegionBase_;
+    while (true) {
+        uint64_t address = lo / 2 + hi / 2;
+        const uint64_t mid = address;
+        uint64_t size = 0;
+        vm_region_basic_info_64 info{};
+        uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;
+        if (platform().mach_vm_region(*task_, &address, &size, &info, &count) != KERN_SUCCESS) return lo;
+        if (address == lo) return lo;
+        if (address >= sharedRegionBase_)
+            hi = mid > page ? mid - page : 0;
+        else
+            lo = address;
+        if (hi <= lo || hi - lo <= kBisectionResolution) return lo;
+    }
+}
+
+void HTUserProcess::_bailOutOfWalk(const char* label, kern_return_t code)
+{
+    platform().mach_error(label, code);
+    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString().c_str());
+    _processMachVMError(code, MACH_SEND_INVALID_DEST);
+}
+
+void HTUserProcess::enumerateRegions(const RegionCallback& callback)
+{
+    if (!task_) return;
+    HTTaskPort& task = *task_;
+    const uint64_t lastPrivate = _lastNonSharedCacheRegion();
+    const uint64_t sharedEnd = sharedRegionBase_ + sharedRegionSize_;
+    uint64_t address = 0;
+    bool fakeSeen = false;
+
+    while (true) {
+        uint64_t start = address;
+        uint64_t size = 0;
+        vm_region_submap_info_64 info{};
+
+        // Past the private address space, every shared-region mapping is
+        // taken whole with one top-level look-up instead of entry by entry.
+        if (lastPrivate != 0 && lastPrivate <= address && address < sharedEnd) {
+            vm_region_basic_info_64 basic{};
+            uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;
+            uint64_t found = address;
+            kern_return_t result = platform().mach_vm_region(task, &found, &size, &basic, &count);
+            if (result == KERN_INVALID_ADDRESS) return;
+            if (result != KERN_SUCCESS) {
+                _bailOutOfWalk("mach_vm_region", result);
+                return;
+            }
+            start = std::max(found, address);
+            if (start >= lastPrivate && start >= sharedRegionBase_ && start < sharedEnd) {
+                info.protection = basic.protection;
+                info.max_protection = basic.max_protection;
+                info.inheritance = basic.inheritance;
+                info.offset = basic.offset;
+                info.behavior = basic.behavior;
+                info.user_wired_count = basic.user_wired_count;
+                info.external_pager = 1;
+                info.share_mode = SM_COW;
+                info.object_id = 1;
+                info.object_id_full = 1;
+                if (callback(start, size, info, VM_PURGABLE_DENY, std::nullopt)) return;
+                if (start + size <= address) return;
+                address = start + size;
+                continue;
+            }
+        }
+
+        uint64_t found = start;
+        uint32_t depth = 0xFFFFFFFF;
+        uint32_t count = VM_REGION_SUBMAP_INFO_COUNT_64;
+        kern_return_t result = platform().mach_vm_region_recurse(task, &found, &size, &depth, &info, &count);
+        if (result == KERN_INVALID_ADDRESS) return;
+        if (result != KERN_SUCCESS) {
+            _bailOutOfWalk("mach_vm_region_recurse", result);
+            return;
+        }
+        // An older kernel's shorter record has no full object id.
+        if (count < VM_REGION_SUBMAP_INFO_COUNT_64) info.object_id_full = info.object_id;
+        // The kernel's fake regions for owned memory come last.
+        if (fakeSeen && info.user_tag != HTFakeRegionTag) return;
+        start = found;
+
+        int32_t purgeState = VM_PURGABLE_DENY;
+        if (platform().mach_vm_purgable_control(task, start, VM_PURGABLE_GET_STATE, &purgeState) != KERN_SUCCESS)
+            purgeState = VM_PURGABLE_DENY;
+        HT_ASSERT(kModule, !info.is_submap, "!info.is_submap");
+        if (info.user_tag == HTFakeRegionTag) fakeSeen = true;
+
+        std::optional<std::string> path;
+        if (info.external_pager != 0 && _isAlive()) {
+            char buffer[kRegionPathLength];
+            int length = platform().proc_regionfilename(task, start, buffer, sizeof(buffer));
+            if (length > 0) path.emplace(buffer, std::min<size_t>(static_cast<size_t>(length), sizeof(buffer)));
+        }
+
+        if (callback(start, size, info, purgeState, path)) return;
+        // A region of no length would be found again forever.
+        if (start + size <= address) return;
+        address = start + size;
+    }
+}
+
+// --- shared-cache pieces -----------------------------------------------------------
+
+bool HTUserProcess::_addRegionsToArray(std::vector<std::shared_ptr<HTMemoryRegion>>& regions, uint64_t start,
+                                       uint64_t size, const vm_region_submap_info_64& info,
+                                       HTImageEnumerator& enumerator)
+{
+    pendingUnusedSharedRegion_.reset();
+    const uint64_t alignment = sharedRegionAlignmentSize_;
+    const uint64_t page = pageSize();
+    const bool writable = (info.max_protection & VM_PROT_WRITE) != 0;
+    const uint64_t end = start + size;
+
+    auto makePiece = [&](uint64_t from, uint64_t to) {
+        auto piece = std::make_shared<HTMemoryRegion>();
+        piece->setStart(from);
+        piece->setSize(to - from);
+        piece->setUser_tag(info.user_tag);
+        piece->setObject_id(info.object_id_full);
+        piece->setShare_mode(info.share_mode);
+        piece->setOffset(info.offset + (from - start));
+        piece->setInSharedCache(true);
+        piece->setWired(info.user_wired_count != 0);
+        return piece;
+    };
+
+    std::shared_ptr<HTImage> image = enumerator.nextImageForStart(start, end);
+    uint64_t cursor = start;
+    while (cursor < end) {
+        if (!image || cursor < image->start()) {
+            const uint64_t to = image ? std::min(image->start(), end) : end;
+            auto piece = makePiece(cursor, to);
+            piece->setName("unused rtld shared cache area");
+            piece->setUnusedSharedCacheRegion(true);
+            // Only a piece that shares a page with its neighbour needs
+            // measuring; the rest of an unused area holds nothing.
+            if (writable && (cursor % page != 0 || to % page != 0) &&
+                !_populateMemoryRegionWithPageQueries(piece, info))
+                return false;
+            regions.push_back(piece);
+            cursor = to;
+            if (cursor >= end || !image) return true;
+        }
+
+        const uint64_t pieceStart = std::max(cursor, image->start());
+        uint64_t pieceEnd = std::min(image->end(), end);
+        std::shared_ptr<HTImage> next = enumerator.nextImageForStart(pieceEnd, end);
+        if (pieceEnd <= pieceStart) {
+            // An empty segment holds nothing; one the enumerator keeps
+            // answering would hold the walk here for good.
+            if (next == image) return true;
+            image = next;
+            continue;
+        }
+        const uint64_t nextStart = next ? next->start() : 0;
+        // Segments laid out on alignment boundaries own the padding up to
+        // the next boundary.
+        if (next != image && pieceStart % alignment == 0 && nextStart % alignment == 0)
+            pieceEnd = roundUp(pieceEnd, alignment);
+
+        auto piece = makePiece(pieceStart, pieceEnd);
+        piece->setName(image->name());
+        piece->setDetailedName(image->segment() == HTSegmentLinkEdit ? std::string("rtld shared cache")
+                                                                     : image->ownerPath());
+        piece->setSegment(image->segment());
+        if (writable && !_populateMemoryRegionWithPageQueries(piece, info)) return false;
+        regions.push_back(piece);
+        cursor = pieceEnd;
+        image = next;
+    }
+    return true;
+}
+
+// --- page dispositions -------------------------------------------------------------
+
+bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages,
+                                                             const DispositionChunkCallback& block)
+{
+    if (pages == 0) return true;
+    HT_ASSERT(kModule, task_ != nullptr, "task");
+    const uint64_t page = pageSize();
+    int32_t dispositions[kDispositionChunkPages];
+    const uint64_t chunks = (pages + kDispositionChunkPages - 1) / kDispositionChunkPages;
+    uint64_t address = start;
+    uint64_t remaining = pages;
+    const uint64_t end = start + pages * page;
+    // The next page known to hold something; chunks wholly before it hold
+    // nothing and are handed over without a query (as a null array).
+    uint64_t populated = 0;
+    for (uint64_t chunk = 0; chunk < chunks; ++chunk) {
+        const uint64_t wanted = std::min(remaining, kDispositionChunkPages);
+        if (populated < address) populated = platform().firstPopulatedAddress(*task_, address, end);
+        if (populated >= address + wanted * page) {
+            block(nullptr, wanted, chunk, chunks);
+            address += kDispositionChunkPages * page;
+            remaining -= wanted;
+            continue;
+        }
+        uint64_t count = wanted;
+        kern_return_t result =
+            platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
+        if (result != KERN_SUCCESS) {
+            platform().mach_error("mach_vm_page_range_query", result);
+            _processMachVMError(result, KERN_INVALID_ARGUMENT);
+            return false;
+        }
+        block(dispositions, std::min(count, wanted), chunk, chunks);
+        address += kDispositionChunkPages * page;
+        remaining -= wanted;
+    }
+    return true;
+}
+
+bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<HTMemoryRegion>& region,
+                                                         const vm_region_submap_info_64& info)
+{
+    HTMemoryRegion& piece = *region;
+    HT_ASSERT(kModule, piece.dirtySize() == 0, "memoryRegion.dirtySize == 0");
+    HT_ASSERT(kModule, piece.swappedSize() == 0, "memoryRegion.swappedSize == 0");
+    const uint64_t page = pageSize();
+    const uint64_t start = piece.start();
+    const uint64_t end = piece.end();
+    const uint64_t size = piece.size();
+    const uint64_t alignedStart = roundDown(start, page);
+    const uint64_t alignedEnd = roundUp(end, page);
+    // The piece's bytes in its first page.
+    const uint64_t firstPageBytes = std::min(page - (start - alignedStart), size);
+
+    uint64_t dirty = 0;
+    uint64_t swapped = 0;
+    auto count = [&](int32_t disposition, uint64_t amount) {
+        if (countsAsDirty(disposition))
+            dirty += amount;
+        else if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT)
+            swapped += amount;
+    };
+
+    uint64_t pages = (alignedEnd - alignedStart) / page;
+    uint64_t queryStart = alignedStart;
+    // The first page is the last page of the piece before, already queried.
+    const bool firstPageCached = alignedStart == cachedDispositionAddress_;
+    if (firstPageCached) {
+        count(cachedDisposition_, firstPageBytes);
+        --pages;
+        queryStart += page;
+    }
+
+    if (piece.unusedSharedCacheRegion()) {
+        // Unused areas are not queried: only their partial pages, shared
+        // with a neighbour, hold anything, and the neighbour's query
+        // measures them.
+        if (firstPageCached) {
+            piece.setDirtySize(dirty);
+            piece.setSwappedSize(swapped);
+        } else if (start % page != 0) {
+            HT_FATAL(kModule, "Unused shared cache region has no cache entry for non-page-aligned start address");
+        }
+        if (end % page != 0 && pages != 0) pendingUnusedSharedRegion_ = region;
+        return true;
+    }
+
+    const bool ok = _enumerateDispositionChunksWithStartAddr(
+        queryStart, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t) {
+            for (uint64_t i = 0; i < filled; ++i) {
+                const uint64_t index = chunk * kDispositionChunkPages + i;
+                const int32_t disposition = dispositions ? dispositions[i] : 0;
+                const bool partialFirst = index == 0 && !firstPageCached && start % page != 0;
+                const bool partialLast = index == pages - 1 && end % page != 0;
+                uint64_t amount = page;
+                if (partialFirst) {
+                    amount = firstPageBytes;
+                } else if (partialLast) {
+                    amount = end - (alignedEnd - page);
+                    HT_ASSERT(kModule, amount <= size, "lastPageBytes <= memoryRegion.size");
+                }
+                count(disposition, amount);
+
+                if (partialFirst && pendingUnusedSharedRegion_) {
+                    // The unused piece before this one ends in this page.
+                    HTMemoryRegion& pending = *pendingUnusedSharedRegion_;
+                    HT_ASSERT(kModule, pending.end() == start, "pendingUnusedSharedRegion.end == memoryRegion.start");
+                    const uint64_t pendingBytes = pending.end() - roundUp(pending.end(), page) + page;
+                    HT_ASSERT(kModule, pendingBytes <= pending.size(),
+                              "pendingBytes <= pendingUnusedSharedRegion.size");
+                    if (countsAsDirty(disposition))
+                        pending.setDirtySize(pending.dirtySize() + pendingBytes);
+                    else if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT)
+                        pending.setSwappedSize(pending.swappedSize() + pendingBytes);
+                    pendingUnusedSharedRegion_.reset();
+                }
+                if (partialLast) {
+                    // The next piece starts in this page.
+                    cachedDispositionAddress_ = alignedEnd - page;
+                    cachedDisposition_ = disposition;
+                }
+            }
+        });
+    piece.setSwappedSize(swapped);
+    piece.setDirtySize(dirty);
+    return ok;
+}
+
+void HTUserProcess::_addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState)
+{
+    HT_ASSERT(kModule, !region.ownedExclusivelyByParentProcess(), "!memoryRegion.ownedExclusivelyByParentProcess");
+    const uint64_t page = pageSize();
+    const uint64_t from = roundDown(region.start(), page);
+    const uint64_t pages = (roundUp(region.end(), page) - from) / page;
+
+    // The current run of pages of one kind, in the object's offset space.
+    PageKind kind = PageNone;
+    uint64_t location = region.offset();
+    uint64_t length = 0;
+
+    auto addRun = [&]() {
+        HTMemoryTotals totals;
+        switch (kind) {
+        case PageDirty: totals.dirty = length; break;
+        case PageSwapped: totals.swapped = length; break;
+        case PageReclaimable: totals.reclaimable = length; break;
+        case PageClean: totals.clean = length; break;
+        case PageNone: HT_FATAL(kModule, "Tried to add an empty subrange");
+        }
+        if (region.wired()) totals.wired = length;
+        region.addSubrange(location, length, totals, page);
+    };
+    auto step = [&](PageKind next) {
+        if (next != kind && kind != PageNone && length != 0) {
+            addRun();
+            location += length;
+            length = 0;
+        }
+        kind = next;
+        if (kind == PageNone)
+            location += page;
+        else
+            length += page;
+    };
+
+    _enumerateDispositionChunksWithStartAddr(
+        from, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t chunks) {
+            if (dispositions == nullptr) {
+                // A stretch with nothing in it: it ends the current run and
+                // moves the location past itself in one step.
+                step(PageNone);
+                location += (filled - 1) * page;
+            } else {
+                for (uint64_t i = 0; i < filled; ++i) step(pageKind(dispositions[i], purgeState));
+            }
+            // Close the last run.
+            if (chunk + 1 == chunks) step(PageNone);
+        });
+}
+
+// --- gathering ---------------------------------------------------------------------
+
+void HTUserProcess::gatherData()
+{
+    if (!hiddenFromDisplay()) {
+        _gatherImageData();
+        _gatherPhysHeft();
+        ownedVmObjects_ = _gatherOwnedVmObjects();
+    }
+    _gatherMemoryData();
+    images_.clear();
+    images_.shrink_to_fit();
+}
+
+void HTUserProcess::_gatherMemoryData()
+{
+    const uint64_t page = pageSize();
+    HTImageEnumerator enumerator(images_);
+    std::vector<std::shared_ptr<HTMemoryRegion>> regions;
+    const bool hidden = hiddenFromDisplay();
+    const bool breakDown = breakDownPhysHeft();
+    const bool sharingDisabled = HTHeft::isSharingAnalysisDisabled();
+    std::shared_ptr<HTMemoryRegion> fakeRegion;
+    uint64_t ownedTotal = 0;
+
+    enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64& info, int32_t purgeState,
+                         const std::optional<std::string>& path) -> bool {
+        if (start >= sharedRegionBase_ && start - sharedRegionBase_ < sharedRegionSize_) {
+            if (hidden) return false;
+            if (!_addRegionsToArray(regions, start, size, info, enumerator)) {
+                std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
+                             displayString().c_str());
+                return true;
+            }
+            return false;
+        }
+
+        auto region = std::make_shared<HTMemoryRegion>();
+        region->setStart(start);
+        region->setSize(size);
+        region->setUser_tag(info.user_tag);
+        region->setObject_id(info.object_id_full);
+        region->setShare_mode(info.share_mode);
+        region->setOffset(info.offset);
+        region->setInSharedCache(false);
+        region->setWired(info.user_wired_count != 0);
+
+        // Sizes from the kernel's page counts.
+        switch (purgeState) {
+        case VM_PURGABLE_EMPTY:
+            region->setReclaimableSize(size);
+            break;
+        case VM_PURGABLE_VOLATILE:
+            region->setReclaimableSize(page * info.pages_resident);
+            break;
+        default: {
+            const uint64_t resident = info.pages_resident;
+            const uint64_t reusable = info.pages_reusable;
+            // Without the breakdown the kernel's dirtied count of anonymous
+            // memory is not per region; what is resident and not reusable is
+            // dirty there.
+            const uint64_t dirtyPages = info.external_pager == 0 && !breakDown
+                                            ? (resident > reusable ? resident - reusable : 0)
+                                            : info.pages_dirtied;
+            region->setDirtySize(page * dirtyPages);
+            region->setReclaimableSize(page * reusable);
+            region->setSwappedSize(page * static_cast<uint64_t>(info.pages_swapped_out));
+            region->setCleanNonSpecSize(resident > dirtyPages + reusable ? page * (resident - dirtyPages - reusable)
+                                                                         : 0);
+            if (info.user_tag == HTFakeRegionTag) {
+                // The owned-object list accounts for unmapped owned memory
+                // itself when there is one.
+                if (ownedVmObjects_) return false;
+                fakeRegion = region;
+                if (info.object_id_full == 0) region->setObject_id(info.object_id);
+            }
+            break;
+        }
+        }
+
+        // Naming, and the owned objects behind anonymous memory.
+        region->setSegment(HTSegmentNoImage);
+        if (std::shared_ptr<HTImage> image = enumerator.nextImageForStart(start, start + size)) {
+            region->setName(image->name());
+            region->setDetailedName(image->ownerPath());
+            region->setSegment(image->segment());
+        } else if (path || info.external_pager != 0) {
+            region->setName("mapped file");
+            region->setDetailedName(path);
+        } else {
+            region->setName(HTMemoryRegion::categoryNameForTag(info.user_tag));
+            if (breakDown) {
+                bool owned = false;
+                uint64_t ownedDirty = 0;
+                uint64_t ownedSwapped = 0;
+                std::optional<HTOwnedVmObject> object;
+                if (ownedVmObjects_ && (object = ownedVmObjects_->take(info.object_id_full))) {
+                    owned = true;
+                    ownedDirty = object->ownedDirtySize();
+                    ownedSwapped = object->ownedSwappedSize();
+                    region->setReclaimableSize(object->reusable_size);
+                } else if (!ownedVmObjects_ && purgeState != VM_PURGABLE_DENY && info.user_tag != kIOKitTag &&
+                           info.pages_resident != 0) {
+                    // Without the owned-object list, purgeable memory is
+                    // taken to belong to the process that maps it.
+                    owned = true;
+                    ownedDirty = region->dirtySize() + region->cleanNonSpecSize();
+                }
+                if (owned) {
+                    region->setOwnedExclusivelyByParentProcess(true);
+                    ownedTotal += ownedDirty + ownedSwapped;
+                    region->setDirtySize(ownedDirty);
+                    region->setCleanNonSpecSize(0);
+                    region->setSwappedSize(ownedSwapped);
+                }
+            }
+        }
+
+        if (breakDown && !sharingDisabled && !hidden && region->eligibleForSubrangesUsingPageSize(page))
+            _addSubrangesForRegion(*region, purgeState);
+
+        if (region != fakeRegion) regions.push_back(region);
+        return false;
+    });
+
+    // Owned objects that no region maps.
+    if (ownedVmObjects_) {
+        ownedVmObjects_->forEach([&](const HTOwnedVmObject& object) {
+            auto region = std::make_shared<HTMemoryRegion>();
+            region->setObject_id(object.object_id);
+            region->setOwnedExclusivelyByParentProcess(true);
+            region->setUser_tag(HTFakeRegionTag);
+            region->setName(HTMemoryRegion::categoryNameForTag(HTFakeRegionTag));
+            region->setSize(object.virtual_size);
+            region->setReclaimableSize(object.reusable_size);
+            region->setStart(HTNoAddress);
+            region->setShare_mode(SM_SHARED);
+            region->setDirtySize(object.ownedDirtySize());
+            region->setSwappedSize(object.ownedSwappedSize());
+            region->setWired(object.wired_size != 0);
+            regions.push_back(region);
+        });
+        ownedVmObjects_.reset();
+    }
+
+    // The kernel's fake region counts all owned memory that is not mapped,
+    // including what the regions above already charged; take that out.
+    if (fakeRegion) {
+        uint64_t remaining = ownedTotal;
+        if (fakeRegion->dirtySize() < remaining) {
+            remaining -= fakeRegion->dirtySize();
+            fakeRegion->setDirtySize(0);
+            if (fakeRegion->swappedSize() >= remaining) {
+                fakeRegion->setSwappedSize(fakeRegion->swappedSize() - remaining);
+            } else {
+                remaining -= fakeRegion->swappedSize();
+                char message[1024];
+                std::snprintf(message, sizeof(message),
+                              "%s: Heft changed while analyzing \u2013 unmapped owned physical heft may be "
+                              "over-counted by %llu bytes",
+                              displayString().c_str(), static_cast<unsigned long long>(remaining));
+                warnings().push_back(message);
+                fakeRegion->setSwappedSize(0);
+            }
+        } else {
+            fakeRegion->setDirtySize(fakeRegion->dirtySize() - remaining);
+        }
+        if (fakeRegion->dirtySize() + fakeRegion->swappedSize() != 0) {
+            fakeRegion->setStart(HTNoAddress);
+            regions.push_back(fakeRegion);
+        }
+    }
+
+    if (breakDown && ledgers_[0] != 0) {
+        auto pageTables = std::make_shared<HTMemoryRegion>();
+        pageTables->setName("page table");
+        pageTables->setSize(ledgers_[0]);
+        pageTables->setDirtySize(ledgers_[0]);
+        pageTables->setStart(HTNoAddress);
+        pageTables->setObject_id(0xFFFFFFFFFFFFFFFF);
+        pageTables->setShare_mode(SM_PRIVATE);
+        regions.push_back(pageTables);
+    }
+
+    setMemoryRegions(std::move(regions));
+}
+
+std::shared_ptr<HTAuxDataMap> HTUserProcess::auxData()
+{
+    if (phys_heft_ == 0) return nullptr;
+    auto data = std::make_shared<HTAuxDataMap>();
+    data->set("phys_heft", std::make_shared<HTAuxData>(static_cast<int64_t>(phys_heft_), false));
+    data->set("phys_heft_peak", std::make_shared<HTAuxData>(static_cast<int64_t>(phys_heft_peak_), false));
+    return data;
 }

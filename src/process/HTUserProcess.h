@@ -2,30 +2,176 @@
 
 #include "process/HTProcess.h"
 
+#include <array>
 #include <cstdint>
+#include <functional>
 #include <memory>
+#include <optional>
+#include <string>
+#include <unordered_map>
+#include <vector>
 
-// A live user-space process, read through its task port.
+class HTImage;
+class HTImageEnumerator;
+class HTMemoryRegion;
+
+// One VM object the process owns, as the kernel reports it.
+struct HTOwnedVmObject {
+    uint64_t object_id = 0;
+    uint64_t virtual_size = 0;
+    uint64_t resident_size = 0;
+    uint64_t wired_size = 0;
+    uint64_t reusable_size = 0;
+    uint64_t compressed_size = 0;
+    // Bit 0: not counted in the owner's heft; bits 4-5: purgeable state.
+    uint64_t flags = 0;
+
+    // The dirty and swapped bytes the object charges to its owner.
+    uint64_t ownedDirtySize() const;
+    uint64_t ownedSwappedSize() const;
+};
+static_assert(sizeof(HTOwnedVmObject) == 56, "the kernel's owned-object record is seven 64-bit words");
+
+// The owned VM objects under their ids. Entries iterate in the order the
+// kernel listed them; taking one out leaves the others in place.
+class HTOwnedVmObjectMap {
+public:
+    // Stores the record; a repeated id replaces the earlier record in place.
+    void set(const HTOwnedVmObject& object);
+    // Removes the record under the id and returns it, if there is one.
+    std::optional<HTOwnedVmObject> take(uint64_t objectId);
+    size_t size() const { return index_.size(); }
+    // Calls `visit` with every record left, in listing order.
+    void forEach(const std::function<void(const HTOwnedVmObject&)>& visit) const;
+
+private:
+    struct KeyHash {
+        size_t operator()(uint64_t key) const { return static_cast<size_t>(key >> 8); }
+    };
+    std::vector<std::optional<HTOwnedVmObject>> entries_;
+    std::unordered_map<uint64_t, size_t, KeyHash> index_;
+};
+
+// A live user-space process, read through its task port. Creation opens the
+// port and reads the first figures (physical heft, page-table ledger,
+// idle-exit state); gatherData lists the images and owned objects, walks the
+// address space and turns every mapping into regions.
+//
+// Subclasses that read a process some other way (a snapfile, a corpse)
+// replace the small hook operations: the walk, _isAlive and the _gather...
+// steps.
 class HTUserProcess : public HTProcess {
 public:
+    // Receives one region of the walk: start, size, the kernel's record,
+    // the purgeable state and the mapped file's path. Returns true to stop.
+    using RegionCallback = std::function<bool(uint64_t start, uint64_t size, const vm_region_submap_info_64& info,
+                                              int32_t purgeState, const std::optional<std::string>& path)>;
+    // Receives one chunk of page dispositions: the entries, how many are
+    // valid, the chunk's index and the number of chunks. Null entries mean
+    // that no page of the chunk holds anything (every disposition is 0).
+    using DispositionChunkCallback =
+        std::function<void(const int32_t* dispositions, uint64_t count, uint64_t chunk, uint64_t chunks)>;
+
+    // Page dispositions are queried in chunks of at most this many pages.
+    static constexpr uint64_t kDispositionChunkPages = 4096;
+
     explicit HTUserProcess(std::shared_ptr<HTPlatform> platform);
     ~HTUserProcess() override;
 
-    // The base steps, then the idle-exit status.
+    // The base steps, then the shared region, the physical heft, the
+    // page-table ledger and the idle-exit status.
     bool initWithBsdInfo(const proc_bsdinfo& info) override;
 
     // Opens the task port; on failure reports it on standard error and in
     // the global error list, and the process is not created.
     bool _populateTask() override;
     bool _isAlive() override;
+    // Images, physical heft and owned objects (unless hidden), then the
+    // regions.
+    void gatherData() override;
+    // "phys_heft" and "phys_heft_peak", or null when the physical heft is 0.
+    std::shared_ptr<HTAuxDataMap> auxData() override;
 
+    // Calls `callback` once per region of the address space, in ascending
+    // address order.
+    virtual void enumerateRegions(const RegionCallback& callback);
+
+    // --- fields ----------------------------------------------------------
     // Null until _populateTask succeeded.
     const std::shared_ptr<HTTaskPort>& task() const { return task_; }
+    uint64_t sharedRegionBase() const { return sharedRegionBase_; }
+    uint64_t sharedRegionSize() const { return sharedRegionSize_; }
+    uint32_t sharedRegionAlignmentSize() const { return sharedRegionAlignmentSize_; }
+    void setSharedRegionAlignmentSize(uint32_t value) { sharedRegionAlignmentSize_ = value; }
+    uint64_t phys_heft() const { return phys_heft_; }
+    void setPhys_heft(uint64_t value) { phys_heft_ = value; }
+    uint64_t phys_heft_peak() const { return phys_heft_peak_; }
+    void setPhys_heft_peak(uint64_t value) { phys_heft_peak_ = value; }
+    // The balance of the "page_table" ledger entry, in bytes.
+    const std::array<uint64_t, 1>& ledgers() const { return ledgers_; }
 
 protected:
+    // The ledger template is read once per run; this makes the next process
+    // read it again (for a kernel scripted anew).
+    static void _forgetLedgerTemplate();
+
+    // The platform code whose shared region the process maps.
+    virtual int _platformCode();
+    // Sets the shared region from the platform code; false, with a message
+    // on standard error, for a code it does not know.
+    bool _setSharedRegionFromPlatform(int platformCode);
+    // The start of a region below the shared region, near the last one; 0
+    // when none was found or the shared region is empty.
+    uint64_t _lastNonSharedCacheRegion();
+    // Cuts one mapping of the shared region into image pieces and unused
+    // pieces and appends them; false when a page query failed.
+    bool _addRegionsToArray(std::vector<std::shared_ptr<HTMemoryRegion>>& regions, uint64_t start, uint64_t size,
+                            const vm_region_submap_info_64& info, HTImageEnumerator& enumerator);
+
+    // Queries the dispositions of `pages` pages from `start`, in chunks;
+    // false (with the error recorded) when a query failed.
+    bool _enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages,
+                                                  const DispositionChunkCallback& block);
+    // Measures a shared-cache piece page by page; false when a query failed.
+    virtual bool _populateMemoryRegionWithPageQueries(const std::shared_ptr<HTMemoryRegion>& region,
+                                                      const vm_region_submap_info_64& info);
+    // Breaks the region into runs of pages of one kind.
+    virtual void _addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState);
+
+    // Records a failed kernel call as an error, or as a warning when the
+    // process has exited or is a zombie and `expectedOnExit` was returned.
+    void _processMachVMError(kern_return_t code, kern_return_t expectedOnExit);
+    // Records a warning built from errno, and writes it to standard error.
+    void _addErrnoWarningWithDescription(const std::string& description);
+
+    // --- hooks -------------------------------------------------------------
+    virtual void _gatherImageData();
+    virtual void _gatherPhysHeft();
+    virtual void _gatherLedgers();
+    virtual std::optional<HTOwnedVmObjectMap> _gatherOwnedVmObjects();
     virtual void _gatherIdleExitStatus();
     void _setIdleExitStatusFromDirtyFlags(uint32_t flags);
 
+    // Builds memoryRegions from the walk, the owned objects and the ledger.
+    void _gatherMemoryData();
+
+    // The images of the process, sorted by start; filled while gathering.
+    std::vector<std::shared_ptr<HTImage>>& images() { return images_; }
+
 private:
+    // Reports a failed region look-up and ends the walk's data there.
+    void _bailOutOfWalk(const char* label, kern_return_t code);
+
     std::shared_ptr<HTTaskPort> task_;
+    uint64_t sharedRegionBase_ = 0;
+    uint64_t sharedRegionSize_ = 0;
+    uint32_t sharedRegionAlignmentSize_ = 0;
+    uint64_t phys_heft_ = 0;
+    uint64_t phys_heft_peak_ = 0;
+    std::array<uint64_t, 1> ledgers_{};
+    std::vector<std::shared_ptr<HTImage>> images_;
+    std::optional<HTOwnedVmObjectMap> ownedVmObjects_;
+    uint64_t cachedDispositionAddress_ = 0;
+    int32_t cachedDisposition_ = 0;
+    std::shared_ptr<HTMemoryRegion> pendingUnusedSharedRegion_;
 };

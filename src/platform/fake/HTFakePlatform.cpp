@@ -78,7 +78,7 @@ int HTFakePlatform::proc_listallpids(int32_t* buffer, int bufferSize)
 int HTFakePlatform::proc_pidinfo(int32_t pid, int flavor, uint64_t, void* buffer, int bufferSize)
 {
     Process* found = process(pid);
-    if (found == nullptr) {
+    if (found == nullptr || found->exited) {
         errno = ESRCH;
         return 0;
     }
@@ -141,6 +141,7 @@ int HTFakePlatform::sysctl(const int* name, unsigned nameLength, void* oldp, siz
 
 int HTFakePlatform::sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
 {
+    if (std::strcmp(name, "vm.get_owned_vmobjects") == 0) return ownedVmObjects(oldp, oldlenp, newp, newlen);
     auto found = sysctlValues.find(name);
     if (found == sysctlValues.end()) {
         errno = ENOENT;
@@ -181,4 +182,242 @@ std::string HTFakePlatform::mach_error_string(kern_return_t code)
 void HTFakePlatform::mach_error(const char* label, kern_return_t code)
 {
     machErrors.push_back(std::string(label) + ": " + mach_error_string(code));
+}
+
+// --- address spaces ----------------------------------------------------------
+
+size_t HTFakePlatform::regionIndexAtOrAfter(const Process& process, uint64_t address)
+{
+    size_t index = 0;
+    while (index < process.regions.size() &&
+           process.regions[index].start + process.regions[index].size <= address)
+        ++index;
+    return index;
+}
+
+kern_return_t HTFakePlatform::regionFailure(const Process& process, size_t index)
+{
+    if (process.regionFailureIndex && index >= *process.regionFailureIndex) return process.regionFailureCode;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTFakePlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                                     uint32_t* depth, vm_region_submap_info_64* info, uint32_t* count)
+{
+    ++regionLookups;
+    Process* found = process(task.pid());
+    if (found == nullptr) return MACH_SEND_INVALID_DEST;
+    size_t index = regionIndexAtOrAfter(*found, *address);
+    if (kern_return_t failure = regionFailure(*found, index); failure != KERN_SUCCESS) return failure;
+    if (index == found->regions.size()) return KERN_INVALID_ADDRESS;
+
+    const Region& region = found->regions[index];
+    *address = region.start;
+    *size = region.size;
+    *depth = 0;
+    *info = region.info;
+    *count = std::min(*count, region.infoCount);
+    if (*count < VM_REGION_SUBMAP_INFO_COUNT_64) info->object_id_full = 0;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTFakePlatform::mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                             vm_region_basic_info_64* info, uint32_t* count)
+{
+    ++basicRegionLookups;
+    Process* found = process(task.pid());
+    if (found == nullptr) return MACH_SEND_INVALID_DEST;
+    size_t index = regionIndexAtOrAfter(*found, *address);
+    if (kern_return_t failure = regionFailure(*found, index); failure != KERN_SUCCESS) return failure;
+    if (index == found->regions.size()) return KERN_INVALID_ADDRESS;
+
+    const Region& region = found->regions[index];
+    *address = region.start;
+    *size = region.size;
+    *info = vm_region_basic_info_64{};
+    info->protection = region.info.protection;
+    info->max_protection = region.info.max_protection;
+    info->inheritance = region.info.inheritance;
+    info->shared = region.info.share_mode == SM_SHARED || region.info.share_mode == SM_TRUESHARED;
+    info->offset = region.info.offset;
+    info->behavior = region.info.behavior;
+    info->user_wired_count = region.info.user_wired_count;
+    *count = VM_REGION_BASIC_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTFakePlatform::mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
+                                                       int32_t* state)
+{
+    Process* found = process(task.pid());
+    if (found == nullptr) return MACH_SEND_INVALID_DEST;
+    if (control != VM_PURGABLE_GET_STATE) return KERN_INVALID_ARGUMENT;
+    size_t index = regionIndexAtOrAfter(*found, address);
+    if (index == found->regions.size() || found->regions[index].start > address) return KERN_INVALID_ADDRESS;
+    const Region& region = found->regions[index];
+    if (!region.purgeState) return KERN_INVALID_ARGUMENT;
+    *state = *region.purgeState;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTFakePlatform::mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
+                                                       int32_t* dispositions, uint64_t* count)
+{
+    pageQueries.emplace_back(address, size);
+    Process* found = process(task.pid());
+    if (found == nullptr) return KERN_INVALID_ARGUMENT;
+    if (found->pageQueryFailureAddress && *found->pageQueryFailureAddress >= address &&
+        *found->pageQueryFailureAddress - address < size)
+        return found->pageQueryFailureCode;
+
+    uint64_t pages = std::min(*count, (size + pageSize - 1) / pageSize);
+    for (uint64_t i = 0; i < pages; ++i) {
+        auto disposition = found->dispositions.find(address + i * pageSize);
+        dispositions[i] = disposition == found->dispositions.end() ? 0 : disposition->second;
+    }
+    *count = pages;
+    return KERN_SUCCESS;
+}
+
+uint64_t HTFakePlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end)
+{
+    Process* found = process(task.pid());
+    // A process that is gone, or whose page queries are to fail, cannot be
+    // scanned either: nothing is skipped and the query meets the failure.
+    if (found == nullptr || found->pageQueryFailureAddress) return start;
+    for (auto page = found->dispositions.lower_bound(start); page != found->dispositions.end() && page->first < end;
+         ++page) {
+        if (page->second != 0) return page->first;
+    }
+    return end;
+}
+
+int HTFakePlatform::proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize)
+{
+    Process* found = process(task.pid());
+    if (found == nullptr) return 0;
+    size_t index = regionIndexAtOrAfter(*found, address);
+    if (index == found->regions.size() || found->regions[index].start > address) return 0;
+    const std::optional<std::string>& path = found->regions[index].path;
+    if (!path) return 0;
+    size_t length = std::min<size_t>(path->size(), bufferSize);
+    std::memcpy(buffer, path->data(), length);
+    return static_cast<int>(length);
+}
+
+// --- per-process figures -----------------------------------------------------
+
+int HTFakePlatform::proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info)
+{
+    Process* found = process(pid);
+    if (found == nullptr || found->exited) {
+        errno = ESRCH;
+        return -1;
+    }
+    if (!found->rusage || flavor != RUSAGE_INFO_V4) {
+        errno = ENOTSUP;
+        return -1;
+    }
+    *info = *found->rusage;
+    return 0;
+}
+
+int HTFakePlatform::ledger_template(ledger_template_info* entries, int* count)
+{
+    ++ledgerTemplateReads;
+    if (!ledgerTemplate) {
+        errno = ledgerTemplateErrno;
+        return -1;
+    }
+    int filled = std::min(*count, static_cast<int>(ledgerTemplate->size()));
+    for (int i = 0; i < filled; ++i) {
+        entries[i] = ledger_template_info{};
+        const std::string& name = (*ledgerTemplate)[static_cast<size_t>(i)];
+        std::memcpy(entries[i].lti_name, name.data(), std::min(name.size(), sizeof(entries[i].lti_name)));
+    }
+    *count = filled;
+    return 0;
+}
+
+int HTFakePlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int* count)
+{
+    Process* found = process(pid);
+    if (found == nullptr || found->exited) {
+        errno = ESRCH;
+        return -1;
+    }
+    if (!found->ledgerBalances) {
+        errno = found->ledgerErrno;
+        return -1;
+    }
+    int filled = std::min(*count, static_cast<int>(found->ledgerBalances->size()));
+    for (int i = 0; i < filled; ++i) {
+        entries[i] = ledger_entry_info{};
+        entries[i].lei_balance = (*found->ledgerBalances)[static_cast<size_t>(i)];
+    }
+    *count = filled;
+    return 0;
+}
+
+// The kernel answers an unsigned 64-bit count, then that many records of
+// seven unsigned 64-bit words. A buffer too small for all of them is filled
+// with as many whole records as fit and reported full, so that the caller
+// asks again with more room.
+int HTFakePlatform::ownedVmObjects(void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
+{
+    if (newp == nullptr || newlen != sizeof(int32_t) || oldlenp == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
+    int32_t pid = 0;
+    std::memcpy(&pid, newp, sizeof(pid));
+    Process* found = process(pid);
+    if (found == nullptr) {
+        errno = ESRCH;
+        return -1;
+    }
+    if (found->ownedVmObjectsErrno != 0) {
+        errno = found->ownedVmObjectsErrno;
+        return -1;
+    }
+    if (!found->ownedVmObjects) {
+        errno = ENOENT;
+        return -1;
+    }
+
+    static_assert(sizeof(OwnedVmObject) == 56, "an owned-object record is seven 64-bit words");
+    const std::vector<OwnedVmObject>& objects = *found->ownedVmObjects;
+    const size_t needed = sizeof(uint64_t) + objects.size() * sizeof(OwnedVmObject);
+    if (oldp == nullptr) {
+        *oldlenp = found->ownedVmObjectsLengthHint.value_or(needed);
+        return 0;
+    }
+    if (*oldlenp < sizeof(uint64_t)) {
+        errno = ENOMEM;
+        return -1;
+    }
+    size_t fitting = std::min(objects.size(), (*oldlenp - sizeof(uint64_t)) / sizeof(OwnedVmObject));
+    uint64_t count = fitting;
+    auto* bytes = static_cast<unsigned char*>(oldp);
+    std::memcpy(bytes, &count, sizeof(count));
+    if (fitting != 0) std::memcpy(bytes + sizeof(count), objects.data(), fitting * sizeof(OwnedVmObject));
+    if (fitting == objects.size()) *oldlenp = needed;
+    return 0;
+}
+
+// --- images ------------------------------------------------------------------
+
+bool HTFakePlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
+                                      const std::function<void(const HTPlatformImage&)>& callback)
+{
+    Process* found = process(task.pid());
+    if (found == nullptr || found->imageListFails) return false;
+    for (const auto& image : found->images) callback(image);
+    return true;
+}
+
+std::optional<std::string> HTFakePlatform::realpath(const std::string& path)
+{
+    auto found = realpaths.find(path);
+    return found == realpaths.end() ? path : found->second;
 }

@@ -1,9 +1,11 @@
 #pragma once
 
 // A platform whose every answer a test scripts: processes with their
-// records, paths and flags, sysctl values, files that exist, and who the
-// caller is. Calls that were not scripted fail the way the real kernel
-// fails for something that is not there.
+// records, paths and flags, their address spaces (regions, page
+// dispositions, injected failures), their per-process figures, sysctl
+// values, files that exist, and who the caller is. Calls that were not
+// scripted fail the way the real kernel fails for something that is not
+// there.
 
 #include "platform/HTPlatform.h"
 
@@ -12,10 +14,37 @@
 #include <optional>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 class HTFakePlatform : public HTPlatform {
 public:
+    // One region of a scripted address space. Regions are listed in
+    // ascending address order and do not overlap.
+    struct Region {
+        uint64_t start = 0;
+        uint64_t size = 0;
+        vm_region_submap_info_64 info{};
+        // proc_regionfilename's answer; none answers 0 bytes.
+        std::optional<std::string> path;
+        // mach_vm_purgable_control's answer; none makes the call fail.
+        std::optional<int32_t> purgeState;
+        // The words mach_vm_region_recurse reports filled; fewer than the
+        // full count leaves object_id_full out.
+        uint32_t infoCount = VM_REGION_SUBMAP_INFO_COUNT_64;
+    };
+
+    // One owned VM object as "vm.get_owned_vmobjects" reports it.
+    struct OwnedVmObject {
+        uint64_t object_id = 0;
+        uint64_t virtual_size = 0;
+        uint64_t resident_size = 0;
+        uint64_t wired_size = 0;
+        uint64_t reusable_size = 0;
+        uint64_t compressed_size = 0;
+        uint64_t flags = 0;
+    };
+
     struct Process {
         proc_bsdinfo info{};
         // The executable path of the process's argument area; nullopt makes
@@ -27,6 +56,40 @@ public:
         int dirtyErrno = ENOTSUP;
         // task_for_pid's answer.
         kern_return_t taskResult = KERN_SUCCESS;
+        // Once set, every proc_pidinfo flavor answers ESRCH: the process
+        // has exited, though its task port is still held.
+        bool exited = false;
+
+        // --- address space --------------------------------------------
+        std::vector<Region> regions;
+        // Page dispositions by page address; pages not listed answer 0.
+        std::map<uint64_t, int32_t> dispositions;
+        // Region look-ups (recursive and basic) whose answer would be the
+        // region at this index or a later one, or no region at all, fail
+        // with regionFailureCode instead.
+        std::optional<size_t> regionFailureIndex;
+        kern_return_t regionFailureCode = MACH_SEND_INVALID_DEST;
+        // A page query whose range holds this address fails with
+        // pageQueryFailureCode.
+        std::optional<uint64_t> pageQueryFailureAddress;
+        kern_return_t pageQueryFailureCode = KERN_INVALID_ARGUMENT;
+
+        // --- per-process figures ----------------------------------------
+        // proc_pid_rusage's answer; none fails with ENOTSUP.
+        std::optional<rusage_info_v4> rusage;
+        // The balances of the ledger entries, in template order; none
+        // fails with ledgerErrno.
+        std::optional<std::vector<int64_t>> ledgerBalances;
+        int ledgerErrno = ENOTSUP;
+        // "vm.get_owned_vmobjects"; none fails with ENOENT, as on a kernel
+        // without the facility. A non-zero errno fails every ask with it.
+        std::optional<std::vector<OwnedVmObject>> ownedVmObjects;
+        int ownedVmObjectsErrno = 0;
+        // The length the first ask (without a buffer) answers, when it is
+        // to differ from the true one (objects appearing in between).
+        std::optional<size_t> ownedVmObjectsLengthHint;
+        std::vector<HTPlatformImage> images;
+        bool imageListFails = false;
     };
 
     // Adds a process with the given identity; returns it for further
@@ -46,6 +109,18 @@ public:
     std::set<std::string> existingFiles;
     std::map<std::string, int32_t> sysctlValues;  // sysctlbyname integers; absent: ENOENT
     std::vector<std::string> machErrors;          // what mach_error wrote
+    // The ledger template's entry names; none fails with ledgerTemplateErrno.
+    // Unscripted, the template has no entries, so no ledger is read.
+    std::optional<std::vector<std::string>> ledgerTemplate = std::vector<std::string>{};
+    int ledgerTemplateErrno = ENOTSUP;
+    int ledgerTemplateReads = 0;
+    // realpath: the mapped paths; any other path resolves to itself.
+    std::map<std::string, std::string> realpaths;
+
+    // Every page query made, as (address, bytes), in call order.
+    std::vector<std::pair<uint64_t, uint64_t>> pageQueries;
+    int regionLookups = 0;       // mach_vm_region_recurse calls
+    int basicRegionLookups = 0;  // mach_vm_region calls
 
     int proc_listallpids(int32_t* buffer, int bufferSize) override;
     int proc_pidinfo(int32_t pid, int flavor, uint64_t arg, void* buffer, int bufferSize) override;
@@ -57,12 +132,35 @@ public:
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(const char* label, kern_return_t code) override;
+    kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
+                                         vm_region_submap_info_64* info, uint32_t* count) override;
+    kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
+                                 uint32_t* count) override;
+    kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
+    uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) override;
+    kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
+                                           uint64_t* count) override;
+    int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
+    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
+    int ledger_template(ledger_template_info* entries, int* count) override;
+    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
+    bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
+                          const std::function<void(const HTPlatformImage&)>& callback) override;
+    std::optional<std::string> realpath(const std::string& path) override;
     int32_t getpid() override { return ownPid; }
     uint32_t geteuid() override { return euid; }
     bool isatty(int fd) override { return terminals.count(fd) != 0; }
     bool stat(const char* path) override { return existingFiles.count(path) != 0; }
 
 private:
+    // The scripted region at or after the address: its index, or the
+    // number of regions when there is none.
+    static size_t regionIndexAtOrAfter(const Process& process, uint64_t address);
+    // The region look-up's failure for the answer at `index`, if one is
+    // scripted; KERN_SUCCESS otherwise.
+    static kern_return_t regionFailure(const Process& process, size_t index);
+    int ownedVmObjects(void* oldp, size_t* oldlenp, const void* newp, size_t newlen);
+
     // In the order added: the listing order.
     std::vector<int32_t> order_;
     std::map<int32_t, Process> processes_;

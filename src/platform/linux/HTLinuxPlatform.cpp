@@ -1,16 +1,22 @@
 #include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTPagemapScan.h"
 
 #include "platform/HTMachErrorText.h"
+#include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/linux/HTPageDisposition.h"
 #include "platform/linux/HTProcArgs.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
+#include "platform/linux/HTProcStatusParser.h"
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <charconv>
 #include <climits>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <dirent.h>
 #include <elf.h>
@@ -77,6 +83,43 @@ void closeKeepingErrno(int fd)
     errno = savedErrno;
 }
 
+// Whether the process behind a /proc/PID descriptor has exited: it is gone
+// (its files vanish) or a zombie (its files read empty).
+bool processHasExited(int dirfd)
+{
+    thread_local HTProcBuffer buffer;
+    if (!buffer.readFile(dirfd, "stat")) return errno == ESRCH || errno == ENOENT;
+    std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
+    return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x';
+}
+
+bool meansGone(int error)
+{
+    return error == ESRCH || error == ENOENT;
+}
+
+// Reads up to `length` bytes at `offset`, retrying short reads; the bytes
+// read, or -1 with errno when the first read fails.
+ssize_t preadFully(int fd, void* buffer, size_t length, uint64_t offset)
+{
+    size_t done = 0;
+    while (done < length) {
+        ssize_t count = ::pread(fd, static_cast<char*>(buffer) + done, length - done,
+                                static_cast<off_t>(offset + done));
+        if (count < 0) {
+            if (errno == EINTR) continue;
+            if (done == 0) return -1;
+            break;
+        }
+        if (count == 0) break;
+        done += static_cast<size_t>(count);
+    }
+    return static_cast<ssize_t>(done);
+}
+
+// Pages a page query reads at once: 32 KiB of pagemap.
+constexpr size_t kPageQueryChunk = 4096;
+
 }  // namespace
 
 HTLinuxPlatform::HTLinuxPlatform()
@@ -90,6 +133,7 @@ HTLinuxPlatform::HTLinuxPlatform()
 HTLinuxPlatform::~HTLinuxPlatform()
 {
     if (procFd_ >= 0) ::close(procFd_);
+    if (kpageflagsFd_ >= 0) ::close(kpageflagsFd_);
 }
 
 int HTLinuxPlatform::openProcessDirectory(int32_t pid) const
@@ -462,4 +506,265 @@ bool HTLinuxPlatform::stat(const char* path)
 {
     struct stat status {};
     return ::stat(path, &status) == 0;
+}
+
+kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
+{
+    if (!refresh && task.hasParsedVmas()) return KERN_SUCCESS;
+    // Reused by every walk on this thread; it keeps the size of the largest
+    // smaps read so far (megabytes for a big process).
+    thread_local HTProcBuffer smaps;
+    // Once a new read fails, what was read before no longer describes the
+    // process.
+    if (!smaps.readFile(task.procDirFd(), "smaps")) {
+        int error = errno;
+        task.clearVmas();
+        return meansGone(error) ? MACH_SEND_INVALID_DEST : HT_KERN_ERRNO_BASE | error;
+    }
+    // A zombie's smaps opens but reads empty: it has no address space left.
+    if (smaps.size() == 0 && processHasExited(task.procDirFd())) {
+        task.clearVmas();
+        return MACH_SEND_INVALID_DEST;
+    }
+    task.parseVmas(smaps.view());
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                                      uint32_t* depth, vm_region_submap_info_64* info,
+                                                      uint32_t* count)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr || address == nullptr || size == nullptr || info == nullptr || count == nullptr)
+        return KERN_INVALID_ARGUMENT;
+    // A walk starts at address 0: that is when the mappings are read anew.
+    kern_return_t loaded = loadVmas(*linuxTask, *address == 0);
+    if (loaded != KERN_SUCCESS) return loaded;
+    const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(*address);
+    if (vma == nullptr) return KERN_INVALID_ADDRESS;
+    // Linux has no submaps: the depth stays as it was.
+    *info = htSubmapInfo(*vma, linuxTask->pid(), vm_kernel_page_size());
+    *address = vma->start;
+    *size = vma->size();
+    *count = VM_REGION_SUBMAP_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTLinuxPlatform::mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                              vm_region_basic_info_64* info, uint32_t* count)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr || address == nullptr || size == nullptr || info == nullptr || count == nullptr)
+        return KERN_INVALID_ARGUMENT;
+    kern_return_t loaded = loadVmas(*linuxTask, *address == 0);
+    if (loaded != KERN_SUCCESS) return loaded;
+    const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(*address);
+    if (vma == nullptr) return KERN_INVALID_ADDRESS;
+    *info = htBasicInfo(*vma);
+    *address = vma->start;
+    *size = vma->size();
+    *count = VM_REGION_BASIC_INFO_COUNT_64;
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTLinuxPlatform::mach_vm_purgable_control(HTTaskPort&, uint64_t, int, int32_t*)
+{
+    return KERN_INVALID_ARGUMENT;
+}
+
+int HTLinuxPlatform::kpageflagsFd()
+{
+    // Readable only with the right to see physical pages (root); without
+    // it every page query follows the pagemap-only rules.
+    std::call_once(kpageflagsOnce_, [this] { kpageflagsFd_ = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC); });
+    return kpageflagsFd_;
+}
+
+kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
+                                                        int32_t* dispositions, uint64_t* count)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr || dispositions == nullptr || count == nullptr) return KERN_INVALID_ARGUMENT;
+    const uint64_t pageSize = vm_kernel_page_size();
+    if (address > UINT64_MAX - pageSize || size > UINT64_MAX - pageSize - address) return KERN_INVALID_ARGUMENT;
+    const uint64_t firstPage = address / pageSize;
+    const uint64_t pages = std::min((address + size + pageSize - 1) / pageSize - firstPage, *count);
+
+    // The mappings tell shared memory and hugetlbfs pages apart.
+    kern_return_t loaded = loadVmas(*linuxTask, false);
+    if (loaded == MACH_SEND_INVALID_DEST) return KERN_INVALID_ARGUMENT;
+    if (loaded != KERN_SUCCESS) return loaded;
+    int pagemap = linuxTask->pagemapFd();
+    if (pagemap < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+    int pageFlagsFd = kpageflagsFd();
+
+    thread_local std::array<uint64_t, kPageQueryChunk> entries;
+    thread_local std::array<uint64_t, kPageQueryChunk> pageFlags;
+    thread_local std::array<bool, kPageQueryChunk> pageFlagsKnown;
+    const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
+    size_t vmaIndex = 0;
+
+    for (uint64_t done = 0; done < pages;) {
+        size_t chunk = static_cast<size_t>(std::min<uint64_t>(kPageQueryChunk, pages - done));
+        uint64_t chunkPage = firstPage + done;
+        ssize_t bytes = preadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), chunkPage * sizeof(uint64_t));
+        if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+        size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
+        if (read < chunk) {
+            // A process without an address space reads nothing; a live one
+            // reads short only past the top of the user address space,
+            // where no page is mapped.
+            if (processHasExited(linuxTask->procDirFd())) return KERN_INVALID_ARGUMENT;
+            std::fill(entries.begin() + static_cast<ptrdiff_t>(read), entries.begin() + static_cast<ptrdiff_t>(chunk),
+                      0);
+        }
+
+        // The flags of physical pages, one read for each run of
+        // consecutive frame numbers.
+        std::fill(pageFlagsKnown.begin(), pageFlagsKnown.begin() + static_cast<ptrdiff_t>(chunk), false);
+        if (pageFlagsFd >= 0) {
+            for (size_t at = 0; at < chunk;) {
+                uint64_t frame = htPagemapFrame(entries[at]);
+                if (frame == 0) {
+                    ++at;
+                    continue;
+                }
+                size_t runEnd = at + 1;
+                while (runEnd < chunk && htPagemapFrame(entries[runEnd]) == frame + (runEnd - at)) ++runEnd;
+                ssize_t flagBytes = preadFully(pageFlagsFd, pageFlags.data() + at, (runEnd - at) * sizeof(uint64_t),
+                                               frame * sizeof(uint64_t));
+                size_t known = flagBytes > 0 ? static_cast<size_t>(flagBytes) / sizeof(uint64_t) : 0;
+                std::fill(pageFlagsKnown.begin() + static_cast<ptrdiff_t>(at),
+                          pageFlagsKnown.begin() + static_cast<ptrdiff_t>(at + known), true);
+                at = runEnd;
+            }
+        }
+
+        for (size_t at = 0; at < chunk; ++at) {
+            uint64_t pageAddress = (chunkPage + at) * pageSize;
+            while (vmaIndex < vmas.size() && vmas[vmaIndex].end <= pageAddress) ++vmaIndex;
+            HTPageMapping mapping;
+            if (vmaIndex < vmas.size() && vmas[vmaIndex].start <= pageAddress) {
+                mapping.sharedMemory = vmas[vmaIndex].isSharedMemory();
+                mapping.hugetlb = vmas[vmaIndex].hasFlag(HTVmFlagHugetlb);
+            }
+            dispositions[done + at] =
+                htPageDisposition(entries[at], pageFlagsKnown[at] ? &pageFlags[at] : nullptr, mapping);
+        }
+        done += chunk;
+    }
+    *count = pages;
+    return KERN_SUCCESS;
+}
+
+int HTLinuxPlatform::proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr || buffer == nullptr || bufferSize == 0) return 0;
+    if (loadVmas(*linuxTask, false) != KERN_SUCCESS) return 0;
+    const HTSmapsEntry* vma = linuxTask->vmaContaining(address);
+    // Pseudo-paths such as "[heap]" name no file.
+    if (vma == nullptr || vma->path.empty() || vma->path.front() != '/') return 0;
+    size_t length = std::min<size_t>(vma->path.size(), bufferSize);
+    std::memcpy(buffer, vma->path.data(), length);
+    return static_cast<int>(length);
+}
+
+bool HTLinuxPlatform::readStatus(int32_t pid, HTProcStatus& status)
+{
+    if (procFd_ < 0) {
+        errno = procErrno_;
+        return false;
+    }
+    if (pid <= 0) {
+        errno = ESRCH;
+        return false;
+    }
+    char path[48];
+    formatPidPath(path, pid, "/status");
+    thread_local HTProcBuffer buffer;
+    if (!buffer.readFile(procFd_, path)) {
+        if (errno == ENOENT) errno = ESRCH;
+        return false;
+    }
+    status = htParseProcStatus(buffer.view());
+    // A zombie's status has no memory lines: its address space is gone.
+    if (!status.hasMemoryFigures()) {
+        errno = ESRCH;
+        return false;
+    }
+    return true;
+}
+
+int HTLinuxPlatform::proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info)
+{
+    if (flavor != RUSAGE_INFO_V4 || info == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
+    HTProcStatus status;
+    if (!readStatus(pid, status)) return -1;
+    *info = rusage_info_v4{};
+    info->ri_phys_heft = *status.rssAnon + *status.vmSwap + *status.vmPTE;
+    // The peak resident set leaves out swap and page tables: a process with
+    // much swapped out can be above its resident peak now, and a peak is
+    // never below the present.
+    info->ri_lifetime_max_phys_heft = std::max(*status.vmHWM, info->ri_phys_heft);
+    return 0;
+}
+
+int HTLinuxPlatform::ledger_template(ledger_template_info* entries, int* count)
+{
+    if (count == nullptr || *count < 0 || (entries == nullptr && *count > 0)) {
+        errno = EINVAL;
+        return -1;
+    }
+    if (*count == 0) return 0;
+    entries[0] = ledger_template_info{};
+    std::snprintf(entries[0].lti_name, sizeof(entries[0].lti_name), "%s", "page_table");
+    std::snprintf(entries[0].lti_group, sizeof(entries[0].lti_group), "%s", "physmem");
+    std::snprintf(entries[0].lti_units, sizeof(entries[0].lti_units), "%s", "bytes");
+    *count = 1;
+    return 0;
+}
+
+int HTLinuxPlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int* count)
+{
+    if (count == nullptr || *count < 0 || (entries == nullptr && *count > 0)) {
+        errno = EINVAL;
+        return -1;
+    }
+    HTProcStatus status;
+    if (!readStatus(pid, status)) return -1;
+    if (*count == 0) return 0;
+    entries[0] = ledger_entry_info{};
+    entries[0].lei_balance = static_cast<int64_t>(*status.vmPTE);
+    entries[0].lei_credit = entries[0].lei_balance;
+    entries[0].lei_limit = INT64_MAX;
+    *count = 1;
+    return 0;
+}
+
+std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path)
+{
+    char* resolved = ::realpath(path.c_str(), nullptr);
+    if (resolved == nullptr) return std::nullopt;
+    std::string result(resolved);
+    std::free(resolved);
+    return result;
+}
+
+bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
+                                       const std::function<void(const HTPlatformImage&)>& callback)
+{
+    return imageReader_.forEachTaskImage(static_cast<HTLinuxTaskPort&>(task), callback);
+}
+
+uint64_t HTLinuxPlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr) return start;
+    int pagemap = linuxTask->pagemapFd();
+    if (pagemap < 0) return start;
+    return htPagemapFirstPopulated(pagemap, start, end).value_or(start);
 }

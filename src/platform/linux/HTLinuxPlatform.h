@@ -2,13 +2,18 @@
 
 // The platform calls answered from Linux's /proc. Every call may run on
 // any thread: reads go through per-thread buffers and the only shared
-// state is the /proc descriptor and the breakdown setting.
+// state is the /proc and /proc/kpageflags descriptors and the breakdown
+// setting. A task handle is used by one thread at a time.
 
 #include "platform/HTPlatform.h"
+#include "platform/linux/HTElfImageReader.h"
 
 #include <atomic>
 #include <cstdint>
 #include <mutex>
+
+class HTLinuxTaskPort;
+struct HTProcStatus;
 
 class HTLinuxPlatform : public HTPlatform {
 public:
@@ -33,6 +38,39 @@ public:
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(const char* label, kern_return_t code) override;
+    // The address-space calls read /proc/PID/smaps once per walk (when the
+    // walk starts at address 0, or the handle has no mappings yet) and
+    // answer from the parsed mappings. A process that is gone or a zombie
+    // answers MACH_SEND_INVALID_DEST; no mapping at or above the address
+    // KERN_INVALID_ADDRESS; other failures HT_KERN_ERRNO_BASE | errno.
+    kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
+                                         vm_region_submap_info_64* info, uint32_t* count) override;
+    kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
+                                 vm_region_basic_info_64* info, uint32_t* count) override;
+    // Linux has no purgeable memory: always KERN_INVALID_ARGUMENT.
+    kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
+                                           int32_t* state) override;
+    // From /proc/PID/pagemap, and /proc/kpageflags when it is readable.
+    // KERN_INVALID_ARGUMENT when the process is gone or a zombie.
+    kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
+                                           int32_t* dispositions, uint64_t* count) override;
+    // The path of the mapping that holds the address, as smaps shows it: a
+    // file that was deleted or replaced keeps its " (deleted)" mark.
+    int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
+
+    // From /proc/PID/status: anonymous resident + swapped + page tables, and
+    // the peak resident set.
+    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
+    // One ledger, "page_table": the bytes of the process's page tables.
+    int ledger_template(ledger_template_info* entries, int* count) override;
+    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
+    std::optional<std::string> realpath(const std::string& path) override;
+    // From the kernel's pagemap scan; `start` where the kernel lacks it.
+    uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) override;
+    // The ELF objects mapped by the task, with their segments.
+    bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
+                          const std::function<void(const HTPlatformImage&)>& callback) override;
+
     int32_t getpid() override;
     uint32_t geteuid() override;
     bool isatty(int fd) override;
@@ -46,6 +84,14 @@ private:
     bool readBsdInfo(int32_t pid, proc_bsdinfo& info);
     void fillKernelInfo(proc_bsdinfo& info);
     int readProcArgs(int32_t pid, void* oldp, size_t* oldlenp);
+    // Parses the task's smaps when `refresh` is set or nothing was parsed
+    // yet. KERN_SUCCESS, MACH_SEND_INVALID_DEST for a process that is gone
+    // or a zombie, else HT_KERN_ERRNO_BASE | errno.
+    kern_return_t loadVmas(HTLinuxTaskPort& task, bool refresh);
+    // Reads the memory figures of /proc/PID/status; false with errno.
+    bool readStatus(int32_t pid, HTProcStatus& status);
+    // /proc/kpageflags when heft may read it (as root), else -1; opened once.
+    int kpageflagsFd();
     // Seconds since the epoch at boot, read once.
     uint64_t bootTime();
 
@@ -55,4 +101,8 @@ private:
     std::once_flag bootTimeOnce_;
     uint64_t bootTime_ = 0;
     std::atomic<int32_t> selfRegionHeft_{0};
+    std::once_flag kpageflagsOnce_;
+    int kpageflagsFd_ = -1;
+    // Parsed program headers are cached per file for the whole run.
+    HTElfImageReader imageReader_;
 };

@@ -1,13 +1,19 @@
 #pragma once
 
 #include "platform/HTTaskPort.h"
+#include "platform/linux/HTSmapsParser.h"
 
 #include <cstdint>
+#include <vector>
 
 // A handle on a live Linux process: its /proc/PID directory, through which
 // every file of the process is read with openat (so that a recycled pid
 // cannot switch the target in the middle of a walk), and a pidfd that
 // names the process itself. The handle owns both descriptors.
+//
+// It also keeps what the address-space calls learnt of the process: the
+// mappings of its smaps, parsed once per walk and then searched, and the
+// descriptor of its pagemap. A handle is used by one thread at a time.
 class HTLinuxTaskPort : public HTTaskPort {
 public:
     // Takes ownership of the descriptors; pidFd may be -1 where the kernel
@@ -21,8 +27,28 @@ public:
     int procDirFd() const { return procDirFd_; }
     int pidFd() const { return pidFd_; }
 
+    // The mappings of the last parse, in address order.
+    bool hasParsedVmas() const { return hasParsedVmas_; }
+    const std::vector<HTSmapsEntry>& vmas() const { return vmas_; }
+    // Parses a new smaps text, reusing the records of the last one.
+    void parseVmas(std::string_view smaps);
+    // Forgets the mappings: the next look-up reads them again.
+    void clearVmas();
+    // The first mapping whose end is above the address (the one holding
+    // it, or the next one); null when there is none.
+    const HTSmapsEntry* vmaAtOrAbove(uint64_t address) const;
+    // The mapping that holds the address; null when none does.
+    const HTSmapsEntry* vmaContaining(uint64_t address) const;
+
+    // The process's pagemap, opened on first use; -1 with errno when it
+    // cannot be opened.
+    int pagemapFd();
+
 private:
     int32_t pid_;
     int procDirFd_;
     int pidFd_;
+    int pagemapFd_ = -1;
+    bool hasParsedVmas_ = false;
+    std::vector<HTSmapsEntry> vmas_;
 };

@@ -1,0 +1,35 @@
+#pragma once
+
+// The region records of the address-space walk, built from a parsed smaps
+// mapping. Pure functions: the walk calls them for a live process, tests
+// for captured text.
+
+#include "platform/HTPlatformTypes.h"
+#include "platform/linux/HTSmapsParser.h"
+
+#include <cstdint>
+
+// The VM tags of mappings that have no tag of their own elsewhere.
+inline constexpr uint32_t HT_VM_TAG_SHARED_MEMORY = 100;
+inline constexpr uint32_t HT_VM_TAG_KERNEL_PROVIDED = 101;
+inline constexpr uint32_t HT_VM_TAG_NAMED_ANONYMOUS = 102;
+// Tags shared with the rest of the table.
+inline constexpr uint32_t HT_VM_TAG_UNTAGGED = 0;
+inline constexpr uint32_t HT_VM_TAG_HEAP = 5;
+inline constexpr uint32_t HT_VM_TAG_STACK = 30;
+inline constexpr uint32_t HT_VM_TAG_GUARD = 31;
+
+uint32_t htRegionTag(const HTSmapsEntry& entry);
+
+// The identity of the VM object behind a mapping, never 0 nor all ones.
+// Files and shared memory are named by (device, inode) with the top bit
+// set, so every process that maps one names the same object; private
+// anonymous memory by (pid, start) with the top bits 01, one object a
+// mapping.
+uint64_t htRegionObjectId(const HTSmapsEntry& entry, int32_t pid);
+
+// The full record of the walk. Page counts are in units of pageSize.
+vm_region_submap_info_64 htSubmapInfo(const HTSmapsEntry& entry, int32_t pid, uint64_t pageSize);
+
+// The top-level record of the same mapping.
+vm_region_basic_info_64 htBasicInfo(const HTSmapsEntry& entry);

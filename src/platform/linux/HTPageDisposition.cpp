@@ -1,0 +1,29 @@
+#include "platform/linux/HTPageDisposition.h"
+
+#include "platform/HTPlatformTypes.h"
+
+int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPageMapping mapping)
+{
+    bool present = (pagemapEntry & HT_PAGEMAP_PRESENT) != 0;
+    bool fileOrShared = (pagemapEntry & HT_PAGEMAP_FILE_OR_SHARED) != 0;
+    int32_t disposition = 0;
+    if (present) disposition |= VM_PAGE_QUERY_PAGE_PRESENT;
+    if ((pagemapEntry & HT_PAGEMAP_SWAPPED) != 0) disposition |= VM_PAGE_QUERY_PAGE_PAGED_OUT;
+
+    if (pageFlags != nullptr && present) {
+        // hugetlbfs pages are never marked swap-backed, yet they have no
+        // backing store either: they count as swap-backed memory.
+        bool swapBacked = (*pageFlags & HT_KPF_SWAPBACKED) != 0 || mapping.hugetlb;
+        if (fileOrShared && !swapBacked) disposition |= VM_PAGE_QUERY_PAGE_EXTERNAL;
+        if ((*pageFlags & HT_KPF_DIRTY) != 0 || swapBacked) disposition |= VM_PAGE_QUERY_PAGE_DIRTY;
+        // An anonymous page that lost its swap backing was freed with
+        // MADV_FREE: the kernel may take it back.
+        if ((*pageFlags & HT_KPF_ANON) != 0 && !swapBacked) disposition |= VM_PAGE_QUERY_PAGE_REUSABLE;
+        return disposition;
+    }
+
+    bool external = fileOrShared && !mapping.sharedMemory && !mapping.hugetlb;
+    if (external) disposition |= VM_PAGE_QUERY_PAGE_EXTERNAL;
+    if (present && !external) disposition |= VM_PAGE_QUERY_PAGE_DIRTY;
+    return disposition;
+}

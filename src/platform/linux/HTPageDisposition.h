@@ -1,0 +1,35 @@
+#pragma once
+
+// The disposition of one page from its /proc/PID/pagemap entry and, when
+// heft may read them (as root), the page's /proc/kpageflags. A pure
+// function, so that every rule can be checked without the page itself.
+
+#include <cstdint>
+
+// pagemap entry bits.
+inline constexpr uint64_t HT_PAGEMAP_PRESENT = uint64_t{1} << 63;
+inline constexpr uint64_t HT_PAGEMAP_SWAPPED = uint64_t{1} << 62;
+inline constexpr uint64_t HT_PAGEMAP_FILE_OR_SHARED = uint64_t{1} << 61;
+inline constexpr uint64_t HT_PAGEMAP_PFN_MASK = (uint64_t{1} << 55) - 1;
+
+// kpageflags bits.
+inline constexpr uint64_t HT_KPF_DIRTY = uint64_t{1} << 4;
+inline constexpr uint64_t HT_KPF_ANON = uint64_t{1} << 12;
+inline constexpr uint64_t HT_KPF_SWAPBACKED = uint64_t{1} << 14;
+
+// What the page's mapping is, from its smaps record.
+struct HTPageMapping {
+    bool sharedMemory = false;  // memfd, /dev/shm, System V, MAP_SHARED anonymous
+    bool hugetlb = false;       // hugetlbfs pages: memory only, never reclaimable
+};
+
+// The frame number of a present page; 0 when the reader may not see it.
+inline uint64_t htPagemapFrame(uint64_t entry)
+{
+    return (entry & HT_PAGEMAP_PRESENT) != 0 ? entry & HT_PAGEMAP_PFN_MASK : 0;
+}
+
+// VM_PAGE_QUERY_PAGE_* bits. `pageFlags` is the page's kpageflags entry,
+// or null when it is not known (an unprivileged reader, a page without a
+// frame number); the rules then rest on the pagemap and the mapping alone.
+int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPageMapping mapping);

@@ -1,0 +1,55 @@
+#include "platform/linux/HTPagemapScan.h"
+
+#include <sys/ioctl.h>
+
+#include <cstring>
+
+namespace {
+
+// The kernel's pagemap scan interface (linux/fs.h from 6.7 on), spelled out
+// here because the build machine's headers may be older than the kernel
+// heft runs on.
+struct PageRegion {
+    uint64_t start;
+    uint64_t end;
+    uint64_t categories;
+};
+
+struct PagemapScanArg {
+    uint64_t size;
+    uint64_t flags;
+    uint64_t start;
+    uint64_t end;
+    uint64_t walk_end;
+    uint64_t vec;
+    uint64_t vec_len;
+    uint64_t max_pages;
+    uint64_t category_inverted;
+    uint64_t category_mask;
+    uint64_t category_anyof_mask;
+    uint64_t return_mask;
+};
+
+constexpr uint64_t kPageIsPresent = 1 << 3;
+constexpr uint64_t kPageIsSwapped = 1 << 4;
+constexpr unsigned long kPagemapScan = _IOWR('f', 16, PagemapScanArg);
+
+}  // namespace
+
+std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, uint64_t end)
+{
+    if (start >= end) return end;
+    PageRegion region{};
+    PagemapScanArg arg{};
+    arg.size = sizeof(arg);
+    arg.start = start;
+    arg.end = end;
+    arg.vec = reinterpret_cast<uint64_t>(&region);
+    arg.vec_len = 1;
+    arg.max_pages = 1;
+    arg.category_anyof_mask = kPageIsPresent | kPageIsSwapped;
+    arg.return_mask = kPageIsPresent | kPageIsSwapped;
+    long found = ::ioctl(pagemapFd, kPagemapScan, &arg);
+    if (found < 0) return std::nullopt;
+    return found == 0 ? end : region.start;
+}

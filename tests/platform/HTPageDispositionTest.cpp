@@ -1,0 +1,83 @@
+#include "platform/HTPlatformTypes.h"
+#include "platform/linux/HTPageDisposition.h"
+#include "platform/linux/HTProcStatusParser.h"
+
+#include <gtest/gtest.h>
+
+namespace {
+
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
+constexpr int32_t kDirty = VM_PAGE_QUERY_PAGE_DIRTY;
+constexpr int32_t kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+constexpr int32_t kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL;
+constexpr int32_t kReusable = VM_PAGE_QUERY_PAGE_REUSABLE;
+
+constexpr uint64_t kFrame = 0x1234;
+constexpr uint64_t kPresentEntry = HT_PAGEMAP_PRESENT | kFrame;
+constexpr uint64_t kFileEntry = HT_PAGEMAP_PRESENT | HT_PAGEMAP_FILE_OR_SHARED | kFrame;
+// A swapped page's entry holds the swap type and offset where a frame
+// number would be.
+constexpr uint64_t kSwappedEntry = HT_PAGEMAP_SWAPPED | 0x5678;
+
+constexpr HTPageMapping kPrivate{};
+constexpr HTPageMapping kSharedMemory{true, false};
+constexpr HTPageMapping kHugetlb{false, true};
+
+int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPrivate)
+{
+    return htPageDisposition(entry, &flags, mapping);
+}
+
+}  // namespace
+
+TEST(HTPageDisposition, WithPhysicalPageFlags)
+{
+    // Anonymous memory and shared memory are swap-backed: dirty while present.
+    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON | HT_KPF_SWAPBACKED), kPresent | kDirty);
+    EXPECT_EQ(withFlags(kFileEntry, HT_KPF_SWAPBACKED, kSharedMemory), kPresent | kDirty);
+    // File pages: external, dirty only when the kernel says so.
+    EXPECT_EQ(withFlags(kFileEntry, 0), kPresent | kExternal);
+    EXPECT_EQ(withFlags(kFileEntry, HT_KPF_DIRTY), kPresent | kExternal | kDirty);
+    // Freed with MADV_FREE: anonymous without swap backing.
+    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON), kPresent | kReusable);
+    // hugetlbfs pages carry no swap-backed flag yet are neither external nor
+    // reusable.
+    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON, kHugetlb), kPresent | kDirty);
+    EXPECT_EQ(withFlags(kFileEntry, 0, kHugetlb), kPresent | kDirty);
+    // The shared zero page of a read-only touch: present, clean.
+    EXPECT_EQ(withFlags(kPresentEntry, 0), kPresent);
+}
+
+TEST(HTPageDisposition, FromThePagemapAlone)
+{
+    EXPECT_EQ(htPageDisposition(0, nullptr, kPrivate), 0);
+    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT, nullptr, kPrivate), kPresent | kDirty);
+    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT | HT_PAGEMAP_FILE_OR_SHARED, nullptr, kPrivate),
+              kPresent | kExternal);
+    // Shared memory pages carry the file bit but have no file behind them.
+    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT | HT_PAGEMAP_FILE_OR_SHARED, nullptr, kSharedMemory),
+              kPresent | kDirty);
+    EXPECT_EQ(htPageDisposition(kSwappedEntry, nullptr, kPrivate), kPagedOut);
+    // Page flags never apply to a page that is not present.
+    EXPECT_EQ(withFlags(kSwappedEntry, HT_KPF_ANON), kPagedOut);
+    EXPECT_EQ(htPagemapFrame(kSwappedEntry), 0u);
+    EXPECT_EQ(htPagemapFrame(kFileEntry), kFrame);
+}
+
+TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)
+{
+    constexpr std::string_view live = "Name:\tcat\nState:\tR (running)\nVmPeak:\t    3060 kB\n"
+                                      "VmHWM:\t    1764 kB\nVmRSS:\t    1764 kB\nRssAnon:\t     116 kB\n"
+                                      "RssFile:\t    1648 kB\nVmPTE:\t      44 kB\nVmSwap:\t       8 kB\n"
+                                      "HugetlbPages:\t       0 kB\nThreads:\t1\n";
+    HTProcStatus status = htParseProcStatus(live);
+    ASSERT_TRUE(status.hasMemoryFigures());
+    EXPECT_EQ(*status.rssAnon, 116u * 1024);
+    EXPECT_EQ(*status.vmSwap, 8u * 1024);
+    EXPECT_EQ(*status.vmPTE, 44u * 1024);
+    EXPECT_EQ(*status.vmHWM, 1764u * 1024);
+
+    constexpr std::string_view zombie = "Name:\tpython3\nState:\tZ (zombie)\nTgid:\t13382\nThreads:\t1\n";
+    EXPECT_FALSE(htParseProcStatus(zombie).hasMemoryFigures());
+    EXPECT_FALSE(htParseProcStatus("VmPTE:\n").vmPTE.has_value());
+}

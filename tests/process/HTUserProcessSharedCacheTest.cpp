@@ -1,0 +1,237 @@
+#include "process/HTUserProcessTestSupport.h"
+
+#include <string>
+#include <vector>
+
+namespace {
+
+using Region = HTFakePlatform::Region;
+
+// The shared region of a 64-bit ARM system.
+constexpr uint64_t kBase = 0x180000000;
+constexpr uint64_t kPrivate = 0x100000000;
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
+
+class HTUserProcessSharedCacheTest : public HTUserProcessTest {
+protected:
+    HTUserProcessSharedCacheTest()
+    {
+        // One private region below the shared region, for the bisection
+        // to find.
+        addTarget().regions = {anonymous(kPrivate, 4)};
+    }
+
+    // A mapping of the shared cache; its record's object id is 0x4242.
+    Region& addMapping(uint64_t start, uint64_t pages, bool writable, uint64_t offset = 0)
+    {
+        Region region;
+        region.start = start;
+        region.size = pages * kPage;
+        region.info.protection = VM_PROT_READ;
+        region.info.max_protection = VM_PROT_READ | (writable ? VM_PROT_WRITE : 0);
+        region.info.share_mode = SM_COW;
+        region.info.external_pager = 1;
+        region.info.offset = offset;
+        region.info.object_id_full = 0x4242;
+        target().regions.push_back(region);
+        return target().regions.back();
+    }
+
+    void addImage(const std::string& path, std::vector<HTPlatformImageSegment> segments)
+    {
+        target().images.push_back({path, segments.front().start, std::move(segments)});
+    }
+
+    std::shared_ptr<HTMachUserProcess> gatheredMach() { return gathered<HTMachUserProcess>(); }
+
+    static std::vector<std::shared_ptr<HTMemoryRegion>> pieces(const HTUserProcess& process)
+    {
+        std::vector<std::shared_ptr<HTMemoryRegion>> result;
+        for (const auto& region : process.memoryRegions())
+            if (region->inSharedCache()) result.push_back(region);
+        return result;
+    }
+};
+
+struct Piece {
+    uint64_t start;
+    uint64_t end;
+    std::string name;
+    uint8_t segment;
+    bool unused;
+    bool operator==(const Piece&) const = default;
+};
+
+std::ostream& operator<<(std::ostream& out, const Piece& piece)
+{
+    return out << std::hex << "[" << piece.start << ", " << piece.end << ") " << piece.name << " seg "
+               << int(piece.segment) << (piece.unused ? " unused" : "");
+}
+
+std::vector<Piece> layout(const std::vector<std::shared_ptr<HTMemoryRegion>>& regions)
+{
+    std::vector<Piece> result;
+    for (const auto& region : regions)
+        result.push_back({region->start(), region->end(), region->name().value_or(""), region->segment(),
+                          region->unusedSharedCacheRegion()});
+    return result;
+}
+
+const std::string kUnused = "unused rtld shared cache area";
+
+}  // namespace
+
+TEST_F(HTUserProcessSharedCacheTest, MappingWithoutImageIsOneUnusedPiece)
+{
+    const uint64_t start = kBase + 0x200000;
+    addMapping(start, 8, true, 0x30000).info.user_wired_count = 1;
+
+    auto process = gatheredMach();
+    EXPECT_EQ(process->sharedRegionBase(), kBase);
+    EXPECT_EQ(process->sharedRegionSize(), 0x100000000u);
+    ASSERT_EQ(process->memoryRegions().size(), 2u);
+    EXPECT_FALSE(process->memoryRegions()[0]->inSharedCache());
+    auto shared = pieces(*process);
+    ASSERT_EQ(shared.size(), 1u);
+    EXPECT_EQ(layout(shared), (std::vector<Piece>{{start, start + 8 * kPage, kUnused, HTSegmentNotSet, true}}));
+    // Past the bisection's answer the mapping is looked up whole: the
+    // record is built, with object id 1.
+    EXPECT_GT(platform_->basicRegionLookups, 0);
+    EXPECT_EQ(shared[0]->object_id(), 1u);
+    EXPECT_EQ(shared[0]->offset(), 0x30000u);
+    EXPECT_EQ(shared[0]->share_mode(), SM_COW);
+    EXPECT_TRUE(shared[0]->wired());
+    // Page-aligned at both ends: nothing to measure.
+    EXPECT_EQ(shared[0]->dirtySize() + shared[0]->swappedSize(), 0u);
+    EXPECT_TRUE(platform_->pageQueries.empty());
+
+    // A hidden process contributes nothing from the shared region.
+    auto hidden = created<HTMachUserProcess>();
+    hidden->setHiddenFromDisplay(true);
+    hidden->gatherData();
+    ASSERT_EQ(hidden->memoryRegions().size(), 1u);
+    EXPECT_EQ(hidden->memoryRegions()[0]->start(), kPrivate);
+
+    // Without a private region below it, the mapping comes from the
+    // recursive walk with its own record.
+    target().regions.erase(target().regions.begin());
+    auto bare = gatheredMach();
+    ASSERT_EQ(bare->memoryRegions().size(), 1u);
+    EXPECT_EQ(bare->memoryRegions()[0]->object_id(), 0x4242u);
+}
+
+TEST_F(HTUserProcessSharedCacheTest, ImagesCutMappingsIntoPieces)
+{
+    const uint64_t first = kBase + 0x100000;
+    const uint64_t second = kBase + 0x200000;
+    addMapping(first, 16, false, 0x8000);
+    addMapping(second, 8, false);
+    addImage("/usr/lib/libsystem.dylib", {{"__TEXT", first + 0x1800, 0x1000}});
+    addImage("/usr/lib/libother.dylib", {{"__LINKEDIT", second + kPage, 0x800}});
+
+    auto shared = pieces(*gatheredMach());
+    EXPECT_EQ(layout(shared),
+              (std::vector<Piece>{
+                  {first, first + 0x1800, kUnused, HTSegmentNotSet, true},
+                  {first + 0x1800, first + 0x2800, "__TEXT", HTSegmentText, false},
+                  {first + 0x2800, first + 16 * kPage, kUnused, HTSegmentNotSet, true},
+                  {second, second + kPage, kUnused, HTSegmentNotSet, true},
+                  // An aligned segment takes the padding up to the boundary.
+                  {second + kPage, second + 2 * kPage, "__LINKEDIT", HTSegmentLinkEdit, false},
+                  {second + 2 * kPage, second + 8 * kPage, kUnused, HTSegmentNotSet, true},
+              }));
+    ASSERT_EQ(shared.size(), 6u);
+    EXPECT_EQ(shared[1]->detailedName(), "/usr/lib/libsystem.dylib");
+    EXPECT_EQ(shared[1]->offset(), 0x8000u + 0x1800);
+    EXPECT_EQ(shared[2]->offset(), 0x8000u + 0x2800);
+    EXPECT_EQ(shared[4]->detailedName(), "rtld shared cache");
+    EXPECT_FALSE(shared[0]->detailedName().has_value());
+    // Read-only pieces are never measured.
+    EXPECT_TRUE(platform_->pageQueries.empty());
+}
+
+TEST_F(HTUserProcessSharedCacheTest, PageQueriesCountASharedPageOnce)
+{
+    const uint64_t start = kBase + 0x100000;
+    addMapping(start, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", start, 0x1800}});
+    addImage("/usr/lib/libb.dylib", {{"__DATA", start + 0x1800, 0x1800}});
+    target().dispositions[start] = kPresent;
+    target().dispositions[start + kPage] = kPresent | VM_PAGE_QUERY_PAGE_DIRTY | VM_PAGE_QUERY_PAGE_EXTERNAL;
+    target().dispositions[start + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    target().dispositions[start + 3 * kPage] = kPresent;
+
+    // A page-aligned piece: resident anonymous pages are dirty, clean file
+    // pages are nothing, paged-out pages are swapped.
+    const uint64_t other = kBase + 0x200000;
+    addMapping(other, 3, true);
+    addImage("/usr/lib/libc.dylib", {{"__DATA", other, 3 * kPage}});
+    target().dispositions[other] = kPresent;
+    target().dispositions[other + kPage] = kPresent | VM_PAGE_QUERY_PAGE_EXTERNAL;
+    target().dispositions[other + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+
+    auto shared = pieces(*gatheredMach());
+    ASSERT_EQ(shared.size(), 4u);
+    EXPECT_EQ(shared[0]->dirtySize(), 0x1800u);
+    EXPECT_EQ(shared[0]->swappedSize(), 0u);
+    // Its first page comes from the query of the piece before.
+    EXPECT_EQ(shared[1]->dirtySize(), 0x800u);
+    EXPECT_EQ(shared[1]->swappedSize(), kPage);
+    // The trailing unused piece is page-aligned: not measured.
+    EXPECT_TRUE(shared[2]->unusedSharedCacheRegion());
+    EXPECT_EQ(shared[2]->dirtySize(), 0u);
+    EXPECT_EQ(shared[3]->dirtySize(), kPage);
+    EXPECT_EQ(shared[3]->swappedSize(), kPage);
+    EXPECT_EQ(platform_->pageQueries,
+              (std::vector<std::pair<uint64_t, uint64_t>>{
+                  {start, 2 * kPage}, {start + 2 * kPage, kPage}, {other, 3 * kPage}}));
+}
+
+TEST_F(HTUserProcessSharedCacheTest, UnusedPieceGetsItsLastPageFromTheNextQuery)
+{
+    const uint64_t start = kBase + 0x100000;
+    addMapping(start, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", start + 0x1800, 0x1800}});
+    target().dispositions[start] = kPresent;
+    target().dispositions[start + kPage] = kPresent;
+    target().dispositions[start + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+
+    auto shared = pieces(*gatheredMach());
+    ASSERT_EQ(shared.size(), 3u);
+    // The unused piece's own pages are not queried; its part of the page it
+    // shares with the image is measured by the image's query.
+    EXPECT_TRUE(shared[0]->unusedSharedCacheRegion());
+    EXPECT_EQ(shared[0]->dirtySize(), 0x800u);
+    EXPECT_EQ(shared[1]->dirtySize(), 0x800u);
+    EXPECT_EQ(shared[1]->swappedSize(), kPage);
+    EXPECT_EQ(platform_->pageQueries,
+              (std::vector<std::pair<uint64_t, uint64_t>>{{start + kPage, 2 * kPage}}));
+}
+
+TEST_F(HTUserProcessSharedCacheTest, FailedPageQueryStopsTheWalk)
+{
+    const uint64_t start = kBase + 0x100000;
+    addMapping(start, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", start, 4 * kPage}});
+    addMapping(kBase + 0x200000, 4, true);
+    target().pageQueryFailureAddress = start + kPage;
+
+    testing::internal::CaptureStderr();
+    auto process = gatheredMach();
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "bailing out for process target [500]; data may be incomplete!\n");
+    EXPECT_EQ(platform_->machErrors.back(), "mach_vm_page_range_query: invalid argument");
+    EXPECT_EQ(process->errors(), std::vector<std::string>{"target [500]: invalid argument"});
+    // Nothing of the failed mapping or after it.
+    EXPECT_TRUE(pieces(*process).empty());
+    EXPECT_EQ(process->memoryRegions().size(), 1u);
+
+    // The same failure on a process that has gone is a warning.
+    auto gone = created<HTMachUserProcess>();
+    target().exited = true;
+    testing::internal::CaptureStderr();
+    gone->gatherData();
+    testing::internal::GetCapturedStderr();
+    EXPECT_TRUE(gone->errors().empty());
+    EXPECT_EQ(gone->warnings(), std::vector<std::string>{"target [500]: invalid argument (process exited)"});
+}

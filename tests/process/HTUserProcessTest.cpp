@@ -1,0 +1,505 @@
+#include "process/HTUserProcessTestSupport.h"
+
+#include "model/HTAuxData.h"
+#include "model/HTAuxDataMap.h"
+
+#include <cstring>
+
+namespace {
+
+using Region = HTFakePlatform::Region;
+
+const HTMemoryRegion& regionAt(const HTUserProcess& process, uint64_t start)
+{
+    for (const auto& region : process.memoryRegions())
+        if (region->start() == start) return *region;
+    ADD_FAILURE() << "no region at " << start;
+    static HTMemoryRegion none;
+    return none;
+}
+
+int64_t auxValue(const std::shared_ptr<HTAuxDataMap>& data, const char* key)
+{
+    auto datum = std::dynamic_pointer_cast<HTAuxData>(data->find(key));
+    return datum ? datum->value() : -1;
+}
+
+}  // namespace
+
+TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
+{
+    setBreakdown(true);
+    platform_->ledgerTemplate = std::vector<std::string>{"cpu_time", "page_table", "wired_mem"};
+    HTFakePlatform::Process& script = addTarget();
+    script.rusage = rusage_info_v4{40 * kPage, 90 * kPage};
+    script.ledgerBalances = std::vector<int64_t>{7, 3 * static_cast<int64_t>(kPage), 9};
+
+    auto process = created();
+    EXPECT_EQ(process->phys_heft(), 40 * kPage);
+    EXPECT_EQ(process->phys_heft_peak(), 90 * kPage);
+    EXPECT_EQ(process->ledgers()[0], 3 * kPage);
+    EXPECT_EQ(process->idleExitStatus(), HTIdleExitStatusNotControlled);
+    // Linux maps no shared library cache.
+    EXPECT_EQ(process->sharedRegionBase(), 0u);
+    EXPECT_EQ(process->sharedRegionSize(), 0u);
+    EXPECT_EQ(process->sharedRegionAlignmentSize(), 4096u);
+
+    auto data = process->auxData();
+    ASSERT_NE(data, nullptr);
+    EXPECT_EQ(auxValue(data, "phys_heft"), static_cast<int64_t>(40 * kPage));
+    EXPECT_EQ(auxValue(data, "phys_heft_peak"), static_cast<int64_t>(90 * kPage));
+    EXPECT_FALSE(std::dynamic_pointer_cast<HTAuxData>(data->find("phys_heft"))->shouldAggregate());
+
+    // The template is read once per run; a negative balance counts as 0.
+    platform_->addProcess(kPid + 1, 1, "other").ledgerBalances = std::vector<int64_t>{0, -5, 0};
+    auto other = std::make_shared<HTUserProcess>(platform_);
+    ASSERT_TRUE(other->initWithBsdInfo(platform_->process(kPid + 1)->info));
+    EXPECT_EQ(other->ledgers()[0], 0u);
+    EXPECT_EQ(platform_->ledgerTemplateReads, 1);
+    // No physical heft, no auxiliary data.
+    EXPECT_EQ(other->auxData(), nullptr);
+}
+
+TEST_F(HTUserProcessTest, LedgerFailuresLeaveNoPageTableRegion)
+{
+    setBreakdown(true);
+    addTarget().ledgerErrno = EPERM;
+    platform_->ledgerTemplate = std::vector<std::string>{"page_table"};
+    auto process = gathered();
+    ASSERT_EQ(process->warnings().size(), 1u);
+    EXPECT_EQ(process->warnings()[0], std::string("target [500]: Unable to retrieve ledger entry info - ") +
+                                          std::strerror(EPERM));
+    EXPECT_TRUE(process->memoryRegions().empty());
+
+    // An unreadable template: a message on standard error, no warning.
+    HTUserProcessProbe::_forgetLedgerTemplate();
+    platform_->ledgerTemplate.reset();
+    testing::internal::CaptureStderr();
+    auto second = gathered();
+    EXPECT_NE(testing::internal::GetCapturedStderr().find("Unable to retrieve ledger template info"),
+              std::string::npos);
+    EXPECT_TRUE(second->warnings().empty());
+    EXPECT_TRUE(second->memoryRegions().empty());
+}
+
+TEST_F(HTUserProcessTest, EmptyProcessEndsTheWalkAtOnce)
+{
+    addTarget();
+    auto process = gathered();
+    EXPECT_TRUE(process->hasMemoryRegions());
+    EXPECT_TRUE(process->memoryRegions().empty());
+    EXPECT_TRUE(process->errors().empty());
+    EXPECT_TRUE(process->warnings().empty());
+    // An empty shared region needs no bisection.
+    EXPECT_EQ(platform_->regionLookups, 1);
+    EXPECT_EQ(platform_->basicRegionLookups, 0);
+}
+
+TEST_F(HTUserProcessTest, SizesFromPageCounts)
+{
+    HTFakePlatform::Process& script = addTarget();
+    Region plain = anonymous(0x10000, 12);
+    plain.info.pages_resident = 10;
+    plain.info.pages_reusable = 3;
+    plain.info.pages_dirtied = 4;
+    plain.info.pages_swapped_out = 2;
+    Region volatileRegion = anonymous(0x20000, 8);
+    volatileRegion.info.pages_resident = 5;
+    volatileRegion.info.pages_dirtied = 5;
+    volatileRegion.purgeState = VM_PURGABLE_VOLATILE;
+    Region emptied = anonymous(0x30000, 8);
+    emptied.purgeState = VM_PURGABLE_EMPTY;
+    // More dirtied than resident is clamped, not wrapped.
+    Region odd = anonymous(0x40000, 4);
+    odd.info.pages_resident = 2;
+    odd.info.pages_dirtied = 3;
+    script.regions = {plain, volatileRegion, emptied, odd};
+
+    // Without the breakdown, resident anonymous memory that is not
+    // reusable is dirty.
+    auto process = gathered();
+    ASSERT_EQ(process->memoryRegions().size(), 4u);
+    const HTMemoryRegion& first = regionAt(*process, 0x10000);
+    EXPECT_EQ(first.dirtySize(), 7 * kPage);
+    EXPECT_EQ(first.reclaimableSize(), 3 * kPage);
+    EXPECT_EQ(first.cleanNonSpecSize(), 0u);
+    EXPECT_EQ(first.swappedSize(), 2 * kPage);
+    EXPECT_EQ(first.object_id(), plain.info.object_id_full);
+    EXPECT_EQ(regionAt(*process, 0x20000).dirtySize(), 0u);
+    EXPECT_EQ(regionAt(*process, 0x20000).reclaimableSize(), 5 * kPage);
+    EXPECT_EQ(regionAt(*process, 0x30000).reclaimableSize(), 8 * kPage);
+
+    // With it, the kernel's dirtied count.
+    setBreakdown(true);
+    process = gathered();
+    EXPECT_EQ(regionAt(*process, 0x10000).dirtySize(), 4 * kPage);
+    EXPECT_EQ(regionAt(*process, 0x10000).cleanNonSpecSize(), 3 * kPage);
+    EXPECT_EQ(regionAt(*process, 0x10000).reclaimableSize(), 3 * kPage);
+    EXPECT_EQ(regionAt(*process, 0x40000).cleanNonSpecSize(), 0u);
+}
+
+TEST_F(HTUserProcessTest, RegionsAreNamedByImageFileOrTag)
+{
+    HTFakePlatform::Process& script = addTarget();
+    Region text = anonymous(0x400000, 4);
+    text.info.external_pager = 1;
+    text.info.share_mode = SM_COW;
+    text.path = "/usr/bin/target";
+    Region file = anonymous(0x500000, 2);
+    file.info.external_pager = 1;
+    file.path = "/var/data.db";
+    Region pathless = anonymous(0x600000, 2);
+    pathless.info.external_pager = 1;
+    Region stack = anonymous(0x700000, 2);
+    stack.info.user_tag = 30;
+    stack.info.user_wired_count = 1;
+    // An older kernel's short record: the 32-bit object id stands in.
+    stack.infoCount = VM_REGION_SUBMAP_INFO_COUNT_64 - 2;
+    stack.info.object_id = 0x1234;
+    script.regions = {text, file, pathless, stack};
+    script.images = {{"/usr/bin/target", 0x400000, {{"__TEXT", 0x400000, 4 * kPage}}}};
+    platform_->realpaths["/usr/bin/target"] = "/opt/target/bin/target";
+
+    auto process = gathered();
+    ASSERT_EQ(process->memoryRegions().size(), 4u);
+    const HTMemoryRegion& image = regionAt(*process, 0x400000);
+    EXPECT_EQ(image.name(), "__TEXT");
+    EXPECT_EQ(image.detailedName(), "/opt/target/bin/target");
+    EXPECT_EQ(image.segment(), HTSegmentText);
+
+    EXPECT_EQ(regionAt(*process, 0x500000).name(), "mapped file");
+    EXPECT_EQ(regionAt(*process, 0x500000).detailedName(), "/var/data.db");
+    EXPECT_EQ(regionAt(*process, 0x600000).name(), "mapped file");
+    EXPECT_FALSE(regionAt(*process, 0x600000).detailedName().has_value());
+
+    const HTMemoryRegion& tagged = regionAt(*process, 0x700000);
+    EXPECT_EQ(tagged.name(), HTMemoryRegion::categoryNameForTag(30));
+    EXPECT_EQ(tagged.segment(), HTSegmentNoImage);
+    EXPECT_TRUE(tagged.wired());
+    EXPECT_EQ(tagged.object_id(), 0x1234u);
+}
+
+TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeRegions)
+{
+    setBreakdown(true);
+    HTFakePlatform::Process& script = addTarget();
+    Region mapped = anonymous(0x10000, 8, 0x77);
+    mapped.info.pages_resident = 8;
+    mapped.info.pages_dirtied = 8;
+    Region kernelFake = anonymous(0x90000, 2);
+    kernelFake.info.user_tag = HTFakeRegionTag;
+    kernelFake.info.pages_resident = 2;
+    kernelFake.info.pages_dirtied = 2;
+    script.regions = {mapped, kernelFake};
+    script.ownedVmObjects = std::vector<HTFakePlatform::OwnedVmObject>{
+        // object, virtual, resident, wired, reusable, compressed, flags
+        {0x77, 8 * kPage, 5 * kPage, 0, 1 * kPage, 2 * kPage, 0},
+        {0x88, 16 * kPage, 6 * kPage, 1 * kPage, 2 * kPage, 3 * kPage, 0},
+        {0x99, 4 * kPage, 4 * kPage, 3 * kPage, 0, 1 * kPage, 1u << 4},  // volatile
+        {0xAA, 4 * kPage, 4 * kPage, 0, 0, 4 * kPage, 1},                // not charged
+    };
+
+    auto process = gathered();
+    const auto& regions = process->memoryRegions();
+    // The kernel's own fake region gives way to the owned-object list.
+    ASSERT_EQ(regions.size(), 4u);
+    const HTMemoryRegion& owned = *regions[0];
+    EXPECT_TRUE(owned.ownedExclusivelyByParentProcess());
+    EXPECT_EQ(owned.dirtySize(), 4 * kPage);
+    EXPECT_EQ(owned.swappedSize(), 2 * kPage);
+    EXPECT_EQ(owned.reclaimableSize(), 1 * kPage);
+    EXPECT_EQ(owned.cleanNonSpecSize(), 0u);
+
+    // The others, in the kernel's order, as unmapped owned memory.
+    const HTMemoryRegion& unmapped = *regions[1];
+    EXPECT_EQ(unmapped.object_id(), 0x88u);
+    EXPECT_EQ(unmapped.name(), "Owned physical heft (unmapped)");
+    EXPECT_EQ(unmapped.start(), HTNoAddress);
+    EXPECT_EQ(unmapped.size(), 16 * kPage);
+    EXPECT_EQ(unmapped.dirtySize(), 4 * kPage);
+    EXPECT_EQ(unmapped.swappedSize(), 3 * kPage);
+    EXPECT_TRUE(unmapped.wired());
+    EXPECT_EQ(regions[2]->object_id(), 0x99u);
+    EXPECT_EQ(regions[2]->dirtySize(), 3 * kPage);
+    EXPECT_EQ(regions[2]->swappedSize(), 0u);
+    EXPECT_EQ(regions[3]->object_id(), 0xAAu);
+    EXPECT_EQ(regions[3]->dirtySize() + regions[3]->swappedSize(), 0u);
+    EXPECT_TRUE(process->warnings().empty());
+}
+
+TEST_F(HTUserProcessTest, OwnedObjectListGrowingBetweenAsksIsReadWhole)
+{
+    setBreakdown(true);
+    HTFakePlatform::Process& script = addTarget();
+    std::vector<HTFakePlatform::OwnedVmObject> objects;
+    for (uint64_t i = 1; i <= 40; ++i) objects.push_back({i << 12, kPage, kPage, 0, 0, 0, 0});
+    script.ownedVmObjects = objects;
+    // The first ask saw none of them.
+    script.ownedVmObjectsLengthHint = sizeof(uint64_t);
+    auto process = gathered();
+    ASSERT_EQ(process->memoryRegions().size(), 40u);
+    EXPECT_EQ(process->memoryRegions().back()->object_id(), 40u << 12);
+
+    // A failure other than "not there" is a warning.
+    script.ownedVmObjectsErrno = EPERM;
+    testing::internal::CaptureStderr();
+    auto failed = gathered();
+    std::string expected = std::string("target [500]: vm.get_owned_vmobjects - ") + std::strerror(EPERM);
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), expected + "\n");
+    ASSERT_EQ(failed->warnings().size(), 1u);
+    EXPECT_EQ(failed->warnings()[0], expected);
+}
+
+TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
+{
+    // Small pages let the kernel's counts express the sub-page figures.
+    platform_->pageSize = 1024;
+    setBreakdown(true);
+    HTFakePlatform::Process& script = addTarget();
+    // Purgeable memory without an owned-object list counts as owned: 4096
+    // bytes in all.
+    Region purgeable = anonymous(0x10000, 4);
+    purgeable.size = 4 * 1024;
+    purgeable.info.pages_resident = 4;
+    purgeable.info.pages_dirtied = 4;
+    purgeable.purgeState = VM_PURGABLE_NONVOLATILE;
+    Region fake = anonymous(0x20000, 1);
+    fake.size = 4 * 1024;
+    fake.info.user_tag = HTFakeRegionTag;
+    fake.info.pages_resident = 1;
+    fake.info.pages_dirtied = 1;
+    fake.info.pages_swapped_out = 1;
+    Region after = anonymous(0x30000, 1);
+    script.regions = {purgeable, fake, after};
+
+    auto process = gathered();
+    // Only the owned region: the fake one had too little to give, and the
+    // walk ended at the first real region after it.
+    ASSERT_EQ(process->memoryRegions().size(), 1u);
+    EXPECT_TRUE(process->memoryRegions()[0]->ownedExclusivelyByParentProcess());
+    EXPECT_EQ(process->memoryRegions()[0]->dirtySize(), 4096u);
+    ASSERT_EQ(process->warnings().size(), 1u);
+    EXPECT_EQ(process->warnings()[0],
+              "target [500]: Heft changed while analyzing \u2013 unmapped owned physical heft may be over-counted "
+              "by 2048 bytes");
+    EXPECT_EQ(platform_->regionLookups, 3);
+}
+
+TEST_F(HTUserProcessTest, HeldFakeRegionWithRoomLeftIsAppendedWithoutAddress)
+{
+    setBreakdown(true);
+    HTFakePlatform::Process& script = addTarget();
+    Region purgeable = anonymous(0x10000, 1);
+    purgeable.info.pages_resident = 1;
+    purgeable.info.pages_dirtied = 1;
+    purgeable.purgeState = VM_PURGABLE_VOLATILE;  // no owned dirty: owned total stays 0
+    Region tagged = anonymous(0x20000, 2);
+    tagged.info.pages_resident = 2;
+    tagged.info.pages_dirtied = 2;
+    tagged.purgeState = VM_PURGABLE_NONVOLATILE;  // owned: 2 pages
+    Region fake = anonymous(0x30000, 8);
+    fake.info.user_tag = HTFakeRegionTag;
+    fake.info.pages_resident = 8;
+    fake.info.pages_dirtied = 8;
+    fake.info.object_id_full = 0;
+    fake.info.object_id = 0x5151;
+    script.regions = {purgeable, tagged, fake};
+    script.ledgerBalances = std::vector<int64_t>{5 * static_cast<int64_t>(kPage)};
+    platform_->ledgerTemplate = std::vector<std::string>{"page_table"};
+
+    auto process = gathered();
+    const auto& regions = process->memoryRegions();
+    ASSERT_EQ(regions.size(), 4u);
+    EXPECT_EQ(regions[1]->dirtySize(), 2 * kPage);
+    const HTMemoryRegion& held = *regions[2];
+    EXPECT_TRUE(held.isFake());
+    EXPECT_EQ(held.start(), HTNoAddress);
+    EXPECT_EQ(held.object_id(), 0x5151u);
+    EXPECT_EQ(held.dirtySize(), 6 * kPage);
+    EXPECT_TRUE(process->warnings().empty());
+
+    // The page tables come last.
+    const HTMemoryRegion& pageTables = *regions[3];
+    EXPECT_EQ(pageTables.name(), "page table");
+    EXPECT_EQ(pageTables.size(), 5 * kPage);
+    EXPECT_EQ(pageTables.dirtySize(), 5 * kPage);
+    EXPECT_EQ(pageTables.start(), HTNoAddress);
+    EXPECT_EQ(pageTables.object_id(), 0xFFFFFFFFFFFFFFFFu);
+    EXPECT_EQ(pageTables.share_mode(), SM_PRIVATE);
+
+    // Without the breakdown there is no ledger and no page-table region.
+    HTUserProcessProbe::_forgetLedgerTemplate();
+    setBreakdown(false);
+    auto plain = gathered();
+    for (const auto& region : plain->memoryRegions()) EXPECT_NE(region->name(), "page table");
+}
+
+TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses)
+{
+    HTFakePlatform::Process& script = addTarget();
+    script.regions = {anonymous(0x10000, 1), anonymous(0x20000, 1), anonymous(0x30000, 1)};
+    script.regionFailureIndex = 1;
+
+    // The process exits during the walk: what was read stays, with a warning.
+    auto process = created();
+    script.exited = true;
+    testing::internal::CaptureStderr();
+    process->gatherData();
+    EXPECT_EQ(testing::internal::GetCapturedStderr(),
+              "bailing out for process target [500]; data may be incomplete!\n");
+    EXPECT_EQ(platform_->machErrors.back(), "mach_vm_region_recurse: process is gone");
+    EXPECT_EQ(process->memoryRegions().size(), 1u);
+    EXPECT_TRUE(process->errors().empty());
+    ASSERT_EQ(process->warnings().size(), 1u);
+    EXPECT_EQ(process->warnings()[0], "target [500]: process is gone (process exited)");
+
+    script.exited = false;
+    script.info.pbi_status = SZOMB;
+    testing::internal::CaptureStderr();
+    auto zombie = gathered();
+    testing::internal::GetCapturedStderr();
+    ASSERT_EQ(zombie->warnings().size(), 1u);
+    EXPECT_EQ(zombie->warnings()[0], "target [500]: process is gone (zombie)");
+
+    // A running process, or another code: an error.
+    script.info.pbi_status = SRUN;
+    testing::internal::CaptureStderr();
+    auto running = gathered();
+    script.regionFailureCode = KERN_FAILURE;
+    auto failing = gathered();
+    testing::internal::GetCapturedStderr();
+    EXPECT_TRUE(running->warnings().empty());
+    EXPECT_EQ(running->errors(), std::vector<std::string>{"target [500]: process is gone"});
+    EXPECT_EQ(failing->errors(), std::vector<std::string>{"target [500]: failure"});
+}
+
+// --- sub-ranges ----------------------------------------------------------------
+
+namespace {
+
+struct Span {
+    uint64_t start, size, dirty, swapped, clean, reclaimable, wired;
+    bool operator==(const Span&) const = default;
+};
+
+std::ostream& operator<<(std::ostream& out, const Span& span)
+{
+    return out << "[" << span.start << "+" << span.size << " d" << span.dirty << " s" << span.swapped << " c"
+               << span.clean << " r" << span.reclaimable << " w" << span.wired << "]";
+}
+
+std::vector<Span> spans(const HTMemoryRegion& region)
+{
+    std::vector<Span> result;
+    if (!region.subrangeList()) return result;
+    for (const HTRangeListNode* node = region.subrangeList()->head(); node; node = node->next)
+        result.push_back({node->start, node->size, node->dirty, node->swapped, node->clean, node->reclaimable,
+                          node->wired});
+    return result;
+}
+
+}  // namespace
+
+class HTUserProcessSubrangeTest : public HTUserProcessTest {
+protected:
+    HTUserProcessSubrangeTest()
+    {
+        setBreakdown(true);
+        // An owned-object list that names none of the regions.
+        addTarget().ownedVmObjects = std::vector<HTFakePlatform::OwnedVmObject>{};
+    }
+
+    // Shared memory of `pages` pages at `start`, with mixed page counts.
+    Region& addShared(uint64_t start, uint64_t pages, uint64_t offset = 0)
+    {
+        Region region = anonymous(start, pages);
+        region.info.share_mode = SM_SHARED;
+        region.info.offset = offset;
+        region.info.pages_resident = static_cast<uint32_t>(pages - 1);
+        region.info.pages_dirtied = 1;
+        target().regions.push_back(region);
+        return target().regions.back();
+    }
+};
+
+TEST_F(HTUserProcessSubrangeTest, RunsOfOneKindBecomeSubranges)
+{
+    const int32_t present = VM_PAGE_QUERY_PAGE_PRESENT;
+    const int32_t dirty = present | VM_PAGE_QUERY_PAGE_DIRTY;
+    addShared(0x100000, 5, 0x40000);
+    std::vector<int32_t> kinds = {dirty, dirty, 0, present, present};
+    for (size_t i = 0; i < kinds.size(); ++i) target().dispositions[0x100000 + i * kPage] = kinds[i];
+
+    // Paged-out beats dirty; reusable pages are reclaimable; volatile
+    // objects make every present page reclaimable.
+    addShared(0x200000, 4).info.user_wired_count = 1;
+    target().dispositions[0x200000] = dirty | VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    target().dispositions[0x201000] = present | VM_PAGE_QUERY_PAGE_REUSABLE;
+    target().dispositions[0x203000] = present;
+    addShared(0x300000, 3).purgeState = VM_PURGABLE_VOLATILE;
+    target().dispositions[0x300000] = present;
+    target().dispositions[0x302000] = dirty;
+
+    auto process = gathered();
+    EXPECT_EQ(spans(regionAt(*process, 0x100000)),
+              (std::vector<Span>{{0x40000, 2 * kPage, 2 * kPage, 0, 0, 0, 0},
+                                 {0x40000 + 3 * kPage, 2 * kPage, 0, 0, 2 * kPage, 0, 0}}));
+    // Adjacent runs of one region share a span of the list.
+    EXPECT_EQ(spans(regionAt(*process, 0x200000)),
+              (std::vector<Span>{{0, 2 * kPage, 0, kPage, 0, kPage, 2 * kPage},
+                                 {3 * kPage, kPage, 0, 0, kPage, 0, kPage}}));
+    EXPECT_EQ(spans(regionAt(*process, 0x300000)),
+              (std::vector<Span>{{0, kPage, 0, 0, 0, kPage, 0}, {2 * kPage, kPage, kPage, 0, 0, 0, 0}}));
+}
+
+TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem)
+{
+    const uint64_t start = 0x10000000;
+    addShared(start, 5000);
+    for (uint64_t i = 10; i < 4200; ++i) target().dispositions[start + i * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
+    for (uint64_t i = 4201; i < 5000; ++i) target().dispositions[start + i * kPage] = VM_PAGE_QUERY_PAGE_PRESENT;
+
+    auto process = gathered();
+    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
+                                          {start, 4096 * kPage}, {start + 4096 * kPage, 904 * kPage}}));
+    EXPECT_EQ(spans(regionAt(*process, start)),
+              (std::vector<Span>{{10 * kPage, 4190 * kPage, 4190 * kPage, 0, 0, 0, 0},
+                                 {4201 * kPage, 799 * kPage, 0, 0, 799 * kPage, 0, 0}}));
+}
+
+TEST_F(HTUserProcessSubrangeTest, EmptyStretchesOfSparseRegionsAreNotQueried)
+{
+    // A 64 GiB reservation with two dirty pages far apart: only the two
+    // chunks that hold them are queried, and the runs land where a query of
+    // every page would have put them.
+    const uint64_t start = 0x100000000;
+    const uint64_t pages = 16 * 1024 * 1024;
+    addShared(start, pages, 0x1000);
+    const uint64_t far = pages - 5000;
+    target().dispositions[start + 7 * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
+    target().dispositions[start + far * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
+
+    auto process = gathered();
+    const uint64_t farChunk = far / 4096 * 4096;
+    EXPECT_EQ(platform_->pageQueries,
+              (std::vector<std::pair<uint64_t, uint64_t>>{{start, 4096 * kPage},
+                                                          {start + farChunk * kPage, 4096 * kPage}}));
+    EXPECT_EQ(spans(regionAt(*process, start)),
+              (std::vector<Span>{{0x1000 + 7 * kPage, kPage, kPage, 0, 0, 0, 0},
+                                 {0x1000 + far * kPage, kPage, kPage, 0, 0, 0, 0}}));
+}
+
+TEST_F(HTUserProcessSubrangeTest, NoSubrangesWhenSharingAnalysisIsOffOrProcessHidden)
+{
+    addShared(0x100000, 3);
+    target().dispositions[0x100000] = VM_PAGE_QUERY_PAGE_DIRTY;
+    HTHeft::setSharingAnalysisDisabled(true);
+    EXPECT_EQ(gathered()->memoryRegions()[0]->subrangeList(), nullptr);
+
+    HTHeft::setSharingAnalysisDisabled(false);
+    auto hidden = created();
+    hidden->setHiddenFromDisplay(true);
+    hidden->gatherData();
+    EXPECT_EQ(hidden->memoryRegions()[0]->subrangeList(), nullptr);
+    EXPECT_TRUE(platform_->pageQueries.empty());
+}
