@@ -147,6 +147,20 @@ struct ledger_entry_info {
     int64_t lei_last_refill;
 };
 
+// One VM object a task owns, as "vm.get_owned_vmobjects" lists it after a
+// 64-bit count: seven 64-bit words.
+struct vm_owned_object {
+    uint64_t object_id = 0;
+    uint64_t virtual_size = 0;
+    uint64_t resident_size = 0;
+    uint64_t wired_size = 0;
+    uint64_t reusable_size = 0;
+    uint64_t compressed_size = 0;
+    // Bit 0: not counted in the owner's heft; bits 4-5: purgeable state.
+    uint64_t flags = 0;
+};
+static_assert(sizeof(vm_owned_object) == 56, "an owned-object record is seven 64-bit words");
+
 // The process information record (136 bytes).
 struct proc_bsdinfo {
     uint32_t pbi_flags;

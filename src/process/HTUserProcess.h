@@ -15,22 +15,13 @@ class HTImage;
 class HTImageEnumerator;
 class HTMemoryRegion;
 
-// One VM object the process owns, as the kernel reports it.
-struct HTOwnedVmObject {
-    uint64_t object_id = 0;
-    uint64_t virtual_size = 0;
-    uint64_t resident_size = 0;
-    uint64_t wired_size = 0;
-    uint64_t reusable_size = 0;
-    uint64_t compressed_size = 0;
-    // Bit 0: not counted in the owner's heft; bits 4-5: purgeable state.
-    uint64_t flags = 0;
-
+// One VM object the process owns, with what it charges to its owner.
+struct HTOwnedVmObject : vm_owned_object {
     // The dirty and swapped bytes the object charges to its owner.
     uint64_t ownedDirtySize() const;
     uint64_t ownedSwappedSize() const;
 };
-static_assert(sizeof(HTOwnedVmObject) == 56, "the kernel's owned-object record is seven 64-bit words");
+static_assert(sizeof(HTOwnedVmObject) == sizeof(vm_owned_object), "read straight from the kernel's records");
 
 // The owned VM objects under their ids. Entries iterate in the order the
 // kernel listed them; taking one out leaves the others in place.

@@ -10,6 +10,8 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include "e2e/HTE2ESupport.h"
+
 #include <gtest/gtest.h>
 
 #include <cerrno>
@@ -23,9 +25,10 @@ extern char** environ;
 
 namespace {
 
-constexpr const char* kHeftBinary = HEFT_BINARY;
-constexpr const char* kSetpriv = "/usr/bin/setpriv";
-constexpr const char* kNobody = "65534";
+using heft_e2e::kSetpriv;
+using heft_e2e::Outcome;
+using heft_e2e::runHeft;
+using heft_e2e::runHeftAsNobody;
 
 // Written out in full so that any change to the usage text shows up here.
 constexpr const char* kUsage =
@@ -50,101 +53,12 @@ constexpr const char* kUsage =
 constexpr const char* kNoProcesses =
     "Unable to find any processes matching the supplied process names or pids (try as root?)\n";
 
-struct Outcome {
-    int status = -1;  // the exit status, or -1 when the program did not exit normally
-    std::string standardOutput;
-    std::string standardError;
-};
-
 std::vector<char*> pointersTo(std::vector<std::string>& strings)
 {
     std::vector<char*> pointers;
     for (auto& string : strings) pointers.push_back(string.data());
     pointers.push_back(nullptr);
     return pointers;
-}
-
-// Reads both pipes to their end at once, so that neither fills up while
-// the other is waited on.
-void drain(int outputFd, int errorFd, Outcome& outcome)
-{
-    struct pollfd fds[2] = {{outputFd, POLLIN, 0}, {errorFd, POLLIN, 0}};
-    std::string* sinks[2] = {&outcome.standardOutput, &outcome.standardError};
-    int openStreams = 2;
-    while (openStreams > 0) {
-        if (poll(fds, 2, -1) < 0) {
-            if (errno == EINTR) continue;
-            break;
-        }
-        for (int i = 0; i < 2; ++i) {
-            if (fds[i].fd < 0 || fds[i].revents == 0) continue;
-            char buffer[4096];
-            ssize_t count = read(fds[i].fd, buffer, sizeof(buffer));
-            if (count > 0) {
-                sinks[i]->append(buffer, static_cast<size_t>(count));
-            } else if (count == 0 || errno != EINTR) {
-                close(fds[i].fd);
-                fds[i].fd = -1;
-                --openStreams;
-            }
-        }
-    }
-}
-
-// Runs `program` with `arguments` (arguments[0] is the name the program sees
-// itself called by), capturing both streams and the exit status.
-Outcome runProgram(const char* program, std::vector<std::string> arguments)
-{
-    Outcome outcome;
-    int outputPipe[2];
-    int errorPipe[2];
-    if (pipe2(outputPipe, O_CLOEXEC) != 0 || pipe2(errorPipe, O_CLOEXEC) != 0) {
-        ADD_FAILURE() << "pipe2: " << std::strerror(errno);
-        return outcome;
-    }
-    std::vector<char*> argv = pointersTo(arguments);
-
-    pid_t child = fork();
-    if (child == 0) {
-        dup2(outputPipe[1], STDOUT_FILENO);
-        dup2(errorPipe[1], STDERR_FILENO);
-        // heft is built with AddressSanitizer, and its leak check runs at
-        // every exit, under setpriv too, so a leak fails these tests. Where
-        // ptrace is restricted the check itself cannot run: set
-        // ASAN_OPTIONS=detect_leaks=0 for the suite there; heft inherits it.
-        execve(program, argv.data(), environ);
-        _exit(127);
-    }
-    close(outputPipe[1]);
-    close(errorPipe[1]);
-    if (child < 0) {
-        ADD_FAILURE() << "fork: " << std::strerror(errno);
-        close(outputPipe[0]);
-        close(errorPipe[0]);
-        return outcome;
-    }
-    drain(outputPipe[0], errorPipe[0], outcome);
-    int status = 0;
-    while (waitpid(child, &status, 0) < 0 && errno == EINTR) {}
-    outcome.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    return outcome;
-}
-
-// heft as the user calls it, named "heft" so that the option parser's
-// diagnostics carry that name.
-Outcome runHeft(std::vector<std::string> arguments)
-{
-    arguments.insert(arguments.begin(), "heft");
-    return runProgram(kHeftBinary, std::move(arguments));
-}
-
-// heft run by the unprivileged user nobody.
-Outcome runHeftAsNobody(std::vector<std::string> arguments)
-{
-    std::vector<std::string> command = {"setpriv", std::string("--reuid=") + kNobody,
-                                        std::string("--regid=") + kNobody, "--clear-groups", kHeftBinary};
-    command.insert(command.end(), arguments.begin(), arguments.end());
-    return runProgram(kSetpriv, std::move(command));
 }
 
 #define SKIP_UNLESS_ROOT_WITH_SETPRIV()                                                                 \

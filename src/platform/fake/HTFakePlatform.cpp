@@ -385,7 +385,6 @@ int HTFakePlatform::ownedVmObjects(void* oldp, size_t* oldlenp, const void* newp
         return -1;
     }
 
-    static_assert(sizeof(OwnedVmObject) == 56, "an owned-object record is seven 64-bit words");
     const std::vector<OwnedVmObject>& objects = *found->ownedVmObjects;
     const size_t needed = sizeof(uint64_t) + objects.size() * sizeof(OwnedVmObject);
     if (oldp == nullptr) {

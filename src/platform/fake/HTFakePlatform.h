@@ -35,15 +35,7 @@ public:
     };
 
     // One owned VM object as "vm.get_owned_vmobjects" reports it.
-    struct OwnedVmObject {
-        uint64_t object_id = 0;
-        uint64_t virtual_size = 0;
-        uint64_t resident_size = 0;
-        uint64_t wired_size = 0;
-        uint64_t reusable_size = 0;
-        uint64_t compressed_size = 0;
-        uint64_t flags = 0;
-    };
+    using OwnedVmObject = vm_owned_object;
 
     struct Process {
         proc_bsdinfo info{};

@@ -530,20 +530,27 @@ kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
     return KERN_SUCCESS;
 }
 
+kern_return_t HTLinuxPlatform::vmaAtOrAbove(HTTaskPort& task, uint64_t address, const HTSmapsEntry** vma)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr) return KERN_INVALID_ARGUMENT;
+    // A walk starts at address 0: that is when the mappings are read anew.
+    kern_return_t loaded = loadVmas(*linuxTask, address == 0);
+    if (loaded != KERN_SUCCESS) return loaded;
+    *vma = linuxTask->vmaAtOrAbove(address);
+    return *vma == nullptr ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
+}
+
 kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
                                                       uint32_t* depth, vm_region_submap_info_64* info,
                                                       uint32_t* count)
 {
-    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
-    if (linuxTask == nullptr || address == nullptr || size == nullptr || info == nullptr || count == nullptr)
-        return KERN_INVALID_ARGUMENT;
-    // A walk starts at address 0: that is when the mappings are read anew.
-    kern_return_t loaded = loadVmas(*linuxTask, *address == 0);
-    if (loaded != KERN_SUCCESS) return loaded;
-    const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(*address);
-    if (vma == nullptr) return KERN_INVALID_ADDRESS;
+    if (address == nullptr || size == nullptr || info == nullptr || count == nullptr) return KERN_INVALID_ARGUMENT;
+    const HTSmapsEntry* vma = nullptr;
+    kern_return_t found = vmaAtOrAbove(task, *address, &vma);
+    if (found != KERN_SUCCESS) return found;
     // Linux has no submaps: the depth stays as it was.
-    *info = htSubmapInfo(*vma, linuxTask->pid(), vm_kernel_page_size());
+    *info = htSubmapInfo(*vma, task.pid(), vm_kernel_page_size());
     *address = vma->start;
     *size = vma->size();
     *count = VM_REGION_SUBMAP_INFO_COUNT_64;
@@ -553,13 +560,10 @@ kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t
 kern_return_t HTLinuxPlatform::mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
                                               vm_region_basic_info_64* info, uint32_t* count)
 {
-    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
-    if (linuxTask == nullptr || address == nullptr || size == nullptr || info == nullptr || count == nullptr)
-        return KERN_INVALID_ARGUMENT;
-    kern_return_t loaded = loadVmas(*linuxTask, *address == 0);
-    if (loaded != KERN_SUCCESS) return loaded;
-    const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(*address);
-    if (vma == nullptr) return KERN_INVALID_ADDRESS;
+    if (address == nullptr || size == nullptr || info == nullptr || count == nullptr) return KERN_INVALID_ARGUMENT;
+    const HTSmapsEntry* vma = nullptr;
+    kern_return_t found = vmaAtOrAbove(task, *address, &vma);
+    if (found != KERN_SUCCESS) return found;
     *info = htBasicInfo(*vma);
     *address = vma->start;
     *size = vma->size();

@@ -15,6 +15,8 @@
 class HTLinuxTaskPort;
 struct HTProcStatus;
 
+struct HTSmapsEntry;
+
 class HTLinuxPlatform : public HTPlatform {
 public:
     HTLinuxPlatform();
@@ -77,6 +79,9 @@ public:
     bool stat(const char* path) override;
 
 private:
+    // The task's first mapping that ends above the address, read anew when
+    // the address is 0 (a walk begins); KERN_INVALID_ADDRESS when none.
+    kern_return_t vmaAtOrAbove(HTTaskPort& task, uint64_t address, const HTSmapsEntry** vma);
     // Opens /proc/PID as a directory; -1 with errno (ESRCH when it is gone).
     int openProcessDirectory(int32_t pid) const;
     // The record of a process (or of the kernel for pid 0); false with
