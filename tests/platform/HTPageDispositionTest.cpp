@@ -4,6 +4,8 @@
 
 #include <gtest/gtest.h>
 
+#include <vector>
+
 namespace {
 
 constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
@@ -22,13 +24,12 @@ constexpr uint64_t kSwappedEntry = HT_PAGEMAP_SWAPPED | 0x5678;
 constexpr HTPageMapping kPrivate{};
 constexpr HTPageMapping kSharedMemory{true, false};
 constexpr HTPageMapping kHugetlb{false, true};
+constexpr HTPageMapping kCleanFile{false, false, true};
 
 int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPrivate)
 {
     return htPageDisposition(entry, &flags, mapping);
 }
-
-}  // namespace
 
 TEST(HTPageDisposition, WithPhysicalPageFlags)
 {
@@ -62,6 +63,47 @@ TEST(HTPageDisposition, FromThePagemapAlone)
     EXPECT_EQ(withFlags(kSwappedEntry, HT_KPF_ANON), kPagedOut);
     EXPECT_EQ(htPagemapFrame(kSwappedEntry), 0u);
     EXPECT_EQ(htPagemapFrame(kFileEntry), kFrame);
+}
+
+// The kpageflags a present page can have in such a mapping, as far as the
+// rules look at them.
+std::vector<uint64_t> possibleFlags(uint64_t entry, HTPageMapping mapping)
+{
+    const bool file = (entry & HT_PAGEMAP_FILE_OR_SHARED) != 0;
+    if (mapping.hugetlb) return {0, HT_KPF_DIRTY, HT_KPF_ANON, HT_KPF_ANON | HT_KPF_DIRTY};
+    // Shared memory pages are always swap-backed.
+    if (mapping.sharedMemory && file) return {HT_KPF_SWAPBACKED, HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
+    // Clean page cache; copies made on write, never freed with MADV_FREE.
+    if (mapping.cleanFile)
+        return file ? std::vector<uint64_t>{0}
+                    : std::vector<uint64_t>{HT_KPF_ANON | HT_KPF_SWAPBACKED,
+                                            HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
+    return {};
+}
+
+}  // namespace
+
+TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
+{
+    // Wherever the flags are skipped, every flag combination the kernel can
+    // give such a page must lead to the pagemap-only answer.
+    const uint64_t entries[] = {0, kPresentEntry, kFileEntry, kSwappedEntry};
+    const HTPageMapping mappings[] = {kPrivate, kSharedMemory, kHugetlb, kCleanFile};
+    for (uint64_t entry : entries) {
+        for (HTPageMapping mapping : mappings) {
+            if (htPageFlagsMatter(entry, mapping)) continue;
+            for (uint64_t flags : possibleFlags(entry, mapping))
+                EXPECT_EQ(withFlags(entry, flags, mapping), htPageDisposition(entry, nullptr, mapping))
+                    << std::hex << entry << " " << flags;
+        }
+    }
+    // File pages, anonymous pages (MADV_FREE, the zero page) and copies in
+    // a private mapping of shared memory need them.
+    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPrivate));
+    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kPrivate));
+    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kSharedMemory));
+    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kSharedMemory));
+    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kCleanFile));
 }
 
 TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)

@@ -5,6 +5,7 @@
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTLinuxTaskPort.h"
 #include "platform/linux/HTPageDisposition.h"
+#include "platform/linux/HTPageQueryChunk.h"
 #include "platform/linux/HTProcArgs.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
@@ -117,8 +118,21 @@ ssize_t preadFully(int fd, void* buffer, size_t length, uint64_t offset)
     return static_cast<ssize_t>(done);
 }
 
-// Pages a page query reads at once: 32 KiB of pagemap.
-constexpr size_t kPageQueryChunk = 4096;
+constexpr size_t kPageQueryChunk = HTPageQueryChunk::kPages;
+
+HTPageMapping pageMapping(const HTSmapsEntry& vma)
+{
+    HTPageMapping mapping;
+    mapping.sharedMemory = vma.isSharedMemory();
+    mapping.hugetlb = vma.hasFlag(HTVmFlagHugetlb);
+    // A block device's file systems keep their pages on the device, never in
+    // swap (tmpfs and its kin sit on anonymous devices, major number 0), and
+    // without a dirty page, counted from the same smaps as the walk, no file
+    // page can be dirty. Device memory has frames of its own kind.
+    mapping.cleanFile = vma.kind == HTSmapsKind::File && vma.devMajor != 0 && vma.sharedDirty == 0 &&
+                        vma.privateDirty == 0 && !vma.hasFlag(HTVmFlagIO) && !vma.hasFlag(HTVmFlagPfnMap);
+    return mapping;
+}
 
 }  // namespace
 
@@ -602,9 +616,8 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     if (pagemap < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
     int pageFlagsFd = kpageflagsFd();
 
-    thread_local std::array<uint64_t, kPageQueryChunk> entries;
-    thread_local std::array<uint64_t, kPageQueryChunk> pageFlags;
-    thread_local std::array<bool, kPageQueryChunk> pageFlagsKnown;
+    thread_local HTPageQueryChunk chunkData;
+    auto& entries = chunkData.entries;
     const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
     size_t vmaIndex = 0;
 
@@ -623,38 +636,15 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
                       0);
         }
 
-        // The flags of physical pages, one read for each run of
-        // consecutive frame numbers.
-        std::fill(pageFlagsKnown.begin(), pageFlagsKnown.begin() + static_cast<ptrdiff_t>(chunk), false);
-        if (pageFlagsFd >= 0) {
-            for (size_t at = 0; at < chunk;) {
-                uint64_t frame = htPagemapFrame(entries[at]);
-                if (frame == 0) {
-                    ++at;
-                    continue;
-                }
-                size_t runEnd = at + 1;
-                while (runEnd < chunk && htPagemapFrame(entries[runEnd]) == frame + (runEnd - at)) ++runEnd;
-                ssize_t flagBytes = preadFully(pageFlagsFd, pageFlags.data() + at, (runEnd - at) * sizeof(uint64_t),
-                                               frame * sizeof(uint64_t));
-                size_t known = flagBytes > 0 ? static_cast<size_t>(flagBytes) / sizeof(uint64_t) : 0;
-                std::fill(pageFlagsKnown.begin() + static_cast<ptrdiff_t>(at),
-                          pageFlagsKnown.begin() + static_cast<ptrdiff_t>(at + known), true);
-                at = runEnd;
-            }
-        }
-
         for (size_t at = 0; at < chunk; ++at) {
             uint64_t pageAddress = (chunkPage + at) * pageSize;
             while (vmaIndex < vmas.size() && vmas[vmaIndex].end <= pageAddress) ++vmaIndex;
             HTPageMapping mapping;
-            if (vmaIndex < vmas.size() && vmas[vmaIndex].start <= pageAddress) {
-                mapping.sharedMemory = vmas[vmaIndex].isSharedMemory();
-                mapping.hugetlb = vmas[vmaIndex].hasFlag(HTVmFlagHugetlb);
-            }
-            dispositions[done + at] =
-                htPageDisposition(entries[at], pageFlagsKnown[at] ? &pageFlags[at] : nullptr, mapping);
+            if (vmaIndex < vmas.size() && vmas[vmaIndex].start <= pageAddress) mapping = pageMapping(vmas[vmaIndex]);
+            chunkData.mappings[at] = mapping;
         }
+        chunkData.readPageFlags(pageFlagsFd, chunk);
+        for (size_t at = 0; at < chunk; ++at) dispositions[done + at] = chunkData.disposition(at);
         done += chunk;
     }
     *count = pages;
@@ -751,10 +741,18 @@ int HTLinuxPlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int
 
 std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path)
 {
-    char* resolved = ::realpath(path.c_str(), nullptr);
-    if (resolved == nullptr) return std::nullopt;
-    std::string result(resolved);
-    std::free(resolved);
+    {
+        std::lock_guard<std::mutex> guard(realpathLock_);
+        auto found = realpaths_.find(path);
+        if (found != realpaths_.end()) return found->second;
+    }
+    std::optional<std::string> result;
+    if (char* resolved = ::realpath(path.c_str(), nullptr)) {
+        result = resolved;
+        std::free(resolved);
+    }
+    std::lock_guard<std::mutex> guard(realpathLock_);
+    realpaths_.emplace(path, result);
     return result;
 }
 

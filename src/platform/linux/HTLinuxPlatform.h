@@ -11,6 +11,9 @@
 #include <atomic>
 #include <cstdint>
 #include <mutex>
+#include <optional>
+#include <string>
+#include <unordered_map>
 
 class HTLinuxTaskPort;
 struct HTProcStatus;
@@ -110,4 +113,8 @@ private:
     int kpageflagsFd_ = -1;
     // Parsed program headers are cached per file for the whole run.
     HTElfImageReader imageReader_;
+    // Resolved paths, for the whole run: every process maps the same
+    // libraries, and resolving one path reads every link on the way.
+    std::mutex realpathLock_;
+    std::unordered_map<std::string, std::optional<std::string>> realpaths_;
 };

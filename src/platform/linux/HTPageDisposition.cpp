@@ -27,3 +27,11 @@ int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPa
     if (present && !external) disposition |= VM_PAGE_QUERY_PAGE_DIRTY;
     return disposition;
 }
+
+bool htPageFlagsMatter(uint64_t pagemapEntry, HTPageMapping mapping)
+{
+    if ((pagemapEntry & HT_PAGEMAP_PRESENT) == 0 || mapping.hugetlb || mapping.cleanFile) return false;
+    // A page copied on write into a private mapping of shared memory is
+    // anonymous, and may have been freed with MADV_FREE.
+    return !(mapping.sharedMemory && (pagemapEntry & HT_PAGEMAP_FILE_OR_SHARED) != 0);
+}

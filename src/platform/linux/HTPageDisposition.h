@@ -21,6 +21,10 @@ inline constexpr uint64_t HT_KPF_SWAPBACKED = uint64_t{1} << 14;
 struct HTPageMapping {
     bool sharedMemory = false;  // memfd, /dev/shm, System V, MAP_SHARED anonymous
     bool hugetlb = false;       // hugetlbfs pages: memory only, never reclaimable
+    // A file on a block device, with no dirty page in the mapping: its file
+    // pages are clean page cache with backing store, and its anonymous pages
+    // are private copies, which MADV_FREE cannot touch in a file mapping.
+    bool cleanFile = false;
 };
 
 // The frame number of a present page; 0 when the reader may not see it.
@@ -33,3 +37,10 @@ inline uint64_t htPagemapFrame(uint64_t entry)
 // or null when it is not known (an unprivileged reader, a page without a
 // frame number); the rules then rest on the pagemap and the mapping alone.
 int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPageMapping mapping);
+
+// Whether the page's kpageflags can change its disposition. Pages of shared
+// memory and hugetlbfs are always swap-backed, and a clean file mapping has
+// nothing for the flags to add, so the pagemap and the mapping already say
+// everything; skipping their flags saves a read per page or folio, and
+// these are the pages whose frames lie most scattered.
+bool htPageFlagsMatter(uint64_t pagemapEntry, HTPageMapping mapping);
