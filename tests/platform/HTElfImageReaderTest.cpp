@@ -132,7 +132,7 @@ std::shared_ptr<HTLinuxTaskPort> openTask(pid_t pid)
     std::string directory = "/proc/" + std::to_string(pid);
     int dirfd = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
     if (dirfd < 0) return nullptr;
-    return std::make_shared<HTLinuxTaskPort>(pid, dirfd, -1);
+    return std::make_shared<HTLinuxTaskPort>(pid, dirfd);
 }
 
 std::vector<HTPlatformImage> listImages(HTElfImageReader& reader, HTLinuxTaskPort& task)

@@ -364,6 +364,58 @@ TEST(HTLinuxAddressSpace, PagesFreedWithMadvFreeAreReusable)
         EXPECT_EQ(pages[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE) << "page " << i;
 }
 
+TEST(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
+{
+    // Anonymous memory that is only read holds the shared zero page on most
+    // kernels (and, in a huge-page-aligned stretch, the huge zero page); a
+    // kernel may also give such a read a page of its own. Whichever it did,
+    // the answer must be what the page's own flags say: zero pages are
+    // present but cost nothing, other pages are dirty memory.
+    if (!pageFlagsReadable()) GTEST_SKIP() << "needs /proc/kpageflags (root)";
+    constexpr size_t kHuge = 2u << 20;
+    const size_t page = pageSize();
+    void* base = ::mmap(nullptr, 3 * kHuge, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    ASSERT_NE(base, MAP_FAILED);
+    auto* aligned = reinterpret_cast<volatile char*>((reinterpret_cast<uintptr_t>(base) + kHuge - 1) & ~(kHuge - 1));
+    ::madvise(const_cast<char*>(aligned), kHuge, MADV_HUGEPAGE);
+    const size_t pages = kHuge / page + 8;
+    char sink = 0;
+    for (size_t i = 0; i < pages; ++i) sink = static_cast<char>(sink + aligned[i * page]);
+    aligned[kHuge + 4 * page] = sink;  // one page written among the read ones
+
+    HTLinuxPlatform platform;
+    std::shared_ptr<HTTaskPort> task;
+    ASSERT_EQ(platform.task_for_pid(::getpid(), &task), KERN_SUCCESS);
+    kern_return_t result;
+    walk(platform, *task, result);
+    const auto start = reinterpret_cast<uint64_t>(aligned);
+    std::vector<int32_t> answers = dispositions(platform, *task, start, pages, result);
+    ASSERT_EQ(result, KERN_SUCCESS);
+
+    int pagemap = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
+    int kpageflags = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
+    ASSERT_GE(pagemap, 0);
+    ASSERT_GE(kpageflags, 0);
+    constexpr uint64_t kZeroPageFlag = uint64_t{1} << 24;
+    for (size_t i = 0; i < pages; ++i) {
+        uint64_t entry = 0;
+        uint64_t flags = 0;
+        ASSERT_EQ(::pread(pagemap, &entry, sizeof(entry), static_cast<off_t>((start / page + i) * sizeof(entry))),
+                  static_cast<ssize_t>(sizeof(entry)));
+        uint64_t frame = entry & ((uint64_t{1} << 55) - 1);
+        ASSERT_EQ(::pread(kpageflags, &flags, sizeof(flags), static_cast<off_t>(frame * sizeof(flags))),
+                  static_cast<ssize_t>(sizeof(flags)));
+        int32_t present = VM_PAGE_QUERY_PAGE_PRESENT;
+        if ((flags & kZeroPageFlag) != 0)
+            EXPECT_EQ(answers[i] & ~VM_PAGE_QUERY_PAGE_EXTERNAL, present) << "zero page " << i;
+        else
+            EXPECT_EQ(answers[i], present | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
+    }
+    ::close(pagemap);
+    ::close(kpageflags);
+    ::munmap(base, 3 * kHuge);
+}
+
 TEST(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
 {
     ScratchFile file;

@@ -9,6 +9,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <string>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <vector>
 
@@ -248,6 +249,27 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
     EXPECT_EQ(WEXITSTATUS(status), 0) << "1: argument area, 2: task port, 4: record";
 }
 
+TEST(HTLinuxPlatform, RaisesTheDescriptorLimitToItsCeiling)
+{
+    // In a child, so that the test's own limit stays as it was.
+    pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) {
+        rlimit files{};
+        if (::getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_max < 2) ::_exit(2);
+        files.rlim_cur = files.rlim_max / 2;
+        if (::setrlimit(RLIMIT_NOFILE, &files) != 0) ::_exit(3);
+        HTLinuxPlatform platform;
+        rlimit raised{};
+        ::getrlimit(RLIMIT_NOFILE, &raised);
+        ::_exit(raised.rlim_cur == files.rlim_max ? 0 : 1);
+    }
+    int status = 0;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    ASSERT_TRUE(WIFEXITED(status));
+    EXPECT_EQ(WEXITSTATUS(status), 0);
+}
+
 TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
 {
     HTLinuxPlatform platform;
@@ -258,7 +280,6 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     EXPECT_EQ(linuxTask->pid(), ::getpid());
     // The directory descriptor reads the process's files.
     EXPECT_EQ(::faccessat(linuxTask->procDirFd(), "smaps", R_OK, 0), 0);
-    EXPECT_GE(linuxTask->pidFd(), 0);
     int dirFd = linuxTask->procDirFd();
     task.reset();
     EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle closes its descriptors";

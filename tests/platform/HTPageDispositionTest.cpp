@@ -24,7 +24,8 @@ constexpr uint64_t kSwappedEntry = HT_PAGEMAP_SWAPPED | 0x5678;
 constexpr HTPageMapping kPrivate{};
 constexpr HTPageMapping kSharedMemory{true, false};
 constexpr HTPageMapping kHugetlb{false, true};
-constexpr HTPageMapping kCleanFile{false, false, true};
+constexpr HTPageMapping kCleanFile{false, false, true, false};
+constexpr HTPageMapping kPlainAnonymous{false, false, false, true};
 
 int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPrivate)
 {
@@ -71,6 +72,8 @@ std::vector<uint64_t> possibleFlags(uint64_t entry, HTPageMapping mapping)
 {
     const bool file = (entry & HT_PAGEMAP_FILE_OR_SHARED) != 0;
     if (mapping.hugetlb) return {0, HT_KPF_DIRTY, HT_KPF_ANON, HT_KPF_ANON | HT_KPF_DIRTY};
+    // Neither the zero page nor freed: swap-backed anonymous memory.
+    if (mapping.plainAnonymous && !file) return {HT_KPF_ANON | HT_KPF_SWAPBACKED, HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
     // Shared memory pages are always swap-backed.
     if (mapping.sharedMemory && file) return {HT_KPF_SWAPBACKED, HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
     // Clean page cache; copies made on write, never freed with MADV_FREE.
@@ -88,7 +91,7 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     // Wherever the flags are skipped, every flag combination the kernel can
     // give such a page must lead to the pagemap-only answer.
     const uint64_t entries[] = {0, kPresentEntry, kFileEntry, kSwappedEntry};
-    const HTPageMapping mappings[] = {kPrivate, kSharedMemory, kHugetlb, kCleanFile};
+    const HTPageMapping mappings[] = {kPrivate, kSharedMemory, kHugetlb, kCleanFile, kPlainAnonymous};
     for (uint64_t entry : entries) {
         for (HTPageMapping mapping : mappings) {
             if (htPageFlagsMatter(entry, mapping)) continue;
@@ -104,6 +107,8 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kSharedMemory));
     EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kSharedMemory));
     EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kCleanFile));
+    EXPECT_FALSE(htPageFlagsMatter(kPresentEntry, kPlainAnonymous));
+    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPlainAnonymous));
 }
 
 TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)

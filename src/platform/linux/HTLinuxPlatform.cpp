@@ -23,13 +23,10 @@
 #include <elf.h>
 #include <fcntl.h>
 #include <string_view>
+#include <sys/resource.h>
 #include <sys/stat.h>
-#include <sys/syscall.h>
 #include <unistd.h>
 
-#ifndef SYS_pidfd_open
-#define SYS_pidfd_open 434
-#endif
 
 namespace {
 
@@ -61,9 +58,11 @@ bool pidFromName(const char* name, int32_t& pid)
 // Whether the executable behind /proc/PID/exe is a 64-bit ELF object; when
 // it cannot be read (another user's process without root, a zombie, a
 // format other than ELF), heft's own bitness stands in.
-bool executableIs64bit(int dirfd)
+bool executableIs64bit(int procFd, int32_t pid)
 {
-    int fd = ::openat(dirfd, "exe", O_RDONLY | O_CLOEXEC);
+    char path[48];
+    formatPidPath(path, pid, "/exe");
+    int fd = ::openat(procFd, path, O_RDONLY | O_CLOEXEC);
     if (fd < 0) return kHeftIs64bit;
     unsigned char ident[EI_NIDENT];
     ssize_t count = ::pread(fd, ident, sizeof(ident), 0);
@@ -89,7 +88,7 @@ void closeKeepingErrno(int fd)
 bool processHasExited(int dirfd)
 {
     thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(dirfd, "stat")) return errno == ESRCH || errno == ENOENT;
+    if (!buffer.readFile(dirfd, "stat", HTProcBuffer::End::ShortRead)) return errno == ESRCH || errno == ENOENT;
     std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
     return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x';
 }
@@ -120,17 +119,29 @@ ssize_t preadFully(int fd, void* buffer, size_t length, uint64_t offset)
 
 constexpr size_t kPageQueryChunk = HTPageQueryChunk::kPages;
 
-HTPageMapping pageMapping(const HTSmapsEntry& vma)
+// What the page rules need to know of the mapping at `index`.
+HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
 {
+    const HTSmapsEntry& vma = task.vmas()[index];
     HTPageMapping mapping;
     mapping.sharedMemory = vma.isSharedMemory();
     mapping.hugetlb = vma.hasFlag(HTVmFlagHugetlb);
+    // Device memory has frames of its own kind.
+    if (vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) || vma.hasFlag(HTVmFlagMixedMap)) return mapping;
     // A block device's file systems keep their pages on the device, never in
     // swap (tmpfs and its kin sit on anonymous devices, major number 0), and
     // without a dirty page, counted from the same smaps as the walk, no file
-    // page can be dirty. Device memory has frames of its own kind.
+    // page can be dirty.
     mapping.cleanFile = vma.kind == HTSmapsKind::File && vma.devMajor != 0 && vma.sharedDirty == 0 &&
-                        vma.privateDirty == 0 && !vma.hasFlag(HTVmFlagIO) && !vma.hasFlag(HTVmFlagPfnMap);
+                        vma.privateDirty == 0;
+    // The anonymous pages of a file's mapping are its copies on write: the
+    // zero page only fills anonymous memory, and MADV_FREE takes nothing
+    // else. Anonymous memory says in smaps what it holds freed, and the
+    // kernel whether it may hold a zero page.
+    if (vma.kind == HTSmapsKind::File || vma.isSharedMemory())
+        mapping.plainAnonymous = true;
+    else if (vma.kind != HTSmapsKind::KernelProvided && vma.lazyFree == 0)
+        mapping.plainAnonymous = task.mayMapZeroPage(index) == false;
     return mapping;
 }
 
@@ -142,6 +153,14 @@ HTLinuxPlatform::HTLinuxPlatform()
     if (procFd_ < 0) procErrno_ = errno;
     long ticks = ::sysconf(_SC_CLK_TCK);
     if (ticks > 0) clockTicks_ = ticks;
+    // Every process handle keeps its /proc directory (and, once walked, its
+    // pagemap) open until the report is out: thousands of processes need
+    // more descriptors than the usual soft limit of 1024.
+    rlimit files{};
+    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+        files.rlim_cur = files.rlim_max;
+        ::setrlimit(RLIMIT_NOFILE, &files);
+    }
 }
 
 HTLinuxPlatform::~HTLinuxPlatform()
@@ -198,33 +217,48 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
         fillKernelInfo(info);
         return true;
     }
-    int dirfd = openProcessDirectory(pid);
-    if (dirfd < 0) return false;
-
+    if (procFd_ < 0) {
+        errno = procErrno_;
+        return false;
+    }
+    if (pid < 0) {
+        errno = ESRCH;
+        return false;
+    }
     // Reused by every call on this thread: a listing reads thousands.
     thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(dirfd, "stat")) {
+    char path[48];
+    formatPidPath(path, pid, "/stat");
+    int fd = ::openat(procFd_, path, O_RDONLY | O_CLOEXEC);
+    if (fd < 0) {
         if (errno == ENOENT) errno = ESRCH;
-        closeKeepingErrno(dirfd);
+        return false;
+    }
+    // Every file of /proc/PID belongs to the process's effective user and
+    // group (to root when the process is not dumpable).
+    struct stat owner {};
+    bool ownerKnown = ::fstat(fd, &owner) == 0;
+    bool read = buffer.readDescriptor(fd, HTProcBuffer::End::ShortRead);
+    closeKeepingErrno(fd);
+    if (!read) {
+        if (errno == ENOENT) errno = ESRCH;
         return false;
     }
     std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
     if (!stat || stat->isKernelThread()) {
-        ::close(dirfd);
         errno = ESRCH;
         return false;
     }
 
     info = proc_bsdinfo{};
-    // /proc/PID belongs to the process's effective user and group (to root
-    // when the process is not dumpable).
-    struct stat owner {};
-    if (::fstat(dirfd, &owner) == 0) {
+    if (ownerKnown) {
         info.pbi_uid = info.pbi_ruid = info.pbi_svuid = owner.st_uid;
         info.pbi_gid = info.pbi_rgid = info.pbi_svgid = owner.st_gid;
     }
-    bool is64bit = executableIs64bit(dirfd);
-    ::close(dirfd);
+    // A 64-bit address space puts the stack above 4 GiB; a 32-bit process
+    // (ia32 or x32) has none above it. Only when the stack is hidden from
+    // heft does the executable's ELF class decide.
+    bool is64bit = stat->startstack != 0 ? stat->startstack > UINT32_MAX : executableIs64bit(procFd_, pid);
 
     info.pbi_flags = is64bit ? PROC_FLAG_LP64 : 0;
     info.pbi_status = htProcStatusForState(stat->state);
@@ -298,7 +332,7 @@ int HTLinuxPlatform::proc_listallpids(int32_t* buffer, int bufferSize)
             continue;
         }
         formatPidPath(path, pid, "/stat");
-        if (!statBuffer.readFile(procFd_, path)) continue;
+        if (!statBuffer.readFile(procFd_, path, HTProcBuffer::End::ShortRead)) continue;
         std::optional<HTProcStat> stat = htParseProcStat(statBuffer.view());
         if (!stat || stat->isKernelThread()) continue;
         buffer[count++] = pid;
@@ -354,38 +388,44 @@ int HTLinuxPlatform::readProcArgs(int32_t pid, void* oldp, size_t* oldlenp)
         errno = EINVAL;
         return -1;
     }
-    int dirfd = openProcessDirectory(pid);
-    if (dirfd < 0) return -1;
+    // By path rather than through a directory descriptor: the name is all
+    // this is for, and two system calls fewer count over thousands of
+    // processes.
+    char path[48];
+    formatPidPath(path, pid, "/exe");
     char link[PATH_MAX + 1];
-    ssize_t linkLength = ::readlinkat(dirfd, "exe", link, sizeof(link));
+    ssize_t linkLength = ::readlinkat(procFd_, path, link, sizeof(link));
     if (linkLength < 0) {
-        closeKeepingErrno(dirfd);
+        // A zombie has lost its executable (ENOENT); a process that is
+        // gone has lost its directory as well.
+        formatPidPath(path, pid, "");
+        struct stat directory {};
+        if (errno == ENOENT && ::fstatat(procFd_, path, &directory, 0) != 0) errno = ESRCH;
         return -1;
     }
     if (static_cast<size_t>(linkLength) == sizeof(link)) {
-        ::close(dirfd);
         errno = ENAMETOOLONG;
         return -1;
     }
     thread_local HTProcBuffer cmdline;
-    if (!cmdline.readFile(dirfd, "cmdline")) {
+    formatPidPath(path, pid, "/cmdline");
+    if (!cmdline.readFile(procFd_, path, HTProcBuffer::End::ShortRead)) {
         if (errno == ENOENT) errno = ESRCH;
-        closeKeepingErrno(dirfd);
         return -1;
     }
-    ::close(dirfd);
 
-    std::string_view path = htExecutablePathFromLink(std::string_view(link, static_cast<size_t>(linkLength)));
-    size_t total = htBuildProcArgs(path, cmdline.view(), nullptr, 0);
+    std::string_view executable =
+        htExecutablePathFromLink(std::string_view(link, static_cast<size_t>(linkLength)));
+    size_t total = htBuildProcArgs(executable, cmdline.view(), nullptr, 0);
     if (oldp == nullptr) {
         *oldlenp = total;
         return 0;
     }
-    if (*oldlenp < htProcArgsHeaderSize(path)) {
+    if (*oldlenp < htProcArgsHeaderSize(executable)) {
         errno = ENOMEM;
         return -1;
     }
-    htBuildProcArgs(path, cmdline.view(), static_cast<char*>(oldp), *oldlenp);
+    htBuildProcArgs(executable, cmdline.view(), static_cast<char*>(oldp), *oldlenp);
     *oldlenp = std::min(total, *oldlenp);
     return 0;
 }
@@ -417,7 +457,8 @@ int HTLinuxPlatform::sysctl(const int* name, unsigned nameLength, void* oldp, si
             errno = ENOMEM;
             return -1;
         }
-        long argmax = ::sysconf(_SC_ARG_MAX);
+        // Follows the stack limit, which heft never changes: asked once.
+        static const long argmax = ::sysconf(_SC_ARG_MAX);
         auto value = static_cast<int32_t>(std::clamp(argmax, kArgMaxFloor, kArgMaxCeiling));
         std::memcpy(oldp, &value, sizeof(value));
     }
@@ -467,27 +508,18 @@ kern_return_t HTLinuxPlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskP
     // The kernel is not a process with an address space of its own.
     if (pid <= 0 || task == nullptr) return KERN_INVALID_ARGUMENT;
 
-    // The pidfd names this process for as long as the handle lives,
-    // whatever later becomes of its pid number.
-    int pidFd = static_cast<int>(::syscall(SYS_pidfd_open, pid, 0));
-    if (pidFd < 0 && errno != ENOSYS) return HT_KERN_ERRNO_BASE | errno;
     int dirfd = openProcessDirectory(pid);
-    if (dirfd < 0) {
-        int error = errno;
-        if (pidFd >= 0) ::close(pidFd);
-        return HT_KERN_ERRNO_BASE | error;
-    }
+    if (dirfd < 0) return HT_KERN_ERRNO_BASE | errno;
     // Opening smaps runs the kernel's ptrace read check: the same right
     // every later read of the process's memory needs.
     int smaps = ::openat(dirfd, "smaps", O_RDONLY | O_CLOEXEC);
     if (smaps < 0) {
         int error = errno == ENOENT ? ESRCH : errno;
         ::close(dirfd);
-        if (pidFd >= 0) ::close(pidFd);
         return HT_KERN_ERRNO_BASE | error;
     }
     ::close(smaps);
-    *task = std::make_shared<HTLinuxTaskPort>(pid, dirfd, pidFd);
+    *task = std::make_shared<HTLinuxTaskPort>(pid, dirfd);
     return KERN_SUCCESS;
 }
 
@@ -552,7 +584,12 @@ kern_return_t HTLinuxPlatform::vmaAtOrAbove(HTTaskPort& task, uint64_t address, 
     kern_return_t loaded = loadVmas(*linuxTask, address == 0);
     if (loaded != KERN_SUCCESS) return loaded;
     *vma = linuxTask->vmaAtOrAbove(address);
-    return *vma == nullptr ? KERN_INVALID_ADDRESS : KERN_SUCCESS;
+    if (*vma != nullptr) return KERN_SUCCESS;
+    // Past the last mapping the walk is over. The pagemap is let go until
+    // the next page query: a run over thousands of processes keeps all
+    // their handles at once.
+    linuxTask->closePagemap();
+    return KERN_INVALID_ADDRESS;
 }
 
 kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
@@ -621,6 +658,8 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
     size_t vmaIndex = 0;
 
+    size_t mappingIndex = SIZE_MAX;
+    HTPageMapping vmaMapping;
     for (uint64_t done = 0; done < pages;) {
         size_t chunk = static_cast<size_t>(std::min<uint64_t>(kPageQueryChunk, pages - done));
         uint64_t chunkPage = firstPage + done;
@@ -639,9 +678,13 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
         for (size_t at = 0; at < chunk; ++at) {
             uint64_t pageAddress = (chunkPage + at) * pageSize;
             while (vmaIndex < vmas.size() && vmas[vmaIndex].end <= pageAddress) ++vmaIndex;
-            HTPageMapping mapping;
-            if (vmaIndex < vmas.size() && vmas[vmaIndex].start <= pageAddress) mapping = pageMapping(vmas[vmaIndex]);
-            chunkData.mappings[at] = mapping;
+            if (vmaIndex < vmas.size() && vmas[vmaIndex].start <= pageAddress) {
+                if (vmaIndex != mappingIndex) vmaMapping = pageMapping(*linuxTask, vmaIndex);
+                mappingIndex = vmaIndex;
+                chunkData.mappings[at] = vmaMapping;
+            } else {
+                chunkData.mappings[at] = HTPageMapping();
+            }
         }
         chunkData.readPageFlags(pageFlagsFd, chunk);
         for (size_t at = 0; at < chunk; ++at) dispositions[done + at] = chunkData.disposition(at);
@@ -677,7 +720,7 @@ bool HTLinuxPlatform::readStatus(int32_t pid, HTProcStatus& status)
     char path[48];
     formatPidPath(path, pid, "/status");
     thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(procFd_, path)) {
+    if (!buffer.readFile(procFd_, path, HTProcBuffer::End::ShortRead)) {
         if (errno == ENOENT) errno = ESRCH;
         return false;
     }

@@ -1,11 +1,16 @@
 #include "platform/linux/HTLinuxTaskPort.h"
 
+#include "platform/linux/HTPagemapScan.h"
+
 #include <algorithm>
 #include <fcntl.h>
 #include <unistd.h>
 
-HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, int procDirFd, int pidFd)
-    : pid_(pid), procDirFd_(procDirFd), pidFd_(pidFd)
+namespace {
+enum : uint8_t { kNotAsked, kNoZeroPage, kZeroPage, kUnknown };
+}
+
+HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, int procDirFd) : pid_(pid), procDirFd_(procDirFd)
 {
 }
 
@@ -13,18 +18,19 @@ HTLinuxTaskPort::~HTLinuxTaskPort()
 {
     if (pagemapFd_ >= 0) ::close(pagemapFd_);
     if (procDirFd_ >= 0) ::close(procDirFd_);
-    if (pidFd_ >= 0) ::close(pidFd_);
 }
 
 void HTLinuxTaskPort::parseVmas(std::string_view smaps)
 {
     htParseSmaps(smaps, vmas_);
+    zeroPageAnswers_.assign(vmas_.size(), kNotAsked);
     hasParsedVmas_ = true;
 }
 
 void HTLinuxTaskPort::clearVmas()
 {
     vmas_.clear();
+    zeroPageAnswers_.clear();
     hasParsedVmas_ = false;
 }
 
@@ -46,4 +52,24 @@ int HTLinuxTaskPort::pagemapFd()
 {
     if (pagemapFd_ < 0) pagemapFd_ = ::openat(procDirFd_, "pagemap", O_RDONLY | O_CLOEXEC);
     return pagemapFd_;
+}
+
+void HTLinuxTaskPort::closePagemap()
+{
+    if (pagemapFd_ >= 0) ::close(pagemapFd_);
+    pagemapFd_ = -1;
+}
+
+std::optional<bool> HTLinuxTaskPort::mayMapZeroPage(size_t index)
+{
+    if (index >= vmas_.size()) return std::nullopt;
+    uint8_t& answer = zeroPageAnswers_[index];
+    if (answer == kNotAsked) {
+        int pagemap = pagemapFd();
+        std::optional<bool> found =
+            pagemap < 0 ? std::nullopt : htPagemapMayMapZeroPage(pagemap, vmas_[index].start, vmas_[index].end);
+        answer = !found ? kUnknown : *found ? kZeroPage : kNoZeroPage;
+    }
+    if (answer == kUnknown) return std::nullopt;
+    return answer == kZeroPage;
 }

@@ -31,7 +31,9 @@ int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPa
 bool htPageFlagsMatter(uint64_t pagemapEntry, HTPageMapping mapping)
 {
     if ((pagemapEntry & HT_PAGEMAP_PRESENT) == 0 || mapping.hugetlb || mapping.cleanFile) return false;
-    // A page copied on write into a private mapping of shared memory is
-    // anonymous, and may have been freed with MADV_FREE.
-    return !(mapping.sharedMemory && (pagemapEntry & HT_PAGEMAP_FILE_OR_SHARED) != 0);
+    // Anonymous pages: the flags tell the zero page and freed pages from
+    // the rest.
+    if ((pagemapEntry & HT_PAGEMAP_FILE_OR_SHARED) == 0) return !mapping.plainAnonymous;
+    // Shared memory is swap-backed; a file's pages may be dirty, or on tmpfs.
+    return !mapping.sharedMemory;
 }

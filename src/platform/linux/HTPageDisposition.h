@@ -25,6 +25,9 @@ struct HTPageMapping {
     // pages are clean page cache with backing store, and its anonymous pages
     // are private copies, which MADV_FREE cannot touch in a file mapping.
     bool cleanFile = false;
+    // No anonymous page here is the shared zero page or was freed with
+    // MADV_FREE: each is swap-backed memory of its own, dirty.
+    bool plainAnonymous = false;
 };
 
 // The frame number of a present page; 0 when the reader may not see it.

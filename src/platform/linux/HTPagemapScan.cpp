@@ -32,11 +32,13 @@ struct PagemapScanArg {
 
 constexpr uint64_t kPageIsPresent = 1 << 3;
 constexpr uint64_t kPageIsSwapped = 1 << 4;
+constexpr uint64_t kPageIsZeroFrame = 1 << 5;
+constexpr uint64_t kPageIsHuge = 1 << 6;
 constexpr unsigned long kPagemapScan = _IOWR('f', 16, PagemapScanArg);
 
-}  // namespace
-
-std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, uint64_t end)
+// The first page in [start, end) with any of the categories; `end` when
+// there is none.
+std::optional<uint64_t> firstPageWithAny(int pagemapFd, uint64_t start, uint64_t end, uint64_t categories)
 {
     if (start >= end) return end;
     PageRegion region{};
@@ -47,9 +49,23 @@ std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, u
     arg.vec = reinterpret_cast<uint64_t>(&region);
     arg.vec_len = 1;
     arg.max_pages = 1;
-    arg.category_anyof_mask = kPageIsPresent | kPageIsSwapped;
-    arg.return_mask = kPageIsPresent | kPageIsSwapped;
+    arg.category_anyof_mask = categories;
+    arg.return_mask = categories;
     long found = ::ioctl(pagemapFd, kPagemapScan, &arg);
     if (found < 0) return std::nullopt;
     return found == 0 ? end : region.start;
+}
+
+}  // namespace
+
+std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, uint64_t end)
+{
+    return firstPageWithAny(pagemapFd, start, end, kPageIsPresent | kPageIsSwapped);
+}
+
+std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint64_t end)
+{
+    std::optional<uint64_t> first = firstPageWithAny(pagemapFd, start, end, kPageIsZeroFrame | kPageIsHuge);
+    if (!first) return std::nullopt;
+    return *first < end;
 }

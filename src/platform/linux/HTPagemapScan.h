@@ -10,3 +10,9 @@
 // Returns `end` when no such page exists, and nullopt when the kernel does
 // not offer the request (kernels before 6.7) or it fails.
 std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, uint64_t end);
+
+// Whether any page in [start, end) may be a zero page: the shared zero
+// page, left by a read of anonymous memory never written, or a page mapped
+// by a huge page entry, as the huge zero page is (kernels have not always
+// reported that one as a zero page). nullopt when the kernel cannot say.
+std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint64_t end);

@@ -20,13 +20,14 @@ void HTProcBuffer::grow(size_t minimum)
     capacity_ = capacity;
 }
 
-bool HTProcBuffer::readDescriptor(int fd)
+bool HTProcBuffer::readDescriptor(int fd, End end)
 {
     size_ = 0;
     grow(kInitialCapacity);
     for (;;) {
         if (size_ == capacity_) grow(capacity_ * 2);
-        ssize_t count = ::read(fd, data_.get() + size_, capacity_ - size_);
+        size_t room = capacity_ - size_;
+        ssize_t count = ::read(fd, data_.get() + size_, room);
         if (count < 0) {
             if (errno == EINTR) continue;
             size_ = 0;
@@ -34,15 +35,16 @@ bool HTProcBuffer::readDescriptor(int fd)
         }
         if (count == 0) return true;
         size_ += static_cast<size_t>(count);
+        if (end == End::ShortRead && static_cast<size_t>(count) < room) return true;
     }
 }
 
-bool HTProcBuffer::readFile(int dirfd, const char* path)
+bool HTProcBuffer::readFile(int dirfd, const char* path, End end)
 {
     size_ = 0;
     int fd = ::openat(dirfd, path, O_RDONLY | O_CLOEXEC);
     if (fd < 0) return false;
-    bool read = readDescriptor(fd);
+    bool read = readDescriptor(fd, end);
     int savedErrno = errno;
     ::close(fd);
     errno = savedErrno;

@@ -57,6 +57,8 @@ std::optional<HTProcStat> htParseProcStat(std::string_view text)
     int64_t priority = 0;
     if (!skipFields(rest, 8) || !takeField(rest, priority) || !takeField(rest, stat.nice)) return std::nullopt;
     if (!skipFields(rest, 2) || !takeField(rest, stat.starttime)) return std::nullopt;
+    // Fields 23 to 27, then startstack.
+    if (!skipFields(rest, 5) || !takeField(rest, stat.startstack)) stat.startstack = 0;
     return stat;
 }
 

@@ -25,6 +25,9 @@ struct HTProcStat {
     int32_t nice = 0;
     // Clock ticks after boot.
     uint64_t starttime = 0;
+    // Where the stack began (field 28); 0 when the reader may not see it,
+    // or the line stops short of it.
+    uint64_t startstack = 0;
 
     bool isKernelThread() const { return (flags & HT_PF_KTHREAD) != 0; }
 };

@@ -76,6 +76,7 @@ uint32_t parseVmFlags(std::string_view text)
         case flagKey('h', 't'): flags |= HTVmFlagHugetlb; break;
         case flagKey('i', 'o'): flags |= HTVmFlagIO; break;
         case flagKey('p', 'f'): flags |= HTVmFlagPfnMap; break;
+        case flagKey('m', 'm'): flags |= HTVmFlagMixedMap; break;
         default: break;
         }
     }

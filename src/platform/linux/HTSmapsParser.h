@@ -35,6 +35,7 @@ enum HTSmapsVmFlag : uint32_t {
     HTVmFlagHugetlb = 1u << 6,    // ht
     HTVmFlagIO = 1u << 7,         // io (device memory)
     HTVmFlagPfnMap = 1u << 8,     // pf (raw page frames, no struct page)
+    HTVmFlagMixedMap = 1u << 9,   // mm (page frames with and without struct page)
 };
 
 struct HTSmapsEntry {
