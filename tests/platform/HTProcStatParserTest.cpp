@@ -32,6 +32,7 @@ TEST(HTProcStatParser, ReadsTheFieldsOfACapturedLine)
     EXPECT_EQ(stat->flags, 4194304u);
     EXPECT_EQ(stat->nice, 0);
     EXPECT_EQ(stat->starttime, 36232u);
+    EXPECT_EQ(stat->startstack, 140729907217280u);
     EXPECT_FALSE(stat->isKernelThread());
 
     auto kthreadd = htParseProcStat(kKthreaddStat);
@@ -52,6 +53,7 @@ TEST(HTProcStatParser, CommRunsToTheLastParenthesis)
     EXPECT_EQ(stat->ppid, 77);
     EXPECT_EQ(stat->nice, 19);
     EXPECT_EQ(stat->starttime, 500u);
+    EXPECT_EQ(stat->startstack, 0u) << "the line stops before the stack address";
 
     auto blanks = htParseProcStat("9 ( x  ) ) Z 1 9 9 0 -1 4 0 0 0 0 0 0 0 0 20 -5 1 0 7 0 0");
     ASSERT_TRUE(blanks);
