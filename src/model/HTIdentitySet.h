@@ -19,7 +19,14 @@ public:
     // true when it was added.
     bool insert(std::shared_ptr<T> item)
     {
-        if (!index_.insert(item.get()).second) return false;
+        if (index_.empty() && items_.size() < kLinearSize) {
+            if (contains(item.get())) return false;
+        } else {
+            if (index_.empty()) {
+                for (const auto& present : items_) index_.insert(present.get());
+            }
+            if (!index_.insert(item.get()).second) return false;
+        }
         items_.push_back(std::move(item));
         return true;
     }
@@ -29,7 +36,13 @@ public:
         for (const auto& item : other) insert(item);
     }
 
-    bool contains(const T* item) const { return index_.count(item) != 0; }
+    bool contains(const T* item) const
+    {
+        if (!index_.empty()) return index_.count(item) != 0;
+        for (const auto& present : items_)
+            if (present.get() == item) return true;
+        return false;
+    }
     size_t size() const { return items_.size(); }
     bool empty() const { return items_.empty(); }
     // The first object inserted; the set must not be empty.
@@ -38,6 +51,9 @@ public:
     const_iterator end() const { return items_.end(); }
 
 private:
+    static constexpr size_t kLinearSize = 16;
+
     std::vector<std::shared_ptr<T>> items_;
+    // Empty until the set outgrows kLinearSize.
     std::unordered_set<const T*> index_;
 };
