@@ -645,7 +645,8 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     const uint64_t firstPage = address / pageSize;
     const uint64_t pages = std::min((address + size + pageSize - 1) / pageSize - firstPage, *count);
 
-    // The mappings tell shared memory and hugetlbfs pages apart.
+    // The mappings tell shared memory and hugetlbfs pages apart, and which
+    // pages need their physical page's flags at all.
     kern_return_t loaded = loadVmas(*linuxTask, false);
     if (loaded == MACH_SEND_INVALID_DEST) return KERN_INVALID_ARGUMENT;
     if (loaded != KERN_SUCCESS) return loaded;
@@ -657,7 +658,7 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     auto& entries = chunkData.entries;
     const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
     size_t vmaIndex = 0;
-
+    // What the page rules need of the mapping in hand, worked out once.
     size_t mappingIndex = SIZE_MAX;
     HTPageMapping vmaMapping;
     for (uint64_t done = 0; done < pages;) {
