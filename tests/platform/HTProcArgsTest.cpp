@@ -6,6 +6,7 @@
 #include <cstring>
 #include <fcntl.h>
 #include <string>
+#include <unistd.h>
 
 using namespace std::string_literals;
 
@@ -87,4 +88,26 @@ TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
     EXPECT_FALSE(buffer.readFile(AT_FDCWD, "/proc/self/no-such-file"));
     EXPECT_EQ(errno, ENOENT);
     EXPECT_EQ(buffer.size(), 0u);
+}
+
+TEST(HTProcBuffer, ShortReadEndsOnlyFilesWrittenWhole)
+{
+    HTProcBuffer buffer;
+    // status is written whole: its last line arrives in the first read.
+    ASSERT_TRUE(buffer.readFile(AT_FDCWD, "/proc/self/status", HTProcBuffer::End::ShortRead));
+    EXPECT_NE(buffer.view().find("\nnonvoluntary_ctxt_switches:"), std::string_view::npos);
+    EXPECT_EQ(buffer.view().back(), '\n');
+
+    // A file larger than the buffer fills it, grows it and goes on to the end.
+    char path[] = "/tmp/heft-procbuffer-XXXXXX";
+    int fd = ::mkstemp(path);
+    ASSERT_GE(fd, 0);
+    ::unlink(path);
+    std::string text(3 * 4096 + 100, 'x');
+    ASSERT_EQ(::write(fd, text.data(), text.size()), static_cast<ssize_t>(text.size()));
+    ASSERT_EQ(::lseek(fd, 0, SEEK_SET), 0);
+    HTProcBuffer fresh;
+    ASSERT_TRUE(fresh.readDescriptor(fd, HTProcBuffer::End::ShortRead));
+    ::close(fd);
+    EXPECT_EQ(fresh.view(), text);
 }

@@ -6,6 +6,7 @@
 #include "platform/linux/HTLinuxTaskPort.h"
 #include "platform/linux/HTPageDisposition.h"
 #include "platform/linux/HTPageQueryChunk.h"
+#include "platform/linux/HTPreadFully.h"
 #include "platform/linux/HTProcArgs.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
@@ -98,26 +99,6 @@ bool meansGone(int error)
     return error == ESRCH || error == ENOENT;
 }
 
-// Reads up to `length` bytes at `offset`, retrying short reads; the bytes
-// read, or -1 with errno when the first read fails.
-ssize_t preadFully(int fd, void* buffer, size_t length, uint64_t offset)
-{
-    size_t done = 0;
-    while (done < length) {
-        ssize_t count = ::pread(fd, static_cast<char*>(buffer) + done, length - done,
-                                static_cast<off_t>(offset + done));
-        if (count < 0) {
-            if (errno == EINTR) continue;
-            if (done == 0) return -1;
-            break;
-        }
-        if (count == 0) break;
-        done += static_cast<size_t>(count);
-    }
-    return static_cast<ssize_t>(done);
-}
-
-constexpr size_t kPageQueryChunk = HTPageQueryChunk::kPages;
 
 // What the page rules need to know of the mapping at `index`.
 HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
@@ -169,7 +150,7 @@ HTLinuxPlatform::~HTLinuxPlatform()
     if (kpageflagsFd_ >= 0) ::close(kpageflagsFd_);
 }
 
-int HTLinuxPlatform::openProcessDirectory(int32_t pid) const
+int HTLinuxPlatform::openProcessFile(int32_t pid, std::string_view suffix, int flags) const
 {
     if (procFd_ < 0) {
         errno = procErrno_;
@@ -180,10 +161,20 @@ int HTLinuxPlatform::openProcessDirectory(int32_t pid) const
         return -1;
     }
     char name[48];
-    formatPidPath(name, pid, "");
-    int fd = ::openat(procFd_, name, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    formatPidPath(name, pid, suffix);
+    int fd = ::openat(procFd_, name, O_RDONLY | O_CLOEXEC | flags);
     if (fd < 0 && errno == ENOENT) errno = ESRCH;
     return fd;
+}
+
+bool HTLinuxPlatform::readProcessFile(int32_t pid, std::string_view suffix, HTProcBuffer& buffer) const
+{
+    int fd = openProcessFile(pid, suffix);
+    if (fd < 0) return false;
+    bool read = buffer.readDescriptor(fd, HTProcBuffer::End::ShortRead);
+    closeKeepingErrno(fd);
+    if (!read && errno == ENOENT) errno = ESRCH;
+    return read;
 }
 
 uint64_t HTLinuxPlatform::bootTime()
@@ -217,23 +208,10 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
         fillKernelInfo(info);
         return true;
     }
-    if (procFd_ < 0) {
-        errno = procErrno_;
-        return false;
-    }
-    if (pid < 0) {
-        errno = ESRCH;
-        return false;
-    }
     // Reused by every call on this thread: a listing reads thousands.
     thread_local HTProcBuffer buffer;
-    char path[48];
-    formatPidPath(path, pid, "/stat");
-    int fd = ::openat(procFd_, path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-        if (errno == ENOENT) errno = ESRCH;
-        return false;
-    }
+    int fd = openProcessFile(pid, "/stat");
+    if (fd < 0) return false;
     // Every file of /proc/PID belongs to the process's effective user and
     // group (to root when the process is not dumpable).
     struct stat owner {};
@@ -408,11 +386,7 @@ int HTLinuxPlatform::readProcArgs(int32_t pid, void* oldp, size_t* oldlenp)
         return -1;
     }
     thread_local HTProcBuffer cmdline;
-    formatPidPath(path, pid, "/cmdline");
-    if (!cmdline.readFile(procFd_, path, HTProcBuffer::End::ShortRead)) {
-        if (errno == ENOENT) errno = ESRCH;
-        return -1;
-    }
+    if (!readProcessFile(pid, "/cmdline", cmdline)) return -1;
 
     std::string_view executable =
         htExecutablePathFromLink(std::string_view(link, static_cast<size_t>(linkLength)));
@@ -508,7 +482,7 @@ kern_return_t HTLinuxPlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskP
     // The kernel is not a process with an address space of its own.
     if (pid <= 0 || task == nullptr) return KERN_INVALID_ARGUMENT;
 
-    int dirfd = openProcessDirectory(pid);
+    int dirfd = openProcessFile(pid, "", O_DIRECTORY);
     if (dirfd < 0) return HT_KERN_ERRNO_BASE | errno;
     // Opening smaps runs the kernel's ptrace read check: the same right
     // every later read of the process's memory needs.
@@ -662,9 +636,9 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     size_t mappingIndex = SIZE_MAX;
     HTPageMapping vmaMapping;
     for (uint64_t done = 0; done < pages;) {
-        size_t chunk = static_cast<size_t>(std::min<uint64_t>(kPageQueryChunk, pages - done));
+        size_t chunk = static_cast<size_t>(std::min<uint64_t>(HTPageQueryChunk::kPages, pages - done));
         uint64_t chunkPage = firstPage + done;
-        ssize_t bytes = preadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), chunkPage * sizeof(uint64_t));
+        ssize_t bytes = htPreadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), chunkPage * sizeof(uint64_t));
         if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
         size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
         if (read < chunk) {
@@ -710,21 +684,8 @@ int HTLinuxPlatform::proc_regionfilename(HTTaskPort& task, uint64_t address, cha
 
 bool HTLinuxPlatform::readStatus(int32_t pid, HTProcStatus& status)
 {
-    if (procFd_ < 0) {
-        errno = procErrno_;
-        return false;
-    }
-    if (pid <= 0) {
-        errno = ESRCH;
-        return false;
-    }
-    char path[48];
-    formatPidPath(path, pid, "/status");
     thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(procFd_, path, HTProcBuffer::End::ShortRead)) {
-        if (errno == ENOENT) errno = ESRCH;
-        return false;
-    }
+    if (!readProcessFile(pid, "/status", buffer)) return false;
     status = htParseProcStatus(buffer.view());
     // A zombie's status has no memory lines: its address space is gone.
     if (!status.hasMemoryFigures()) {

@@ -13,9 +13,11 @@
 #include <mutex>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 
 class HTLinuxTaskPort;
+class HTProcBuffer;
 struct HTProcStatus;
 
 struct HTSmapsEntry;
@@ -85,8 +87,12 @@ private:
     // The task's first mapping that ends above the address, read anew when
     // the address is 0 (a walk begins); KERN_INVALID_ADDRESS when none.
     kern_return_t vmaAtOrAbove(HTTaskPort& task, uint64_t address, const HTSmapsEntry** vma);
-    // Opens /proc/PID as a directory; -1 with errno (ESRCH when it is gone).
-    int openProcessDirectory(int32_t pid) const;
+    // Opens /proc/PID followed by `suffix` ("" for the directory itself,
+    // with O_DIRECTORY in `flags`); -1 with errno, ESRCH when it is gone.
+    int openProcessFile(int32_t pid, std::string_view suffix, int flags = 0) const;
+    // Reads one of the small files of /proc/PID whole (stat, status,
+    // cmdline); false with errno, ESRCH when the process is gone.
+    bool readProcessFile(int32_t pid, std::string_view suffix, HTProcBuffer& buffer) const;
     // The record of a process (or of the kernel for pid 0); false with
     // errno, ESRCH for a process that is gone or a kernel thread.
     bool readBsdInfo(int32_t pid, proc_bsdinfo& info);

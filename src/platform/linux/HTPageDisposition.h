@@ -41,9 +41,9 @@ inline uint64_t htPagemapFrame(uint64_t entry)
 // frame number); the rules then rest on the pagemap and the mapping alone.
 int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPageMapping mapping);
 
-// Whether the page's kpageflags can change its disposition. Pages of shared
-// memory and hugetlbfs are always swap-backed, and a clean file mapping has
-// nothing for the flags to add, so the pagemap and the mapping already say
-// everything; skipping their flags saves a read per page or folio, and
-// these are the pages whose frames lie most scattered.
+// Whether the page's kpageflags can change its disposition. They cannot for
+// pages of shared memory and hugetlbfs, always swap-backed; for any page of
+// a clean file mapping; nor for an anonymous page of a plain mapping. There
+// the pagemap and the mapping already say everything, and skipping the
+// flags saves a read per page or folio: frames lie scattered.
 bool htPageFlagsMatter(uint64_t pagemapEntry, HTPageMapping mapping);

@@ -1,9 +1,8 @@
 #include "platform/linux/HTPageQueryChunk.h"
 
-#include <unistd.h>
+#include "platform/linux/HTPreadFully.h"
 
 #include <algorithm>
-#include <cerrno>
 
 namespace {
 
@@ -40,16 +39,9 @@ void HTPageQueryChunk::readWindow(int kpageflagsFd, size_t first, size_t last)
 {
     uint64_t base = wanted_[first].first;
     size_t length = static_cast<size_t>(wanted_[last].first - base + 1) * sizeof(uint64_t);
-    size_t done = 0;
-    while (done < length) {
-        ssize_t bytes = ::pread(kpageflagsFd, reinterpret_cast<char*>(window_.data()) + done, length - done,
-                                static_cast<off_t>(base * sizeof(uint64_t) + done));
-        if (bytes < 0 && errno == EINTR) continue;
-        if (bytes <= 0) break;
-        done += static_cast<size_t>(bytes);
-    }
+    ssize_t done = htPreadFully(kpageflagsFd, window_.data(), length, base * sizeof(uint64_t));
     // Frames past the end of memory read short and stay unknown.
-    size_t known = done / sizeof(uint64_t);
+    size_t known = done > 0 ? static_cast<size_t>(done) / sizeof(uint64_t) : 0;
     for (size_t at = first; at <= last; ++at) {
         uint64_t offset = wanted_[at].first - base;
         if (offset >= known) break;
