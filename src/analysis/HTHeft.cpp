@@ -3,6 +3,7 @@
 #include "analysis/HTHeftSharingData.h"
 #include "analysis/HTMemoryObjectMap.h"
 #include "analysis/HTProcessGroup.h"
+#include "analysis/HTSharedPageResolver.h"
 #include "base/HTAssert.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryCategory.h"
@@ -12,6 +13,7 @@
 #include "platform/HTSignalSource.h"
 #include "platform/HTWorkQueue.h"
 #include "process/HTProcess.h"
+#include "process/HTUserProcess.h"
 
 #include <algorithm>
 #include <atomic>
@@ -151,11 +153,27 @@ void HTHeft::gatherData()
 
     if (earlyExit()) HTProcess::_addGlobalError(kEarlyExitError);
 
+    // Pages that processes share after a fork become objects of their own
+    // before anything is routed.
+    HTSharedPageResolver(processes_).resolve();
+    reportUnidentifiedSharedPages();
+
     // Processes skipped by cancellation are routed too, with whatever
     // regions they have.
     for (const auto& process : processes_) _addProcess(process);
     finalizeObjects();
     _buildProcessToHeftMap();
+}
+
+void HTHeft::reportUnidentifiedSharedPages() const
+{
+    for (const auto& process : processes_) {
+        const auto* user = dynamic_cast<const HTUserProcess*>(process.get());
+        if (user && !user->hiddenFromDisplay() && user->sharedPagesUnidentified()) {
+            std::fprintf(stderr, "%s\n", kUnidentifiedSharedPagesNotice);
+            return;
+        }
+    }
 }
 
 void HTHeft::_addProcess(const std::shared_ptr<HTProcess>& processPointer)

@@ -39,6 +39,10 @@ public:
     static constexpr const char* kGatherQueueLabel = "heft.gatherdata";
     static constexpr const char* kEarlyExitError =
         "Heft exited early due to SIGINT and did not finish gathering all data";
+    // Said once on standard error when a reported process may share memory
+    // after a fork and its pages could not be told apart (without root).
+    static constexpr const char* kUnidentifiedSharedPagesNotice =
+        "Memory shared after fork may be counted more than once: telling its pages apart needs root";
 
     // The targets, in the order given; that order is kept for routing.
     HTHeft(ProcessList processes, std::shared_ptr<HTPlatform> platform);
@@ -130,6 +134,7 @@ protected:
 
 private:
     void releaseMemoryObjectMaps();
+    void reportUnidentifiedSharedPages() const;
 
     std::shared_ptr<HTPlatform> platform_;
     ProcessList processes_;

@@ -141,6 +141,12 @@ void HTMemoryRegion::addSubrange(uint64_t location, uint64_t length, const HTMem
     subrangeList_->addRange(location, length, pageSize, memoryTotal);
 }
 
+HTSharedPageList& HTMemoryRegion::makeSharedPageList()
+{
+    if (!sharedPageList_) sharedPageList_ = std::make_unique<HTSharedPageList>();
+    return *sharedPageList_;
+}
+
 bool HTMemoryRegion::eligibleForProcessView() const
 {
     if (isFake() || inSharedCache()) return false;

@@ -2,6 +2,7 @@
 
 #include "model/HTMemoryTotals.h"
 #include "model/HTRangeList.h"
+#include "model/HTSharedPageList.h"
 #include "platform/HTPlatformTypes.h"  // share modes
 
 #include <cstdint>
@@ -101,6 +102,13 @@ public:
     // Drops the sub-range list once a memory object has absorbed it.
     void freeSubrangeList() { subrangeList_.reset(); }
 
+    // The region's pages page by page, for pages other processes may map
+    // too; null unless gathering recorded them. The analysis turns them
+    // into sub-ranges and takes the list away.
+    HTSharedPageList* sharedPageList() const { return sharedPageList_.get(); }
+    HTSharedPageList& makeSharedPageList();
+    std::unique_ptr<HTSharedPageList> takeSharedPageList() { return std::move(sharedPageList_); }
+
     // Whether the region may give its process a view of the object of its
     // own: memory that is private to the process by nature (private share
     // modes, image segments, shared cache, fake regions) never does.
@@ -143,4 +151,5 @@ private:
     uint64_t cleanNonSpecSize_ = 0;
     uint64_t object_id_ = 0;
     std::unique_ptr<HTRangeList> subrangeList_;
+    std::unique_ptr<HTSharedPageList> sharedPageList_;
 };

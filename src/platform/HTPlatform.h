@@ -95,6 +95,20 @@ public:
     // over the unpopulated stretches of huge sparse reservations, whose
     // pages would all answer no disposition.
     virtual uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) { return start; }
+    // Whether sharedPageIdentities can tell pages apart. It needs the
+    // physical page numbers, which a kernel may show only to a privileged
+    // reader.
+    virtual bool canIdentifySharedPages() { return false; }
+    // For each of `pages` pages from the page-aligned `address`: a non-zero
+    // identity when the page is private anonymous memory (or a copied page
+    // of a private file mapping) that other processes may map as well, as
+    // after a fork; 0 for every other page. The identity names the physical
+    // page, or the swap slot of a page that is swapped out, so equal
+    // identities in two processes are one page. Identities are below
+    // HTMaxPageIdentity. KERN_INVALID_ARGUMENT when the process has gone
+    // away.
+    virtual kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
+                                               uint64_t* identities) { return KERN_FAILURE; }
     // The path of the file mapped at the address: the bytes written (not
     // terminated), 0 when none.
     virtual int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) { return 0; }

@@ -74,8 +74,15 @@ inline constexpr int32_t VM_PURGABLE_DENY = 3;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_PRESENT = 0x1;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_DIRTY = 0x8;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_PAGED_OUT = 0x10;
+// A page of a private file mapping that is the mapping's own copy, not the
+// file's page.
+inline constexpr int32_t VM_PAGE_QUERY_PAGE_COPIED = 0x20;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_EXTERNAL = 0x80;
 inline constexpr int32_t VM_PAGE_QUERY_PAGE_REUSABLE = 0x800;
+
+// Every shared page identity is below this: the bits above are free for
+// whoever stores one beside a few bits of its own.
+inline constexpr uint64_t HTMaxPageIdentity = uint64_t{1} << 58;
 
 // Platform codes of the shared region; 5 is Linux, whose shared region is
 // empty.

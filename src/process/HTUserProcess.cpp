@@ -5,6 +5,7 @@
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
+#include "model/HTSubrangeBuilder.h"
 #include "process/HTImage.h"
 #include "process/HTImageEnumerator.h"
 
@@ -28,6 +29,12 @@ constexpr size_t kOwnedVmObjectsHeadroom = 16 * sizeof(HTOwnedVmObject);
 constexpr uint64_t kBisectionResolution = 0x1000000;
 constexpr uint32_t kIOKitTag = 87;
 constexpr size_t kRegionPathLength = 1024;
+// Identities heft derives for regions of its own keep to the namespaces of
+// the platform's: the top bit for a file's pages, the top two bits 01 for
+// anonymous memory.
+constexpr uint64_t kFileIdentityBit = uint64_t{1} << 63;
+constexpr uint64_t kAnonymousIdentityBit = uint64_t{1} << 62;
+constexpr uint64_t kIdentityNamespaceBits = uint64_t{3} << 62;
 
 // The shared region that each platform code implies.
 struct SharedRegionLayout {
@@ -54,20 +61,29 @@ bool countsAsDirty(int32_t disposition)
            ((disposition & VM_PAGE_QUERY_PAGE_PRESENT) && !(disposition & VM_PAGE_QUERY_PAGE_EXTERNAL));
 }
 
-// Page kinds of sub-ranges.
-enum PageKind { PageNone, PageDirty, PageSwapped, PageReclaimable, PageClean };
-
-PageKind pageKind(int32_t disposition, int32_t purgeState)
+HTPageKind pageKind(int32_t disposition, int32_t purgeState)
 {
-    if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT) return PageSwapped;
-    if (disposition & VM_PAGE_QUERY_PAGE_DIRTY) return PageDirty;
+    if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT) return HTPageKind::Swapped;
+    if (disposition & VM_PAGE_QUERY_PAGE_DIRTY) return HTPageKind::Dirty;
     // A volatile object may lose any present page; elsewhere only pages
     // marked reusable can be taken back.
     int32_t reclaimableBit =
         purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
-    if (disposition & reclaimableBit) return PageReclaimable;
-    if (disposition & VM_PAGE_QUERY_PAGE_PRESENT) return PageClean;
-    return PageNone;
+    if (disposition & reclaimableBit) return HTPageKind::Reclaimable;
+    if (disposition & VM_PAGE_QUERY_PAGE_PRESENT) return HTPageKind::Clean;
+    return HTPageKind::None;
+}
+
+// A 64-bit mix of two values, for identities derived from another.
+uint64_t mixIdentity(uint64_t id, uint64_t salt)
+{
+    uint64_t value = id ^ (salt * 0x9e3779b97f4a7c15ULL);
+    value ^= value >> 30;
+    value *= 0xbf58476d1ce4e5b9ULL;
+    value ^= value >> 27;
+    value *= 0x94d049bb133111ebULL;
+    value ^= value >> 31;
+    return value;
 }
 
 // strerror_r comes in two flavours; both give the text here.
@@ -687,53 +703,107 @@ bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<H
 void HTUserProcess::_addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState)
 {
     HT_ASSERT(kModule, !region.ownedExclusivelyByParentProcess(), "!memoryRegion.ownedExclusivelyByParentProcess");
+    _walkPagesOfRegion(region, PageTargets{&region, nullptr, false}, purgeState);
+}
+
+bool HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState)
+{
     const uint64_t page = pageSize();
     const uint64_t from = roundDown(region.start(), page);
     const uint64_t pages = (roundUp(region.end(), page) - from) / page;
+    HTSharedPageList* list = targets.identify && targets.pages ? &targets.pages->makeSharedPageList() : nullptr;
+    HTSubrangeBuilder runs(list ? nullptr : targets.pages, page);
+    HTSubrangeBuilder fileRuns(targets.filePages, page);
+    const bool separateCopies = targets.filePages != nullptr || targets.copiesOnly;
+    uint64_t identities[kDispositionChunkPages];
 
-    // The current run of pages of one kind, in the object's offset space.
-    PageKind kind = PageNone;
-    uint64_t location = region.offset();
-    uint64_t length = 0;
-
-    auto addRun = [&]() {
-        HTMemoryTotals totals;
-        switch (kind) {
-        case PageDirty: totals.dirty = length; break;
-        case PageSwapped: totals.swapped = length; break;
-        case PageReclaimable: totals.reclaimable = length; break;
-        case PageClean: totals.clean = length; break;
-        case PageNone: HT_FATAL(kModule, "Tried to add an empty subrange");
-        }
-        if (region.wired()) totals.wired = length;
-        region.addSubrange(location, length, totals, page);
-    };
-    auto step = [&](PageKind next) {
-        if (next != kind && kind != PageNone && length != 0) {
-            addRun();
-            location += length;
-            length = 0;
-        }
-        kind = next;
-        if (kind == PageNone)
-            location += page;
-        else
-            length += page;
-    };
-
-    _enumerateDispositionChunksWithStartAddr(
-        from, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t chunks) {
-            if (dispositions == nullptr) {
-                // A stretch with nothing in it: it ends the current run and
-                // moves the location past itself in one step.
-                step(PageNone);
-                location += (filled - 1) * page;
-            } else {
-                for (uint64_t i = 0; i < filled; ++i) step(pageKind(dispositions[i], purgeState));
+    return _enumerateDispositionChunksWithStartAddr(
+        from, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t) {
+            // A stretch with nothing in it leaves a gap in the runs.
+            if (dispositions == nullptr) return;
+            const uint64_t first = chunk * kDispositionChunkPages;
+            const bool named = list && platform().sharedPageIdentities(*task_, from + first * page, filled,
+                                                                       identities) == KERN_SUCCESS;
+            for (uint64_t i = 0; i < filled; ++i) {
+                const HTPageKind kind = pageKind(dispositions[i], purgeState);
+                if (kind == HTPageKind::None) continue;
+                // In a private file mapping the file's own pages and the
+                // mapping's copies belong to different objects.
+                const uint64_t index = first + i;
+                if (separateCopies && (dispositions[i] & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
+                    fileRuns.add(targets.filePages ? targets.filePages->offset() + index * page : 0, kind);
+                } else if (list) {
+                    list->addPage(static_cast<uint32_t>(index), kind, named ? identities[i] : 0);
+                } else {
+                    runs.add(targets.pages->offset() + index * page, kind);
+                }
             }
-            // Close the last run.
-            if (chunk + 1 == chunks) step(PageNone);
         });
+}
+
+std::shared_ptr<HTMemoryRegion> HTUserProcess::_splitCopiedPages(HTMemoryRegion& region,
+                                                                const vm_region_submap_info_64& info)
+{
+    const uint64_t copied = pageSize() * info.pages_shared_now_private;
+    const uint64_t swapped = region.swappedSize();
+    if (copied == 0 && swapped == 0) return nullptr;
+
+    auto copies = std::make_shared<HTMemoryRegion>();
+    copies->setStart(region.start());
+    copies->setSize(region.size());
+    copies->setUser_tag(region.user_tag());
+    copies->setShare_mode(region.share_mode());
+    copies->setWired(region.wired());
+    copies->setSegment(region.segment());
+    copies->setName(region.name());
+    copies->setDetailedName(region.detailedName());
+    // Copies are anonymous memory of this mapping in this process; pages
+    // still shared after a fork are told apart by their identities.
+    const uint64_t id = mixIdentity(mixIdentity(region.object_id(), region.start()), static_cast<uint32_t>(pid()));
+    copies->setObject_id((id & ~kIdentityNamespaceBits) | kAnonymousIdentityBit);
+
+    // Every page swapped out is a copy (file pages go back to their file);
+    // copies are dirty first, and at most what the mapping holds.
+    const uint64_t dirty = std::min(copied, region.dirtySize());
+    const uint64_t reclaimable = std::min(region.reclaimableSize(), copied - dirty);
+    const uint64_t clean = std::min(region.cleanNonSpecSize(), copied - dirty - reclaimable);
+    copies->setDirtySize(dirty);
+    copies->setReclaimableSize(reclaimable);
+    copies->setCleanNonSpecSize(clean);
+    copies->setSwappedSize(swapped);
+    region.setDirtySize(region.dirtySize() - dirty);
+    region.setReclaimableSize(region.reclaimableSize() - reclaimable);
+    region.setCleanNonSpecSize(region.cleanNonSpecSize() - clean);
+    region.setSwappedSize(0);
+    return copies;
+}
+
+void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies,
+                                  const vm_region_submap_info_64& info, int32_t purgeState)
+{
+    const uint64_t page = pageSize();
+    const bool hidden = hiddenFromDisplay();
+    const bool sharingDisabled = HTHeft::isSharingAnalysisDisabled();
+    const bool subranges = breakDownPhysHeft() && !sharingDisabled && !hidden;
+    // Private memory that other processes map as well, after a fork, is
+    // named page by page so that the analysis counts each page once.
+    const bool mayShare = !sharingDisabled && !hidden && info.ref_count > 1 && info.share_mode == SM_COW &&
+                          (copies != nullptr || info.external_pager == 0) &&
+                          region.size() / page < HTSharedPageList::kNoIdentity;
+    const bool identify = mayShare && platform().canIdentifySharedPages();
+    if (mayShare && !identify) sharedPagesUnidentified_ = true;
+
+    if (copies == nullptr && !identify) {
+        if (subranges && region.eligibleForSubrangesUsingPageSize(page)) _addSubrangesForRegion(region, purgeState);
+        return;
+    }
+    HTMemoryRegion& pages = copies ? *copies : region;
+    PageTargets targets;
+    if (identify || (subranges && pages.eligibleForSubrangesUsingPageSize(page))) targets.pages = &pages;
+    targets.identify = identify;
+    targets.copiesOnly = copies != nullptr;
+    if (copies && subranges && region.eligibleForSubrangesUsingPageSize(page)) targets.filePages = &region;
+    if (targets.pages || targets.filePages) _walkPagesOfRegion(region, targets, purgeState);
 }
 
 // --- gathering ---------------------------------------------------------------------
@@ -757,7 +827,7 @@ void HTUserProcess::_gatherMemoryData()
     std::vector<std::shared_ptr<HTMemoryRegion>> regions;
     const bool hidden = hiddenFromDisplay();
     const bool breakDown = breakDownPhysHeft();
-    const bool sharingDisabled = HTHeft::isSharingAnalysisDisabled();
+    const bool linux = _platformCode() == HTPlatformLinux;
     std::shared_ptr<HTMemoryRegion> fakeRegion;
     uint64_t ownedTotal = 0;
 
@@ -854,10 +924,20 @@ void HTUserProcess::_gatherMemoryData()
             }
         }
 
-        if (breakDown && !sharingDisabled && !hidden && region->eligibleForSubrangesUsingPageSize(page))
-            _addSubrangesForRegion(*region, purgeState);
+        std::shared_ptr<HTMemoryRegion> copies;
+        if (linux && info.external_pager != 0 && info.inheritance != VM_INHERIT_SHARE &&
+            !region->ownedExclusivelyByParentProcess()) {
+            // The file's pages of one image segment are an object of their
+            // own, the same in every process that maps the image, so that
+            // two segments of one file never pass for one.
+            if (region->segment() == HTSegmentOther)
+                region->setObject_id(mixIdentity(region->object_id(), region->offset()) | kFileIdentityBit);
+            copies = _splitCopiedPages(*region, info);
+        }
+        _measurePages(*region, copies.get(), info, purgeState);
 
         if (region != fakeRegion) regions.push_back(region);
+        if (copies) regions.push_back(copies);
         return false;
     });
 

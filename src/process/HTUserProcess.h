@@ -98,6 +98,9 @@ public:
     void setPhys_heft(uint64_t value) { phys_heft_ = value; }
     uint64_t phys_heft_peak() const { return phys_heft_peak_; }
     void setPhys_heft_peak(uint64_t value) { phys_heft_peak_ = value; }
+    // Set while gathering when some memory may be shared with other
+    // processes after a fork but the platform cannot name its pages.
+    bool sharedPagesUnidentified() const { return sharedPagesUnidentified_; }
     // The balance of the "page_table" ledger entry, in bytes.
     const std::array<uint64_t, 1>& ledgers() const { return ledgers_; }
 
@@ -128,6 +131,32 @@ protected:
                                                       const vm_region_submap_info_64& info);
     // Breaks the region into runs of pages of one kind.
     virtual void _addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState);
+
+    // Where a walk over a mapping's pages puts them.
+    struct PageTargets {
+        // Takes the pages (only the copied ones when the file's pages are
+        // kept apart): as sub-ranges, or, with `identify`, as a page list
+        // with the identities of pages other processes may map too. Null to
+        // leave them out.
+        HTMemoryRegion* pages = nullptr;
+        // Takes the file's own pages of a private file mapping as
+        // sub-ranges; null to leave them out.
+        HTMemoryRegion* filePages = nullptr;
+        bool identify = false;
+        // Keeps the file's pages out of `pages` even when `filePages` is null.
+        bool copiesOnly = false;
+    };
+    // Queries the dispositions of every page of the region and hands each
+    // populated page to its target; false when a query failed.
+    bool _walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState);
+    // Measures the region's pages where the kernel's counts do not say
+    // enough: runs of one kind, the file's pages apart from the copies of a
+    // private file mapping, and the identities of pages shared after a fork.
+    void _measurePages(HTMemoryRegion& region, HTMemoryRegion* copies, const vm_region_submap_info_64& info,
+                       int32_t purgeState);
+    // Splits the copied pages of a private file mapping into a region of
+    // their own, which it returns; null when the mapping holds no copies.
+    std::shared_ptr<HTMemoryRegion> _splitCopiedPages(HTMemoryRegion& region, const vm_region_submap_info_64& info);
 
     // Records a failed kernel call as an error, or as a warning when the
     // process has exited or is a zombie and `expectedOnExit` was returned.
@@ -165,4 +194,5 @@ private:
     uint64_t cachedDispositionAddress_ = 0;
     int32_t cachedDisposition_ = 0;
     std::shared_ptr<HTMemoryRegion> pendingUnusedSharedRegion_;
+    bool sharedPagesUnidentified_ = false;
 };

@@ -279,6 +279,19 @@ kern_return_t HTFakePlatform::mach_vm_page_range_query(HTTaskPort& task, uint64_
     return KERN_SUCCESS;
 }
 
+kern_return_t HTFakePlatform::sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
+                                                   uint64_t* identities)
+{
+    Process* found = process(task.pid());
+    if (found == nullptr) return KERN_INVALID_ARGUMENT;
+    for (uint64_t i = 0; i < pages; ++i) {
+        auto identity = found->pageIdentities.find(address + i * pageSize);
+        bool known = sharedPagesIdentifiable && identity != found->pageIdentities.end();
+        identities[i] = known ? identity->second : 0;
+    }
+    return KERN_SUCCESS;
+}
+
 uint64_t HTFakePlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end)
 {
     Process* found = process(task.pid());

@@ -56,6 +56,9 @@ public:
         std::vector<Region> regions;
         // Page dispositions by page address; pages not listed answer 0.
         std::map<uint64_t, int32_t> dispositions;
+        // Identities of pages shared with other processes, by page address;
+        // pages not listed answer 0.
+        std::map<uint64_t, uint64_t> pageIdentities;
         // Region look-ups (recursive and basic) whose answer would be the
         // region at this index or a later one, or no region at all, fail
         // with regionFailureCode instead.
@@ -96,6 +99,8 @@ public:
     int32_t argmax = 256 * 1024;        // KERN_ARGMAX
     uint64_t pageSize = 4096;
     int32_t ownPid = 99999;
+    // Whether shared pages can be told apart (page frames are visible).
+    bool sharedPagesIdentifiable = true;
     uint32_t euid = 0;
     std::set<int> terminals;            // descriptors that are terminals
     std::set<std::string> existingFiles;
@@ -132,6 +137,9 @@ public:
     uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) override;
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
+    bool canIdentifySharedPages() override { return sharedPagesIdentifiable; }
+    kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
+                                       uint64_t* identities) override;
     int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
     int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
     int ledger_template(ledger_template_info* entries, int* count) override;

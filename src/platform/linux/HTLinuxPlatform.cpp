@@ -107,6 +107,7 @@ HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
     HTPageMapping mapping;
     mapping.sharedMemory = vma.isSharedMemory();
     mapping.hugetlb = vma.hasFlag(HTVmFlagHugetlb);
+    mapping.privateFile = vma.kind == HTSmapsKind::File && !vma.shared;
     // Device memory has frames of its own kind.
     if (vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) || vma.hasFlag(HTVmFlagMixedMap)) return mapping;
     // A block device's file systems keep their pages on the device, never in
@@ -125,6 +126,40 @@ HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
         mapping.plainAnonymous = task.mayMapZeroPage(index) == false;
     return mapping;
 }
+
+// Whether the mapping can hold private anonymous pages that another process
+// maps as well. Smaps says when some page or swap slot of a mapping is
+// shared; in a private file mapping, pages shared clean are the file's own,
+// and copies shared after a fork are dirty or swapped.
+bool mayHoldSharedAnonymousPages(const HTSmapsEntry& vma)
+{
+    if (vma.shared || vma.hasFlag(HTVmFlagHugetlb) || vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) ||
+        vma.hasFlag(HTVmFlagMixedMap))
+        return false;
+    switch (vma.kind) {
+    case HTSmapsKind::Anonymous:
+    case HTSmapsKind::Heap:
+    case HTSmapsKind::Stack:
+    case HTSmapsKind::NamedAnonymous: return vma.mayShareWithOtherProcesses();
+    case HTSmapsKind::File: return vma.sharedDirty != 0 || vma.swapPss < vma.swap;
+    default: return false;
+    }
+}
+
+// Walks ascending page addresses through ascending [start, end) runs.
+class HTRunCursor {
+public:
+    explicit HTRunCursor(const std::vector<std::pair<uint64_t, uint64_t>>& runs) : runs_(runs) {}
+    bool contains(uint64_t address)
+    {
+        while (next_ < runs_.size() && runs_[next_].second <= address) ++next_;
+        return next_ < runs_.size() && runs_[next_].first <= address;
+    }
+
+private:
+    const std::vector<std::pair<uint64_t, uint64_t>>& runs_;
+    size_t next_ = 0;
+};
 
 }  // namespace
 
@@ -774,4 +809,102 @@ uint64_t HTLinuxPlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start
     int pagemap = linuxTask->pagemapFd();
     if (pagemap < 0) return start;
     return htPagemapFirstPopulated(pagemap, start, end).value_or(start);
+}
+
+bool HTLinuxPlatform::canIdentifySharedPages()
+{
+    std::call_once(identifyOnce_, [this] {
+        // A page of heft's own that is surely resident: its frame reads as 0
+        // unless heft may see frames.
+        static volatile uint64_t probe = 0;
+        probe = probe + 1;
+        int fd = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
+        if (fd < 0) return;
+        uint64_t entry = 0;
+        const uint64_t page = reinterpret_cast<uintptr_t>(&probe) / vm_kernel_page_size();
+        ssize_t read = htPreadFully(fd, &entry, sizeof(entry), page * sizeof(entry));
+        ::close(fd);
+        canIdentify_ = read == static_cast<ssize_t>(sizeof(entry)) && htPagemapFrame(entry) != 0;
+    });
+    return canIdentify_;
+}
+
+kern_return_t HTLinuxPlatform::sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
+                                                    uint64_t* identities)
+{
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    const uint64_t pageSize = vm_kernel_page_size();
+    if (linuxTask == nullptr || identities == nullptr || address % pageSize != 0 ||
+        pages > (UINT64_MAX - address) / pageSize)
+        return KERN_INVALID_ARGUMENT;
+    std::fill(identities, identities + pages, uint64_t{0});
+    if (pages == 0 || !canIdentifySharedPages()) return KERN_SUCCESS;
+    kern_return_t loaded = loadVmas(*linuxTask, false);
+    if (loaded == MACH_SEND_INVALID_DEST) return KERN_INVALID_ARGUMENT;
+    if (loaded != KERN_SUCCESS) return loaded;
+
+    const uint64_t end = address + pages * pageSize;
+    const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
+    const HTSmapsEntry* first = linuxTask->vmaAtOrAbove(address);
+    if (first == nullptr) return KERN_SUCCESS;
+    for (size_t index = static_cast<size_t>(first - vmas.data()); index < vmas.size() && vmas[index].start < end;
+         ++index) {
+        if (!mayHoldSharedAnonymousPages(vmas[index])) continue;
+        const uint64_t from = std::max(address, vmas[index].start);
+        const uint64_t to = std::min(end, vmas[index].end);
+        kern_return_t result = identifyPages(*linuxTask, index, from, to, identities + (from - address) / pageSize);
+        if (result != KERN_SUCCESS) return result;
+    }
+    return KERN_SUCCESS;
+}
+
+kern_return_t HTLinuxPlatform::identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to,
+                                             uint64_t* identities)
+{
+    const uint64_t pageSize = vm_kernel_page_size();
+    const HTSmapsEntry& vma = task.vmas()[index];
+    const bool swapShared = vma.swapPss < vma.swap;
+    int pagemap = task.pagemapFd();
+    if (pagemap < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+
+    // A read of anonymous memory never written maps a zero page, which is
+    // in every process and holds nothing. The kernel lists where they are;
+    // a kernel without the scan is asked page by page.
+    thread_local std::vector<std::pair<uint64_t, uint64_t>> zeroRuns;
+    const bool checkZero = task.mayMapZeroPage(index) != false;
+    const bool zeroRunsKnown = checkZero && htPagemapZeroPageRuns(pagemap, from, to, zeroRuns);
+    HTRunCursor zeroPages(zeroRuns);
+
+    thread_local std::array<uint64_t, HTPageQueryChunk::kPages> entries;
+    for (uint64_t at = from; at < to;) {
+        const size_t chunk = static_cast<size_t>(std::min<uint64_t>(HTPageQueryChunk::kPages, (to - at) / pageSize));
+        ssize_t bytes = htPreadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), at / pageSize * sizeof(uint64_t));
+        if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+        const size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
+        if (read < chunk) {
+            if (processHasExited(task.procDirFd())) return KERN_INVALID_ARGUMENT;
+            std::fill(entries.begin() + static_cast<ptrdiff_t>(read), entries.begin() + static_cast<ptrdiff_t>(chunk),
+                      uint64_t{0});
+        }
+        for (size_t i = 0; i < chunk; ++i) {
+            uint64_t identity = htSharedPageIdentity(entries[i], swapShared, false);
+            // Only a resident page can be a zero page.
+            if (identity != 0 && checkZero && (entries[i] & HT_PAGEMAP_PRESENT) != 0) {
+                const bool zero = zeroRunsKnown ? zeroPages.contains(at + i * pageSize)
+                                                : isZeroFrame(htPagemapFrame(entries[i]));
+                if (zero) identity = 0;
+            }
+            *identities++ = identity;
+        }
+        at += chunk * pageSize;
+    }
+    return KERN_SUCCESS;
+}
+
+bool HTLinuxPlatform::isZeroFrame(uint64_t frame)
+{
+    int fd = kpageflagsFd();
+    uint64_t flags = 0;
+    if (fd < 0 || htPreadFully(fd, &flags, sizeof(flags), frame * sizeof(flags)) != sizeof(flags)) return false;
+    return (flags & HT_KPF_ZERO_PAGE) != 0;
 }

@@ -61,6 +61,14 @@ public:
     // KERN_INVALID_ARGUMENT when the process is gone or a zombie.
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
                                            int32_t* dispositions, uint64_t* count) override;
+    // True when heft may read physical frame numbers from pagemap (as root).
+    bool canIdentifySharedPages() override;
+    // From /proc/PID/pagemap: frames of resident anonymous pages that are not
+    // mapped exclusively, and swap slots where smaps shows shared swap
+    // (SwapPss below Swap). Only private mappings whose smaps shows pages
+    // shared with other processes are read; zero pages are left out.
+    kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
+                                       uint64_t* identities) override;
     // The path of the mapping that holds the address, as smaps shows it: a
     // file that was deleted or replaced keeps its " (deleted)" mark.
     int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
@@ -104,6 +112,12 @@ private:
     kern_return_t loadVmas(HTLinuxTaskPort& task, bool refresh);
     // Reads the memory figures of /proc/PID/status; false with errno.
     bool readStatus(int32_t pid, HTProcStatus& status);
+    // The identities of the pages [from, to) of the task's mapping at
+    // `index` into `identities`.
+    kern_return_t identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to,
+                                uint64_t* identities);
+    // Whether the frame is a zero page, from its kpageflags.
+    bool isZeroFrame(uint64_t frame);
     // /proc/kpageflags when heft may read it (as root), else -1; opened once.
     int kpageflagsFd();
     // Seconds since the epoch at boot, read once.
@@ -115,6 +129,8 @@ private:
     std::once_flag bootTimeOnce_;
     uint64_t bootTime_ = 0;
     std::atomic<int32_t> selfRegionHeft_{0};
+    std::once_flag identifyOnce_;
+    bool canIdentify_ = false;
     std::once_flag kpageflagsOnce_;
     int kpageflagsFd_ = -1;
     // Parsed program headers are cached per file for the whole run.

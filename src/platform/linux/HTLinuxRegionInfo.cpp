@@ -82,7 +82,7 @@ vm_region_submap_info_64 htSubmapInfo(const HTSmapsEntry& entry, int32_t pid, ui
     // backing store, so every resident one is dirty.
     uint64_t hugetlb = entry.sharedHugetlb + entry.privateHugetlb;
     uint64_t resident = entry.rss + hugetlb;
-    uint64_t sharedBytes = entry.sharedClean + entry.sharedDirty + entry.sharedHugetlb;
+    const bool sharedWithOthers = entry.mayShareWithOtherProcesses();
 
     vm_region_submap_info_64 info{};
     info.protection = entry.protection;
@@ -96,7 +96,7 @@ vm_region_submap_info_64 htSubmapInfo(const HTSmapsEntry& entry, int32_t pid, ui
     info.pages_reusable = pages(entry.lazyFree, pageSize);
     // The copied-on-write pages of a private file mapping are anonymous.
     info.pages_shared_now_private = !entry.shared && entry.hasBackingObject() ? pages(entry.anonymous, pageSize) : 0;
-    info.ref_count = sharedBytes != 0 ? 2 : 1;
+    info.ref_count = sharedWithOthers ? 2 : 1;
     info.external_pager = entry.kind == HTSmapsKind::File ? 1 : 0;
     if (resident == 0 && entry.swap == 0)
         info.share_mode = SM_EMPTY;
@@ -105,8 +105,9 @@ vm_region_submap_info_64 htSubmapInfo(const HTSmapsEntry& entry, int32_t pid, ui
     else if (entry.hasBackingObject())
         info.share_mode = SM_COW;
     else
-        // Private anonymous pages still shared after a fork are copy-on-write.
-        info.share_mode = sharedBytes != 0 ? SM_COW : SM_PRIVATE;
+        // Private anonymous pages (or swap slots) still shared after a fork
+        // are copy-on-write.
+        info.share_mode = sharedWithOthers ? SM_COW : SM_PRIVATE;
     info.user_wired_count = entry.hasFlag(HTVmFlagLocked) ? 1 : 0;
     info.object_id_full = htRegionObjectId(entry, pid);
     info.object_id = static_cast<uint32_t>(info.object_id_full);

@@ -10,12 +10,15 @@
 inline constexpr uint64_t HT_PAGEMAP_PRESENT = uint64_t{1} << 63;
 inline constexpr uint64_t HT_PAGEMAP_SWAPPED = uint64_t{1} << 62;
 inline constexpr uint64_t HT_PAGEMAP_FILE_OR_SHARED = uint64_t{1} << 61;
+inline constexpr uint64_t HT_PAGEMAP_GUARD_REGION = uint64_t{1} << 58;
+inline constexpr uint64_t HT_PAGEMAP_EXCLUSIVE = uint64_t{1} << 56;
 inline constexpr uint64_t HT_PAGEMAP_PFN_MASK = (uint64_t{1} << 55) - 1;
 
 // kpageflags bits.
 inline constexpr uint64_t HT_KPF_DIRTY = uint64_t{1} << 4;
 inline constexpr uint64_t HT_KPF_ANON = uint64_t{1} << 12;
 inline constexpr uint64_t HT_KPF_SWAPBACKED = uint64_t{1} << 14;
+inline constexpr uint64_t HT_KPF_ZERO_PAGE = uint64_t{1} << 24;
 
 // What the page's mapping is, from its smaps record.
 struct HTPageMapping {
@@ -28,6 +31,9 @@ struct HTPageMapping {
     // No anonymous page here is the shared zero page or was freed with
     // MADV_FREE: each is swap-backed memory of its own, dirty.
     bool plainAnonymous = false;
+    // A private mapping of a file: its anonymous pages are copies made on
+    // write.
+    bool privateFile = false;
 };
 
 // The frame number of a present page; 0 when the reader may not see it.
@@ -47,3 +53,12 @@ int32_t htPageDisposition(uint64_t pagemapEntry, const uint64_t* pageFlags, HTPa
 // the pagemap and the mapping already say everything, and skipping the
 // flags saves a read per page or folio: frames lie scattered.
 bool htPageFlagsMatter(uint64_t pagemapEntry, HTPageMapping mapping);
+
+// The identity of a page that other processes may map as well, from its
+// pagemap entry; 0 for any other page. A resident anonymous page that is
+// not mapped exclusively is named by its frame, a swapped-out page (only
+// where `swapShared`: some swap slot of its mapping is shared) by its swap
+// slot. The shared zero page is mapped everywhere and holds nothing: the
+// caller says when the page is one. Without the right to see frames and
+// swap slots (they read 0), no page has an identity.
+uint64_t htSharedPageIdentity(uint64_t pagemapEntry, bool swapShared, bool zeroPage);

@@ -69,3 +69,28 @@ std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint6
     if (!first) return std::nullopt;
     return *first < end;
 }
+
+bool htPagemapZeroPageRuns(int pagemapFd, uint64_t start, uint64_t end,
+                           std::vector<std::pair<uint64_t, uint64_t>>& runs)
+{
+    runs.clear();
+    PageRegion found[64];
+    while (start < end) {
+        PagemapScanArg arg{};
+        arg.size = sizeof(arg);
+        arg.start = start;
+        arg.end = end;
+        arg.vec = reinterpret_cast<uint64_t>(found);
+        arg.vec_len = sizeof(found) / sizeof(found[0]);
+        arg.category_mask = kPageIsZeroFrame;
+        arg.return_mask = kPageIsZeroFrame;
+        long count = ::ioctl(pagemapFd, kPagemapScan, &arg);
+        if (count < 0) return false;
+        for (long i = 0; i < count; ++i) runs.emplace_back(found[i].start, found[i].end);
+        // The kernel says where its walk stopped: at `end`, or where the
+        // vector filled up.
+        if (arg.walk_end <= start) return false;
+        start = arg.walk_end;
+    }
+    return true;
+}

@@ -2,6 +2,8 @@
 
 #include <cstdint>
 #include <optional>
+#include <utility>
+#include <vector>
 
 // Asks the kernel, through the pagemap's scan request, for the first page
 // in [start, end) that is resident or swapped out. The kernel walks its page
@@ -16,3 +18,9 @@ std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, u
 // by a huge page entry, as the huge zero page is (kernels have not always
 // reported that one as a zero page). nullopt when the kernel cannot say.
 std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint64_t end);
+
+// The runs [start, end) of pages in [start, end) that map a zero page (the
+// shared zero page or the huge zero page), in address order, into `runs`.
+// False when the kernel does not offer the scan or it fails.
+bool htPagemapZeroPageRuns(int pagemapFd, uint64_t start, uint64_t end,
+                           std::vector<std::pair<uint64_t, uint64_t>>& runs);

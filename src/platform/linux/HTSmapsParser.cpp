@@ -95,6 +95,7 @@ uint64_t* sizeField(HTSmapsEntry& entry, std::string_view name)
         if (name == "Shared_Clean") return &entry.sharedClean;
         if (name == "Shared_Dirty") return &entry.sharedDirty;
         if (name == "Swap") return &entry.swap;
+        if (name == "SwapPss") return &entry.swapPss;
         if (name == "Shared_Hugetlb") return &entry.sharedHugetlb;
         break;
     case 'P':

@@ -63,6 +63,9 @@ struct HTSmapsEntry {
     uint64_t anonymous = 0;
     uint64_t lazyFree = 0;
     uint64_t swap = 0;
+    // Below `swap` when some swap slots are shared with other processes
+    // (after a fork).
+    uint64_t swapPss = 0;
     // hugetlbfs pages are not in Rss: the kernel counts them here.
     uint64_t sharedHugetlb = 0;
     uint64_t privateHugetlb = 0;
@@ -72,6 +75,12 @@ struct HTSmapsEntry {
     bool isSharedMemory() const
     {
         return kind == HTSmapsKind::SharedMemory || kind == HTSmapsKind::NamedSharedMemory;
+    }
+    // Whether pages of this mapping may be mapped by other processes too:
+    // resident pages counted shared, or swap slots shared.
+    bool mayShareWithOtherProcesses() const
+    {
+        return sharedClean + sharedDirty + sharedHugetlb != 0 || swapPss < swap;
     }
     // Backed by a kernel object (a file or a shared-memory inode) that other
     // processes may map as well.

@@ -1,0 +1,298 @@
+#include "analysis/HTSharedPageResolver.h"
+
+#include "base/HTAssert.h"
+#include "model/HTMemoryRegion.h"
+#include "model/HTSharedPageList.h"
+#include "model/HTSubrangeBuilder.h"
+#include "process/HTProcess.h"
+
+#include <algorithm>
+#include <unordered_map>
+
+namespace {
+
+constexpr const char* kModule = "HTSharedPageResolver";
+
+// Objects of pages shared after a fork have identities of their own: the
+// top two bits 00 keep them apart from files (1x) and anonymous memory (01).
+constexpr uint64_t kIdentityNamespaceBits = uint64_t{3} << 62;
+
+uint64_t mix(uint64_t value)
+{
+    value ^= value >> 30;
+    value *= 0xbf58476d1ce4e5b9ULL;
+    value ^= value >> 27;
+    value *= 0x94d049bb133111ebULL;
+    value ^= value >> 31;
+    return value;
+}
+
+// The identity of the object of the pages that the process set `set` maps
+// and that its first process maps through its region `region`.
+uint64_t sharedObjectId(uint32_t set, uint32_t region)
+{
+    uint64_t id = mix(mix(set) ^ (uint64_t{region} << 32 | 0x5A5A)) & ~kIdentityNamespaceBits;
+    return id == 0 ? 1 : id;
+}
+
+// Subtracts without wrapping.
+uint64_t less(uint64_t value, uint64_t taken) { return value > taken ? value - taken : 0; }
+
+}  // namespace
+
+// A region with a page list, with its process's place in the list.
+struct HTSharedPageResolver::Candidate {
+    std::shared_ptr<HTMemoryRegion> region;
+    uint32_t process;
+    uint64_t pageSize;
+};
+
+// Every identity met, with the set of processes mapping it and where the
+// first of them maps it. Open addressing over a power-of-two table; the
+// identity 0 marks a free slot (the platform never names a page 0).
+class HTSharedPageResolver::IdentityTable {
+public:
+    struct Entry {
+        uint64_t identity;
+        uint32_t set;
+        uint32_t region;   // the candidate through which the page was first met
+        uint64_t address;  // its address in that region's process
+    };
+
+    // The entry of the identity, or a fresh one holding it with the other
+    // fields zero; `fresh` says which.
+    Entry& entryFor(uint64_t identity, bool& fresh)
+    {
+        if ((count_ + 1) * 10 > slots_.size() * 7) grow();
+        Entry& entry = slots_[slotFor(identity)];
+        fresh = entry.identity == 0;
+        if (fresh) {
+            entry = Entry{identity, 0, 0, 0};
+            ++count_;
+        }
+        return entry;
+    }
+    const Entry& find(uint64_t identity) const
+    {
+        const Entry& entry = slots_[slotFor(identity)];
+        HT_ASSERT(kModule, entry.identity == identity, "identity registered");
+        return entry;
+    }
+
+private:
+    size_t slotFor(uint64_t identity) const
+    {
+        const size_t mask = slots_.size() - 1;
+        size_t slot = static_cast<size_t>(mix(identity)) & mask;
+        while (slots_[slot].identity != 0 && slots_[slot].identity != identity) slot = (slot + 1) & mask;
+        return slot;
+    }
+    void grow()
+    {
+        std::vector<Entry> old(std::max<size_t>(1024, slots_.size() * 2));
+        old.swap(slots_);
+        for (const Entry& entry : old)
+            if (entry.identity != 0) slots_[slotFor(entry.identity)] = entry;
+    }
+
+    std::vector<Entry> slots_;
+    size_t count_ = 0;
+};
+
+// Sets of processes, each a sorted list of places in the process list,
+// under small numbers; set 0 is empty. A set grows one process at a time,
+// and the step from a set by a process is remembered, so that the pages of
+// one fork family, met process after process, find their set at once.
+class HTSharedPageResolver::ProcessSets {
+public:
+    ProcessSets() : members_(1) {}
+
+    uint32_t adding(uint32_t set, uint32_t process)
+    {
+        const std::vector<uint32_t>& members = members_[set];
+        // Processes come in ascending order: one already in the set is last.
+        if (!members.empty() && members.back() == process) return set;
+        const uint64_t step = uint64_t{set} << 32 | process;
+        auto [found, inserted] = steps_.emplace(step, 0);
+        if (inserted) {
+            std::vector<uint32_t> grown = members;
+            grown.push_back(process);
+            found->second = static_cast<uint32_t>(members_.size());
+            members_.push_back(std::move(grown));
+        }
+        return found->second;
+    }
+    size_t size(uint32_t set) const { return members_[set].size(); }
+
+private:
+    std::vector<std::vector<uint32_t>> members_;
+    std::unordered_map<uint64_t, uint32_t> steps_;
+};
+
+HTSharedPageResolver::HTSharedPageResolver(const ProcessList& processes)
+    : processes_(processes), identities_(std::make_unique<IdentityTable>()), sets_(std::make_unique<ProcessSets>())
+{
+}
+
+HTSharedPageResolver::~HTSharedPageResolver() = default;
+
+void HTSharedPageResolver::resolve()
+{
+    for (uint32_t index = 0; index < processes_.size(); ++index) {
+        const HTProcess& process = *processes_[index];
+        for (const auto& region : process.memoryRegions())
+            if (region->sharedPageList()) candidates_.push_back(Candidate{region, index, process.pageSize()});
+    }
+    if (candidates_.empty()) return;
+    registerPages();
+    cutRegions();
+    candidates_.clear();
+    identities_.reset();
+    sets_.reset();
+}
+
+void HTSharedPageResolver::registerPages()
+{
+    for (uint32_t index = 0; index < candidates_.size(); ++index) {
+        const Candidate& candidate = candidates_[index];
+        const HTSharedPageList& list = *candidate.region->sharedPageList();
+        for (const HTSharedPageList::Run& run : list.runs()) {
+            if (run.firstIdentity == HTSharedPageList::kNoIdentity) continue;
+            for (uint32_t i = 0; i < run.count; ++i) {
+                bool fresh = false;
+                IdentityTable::Entry& entry = identities_->entryFor(list.identity(run, i), fresh);
+                if (fresh) {
+                    entry.region = index;
+                    entry.address = candidate.region->start() + uint64_t{run.firstPage + i} * candidate.pageSize;
+                }
+                entry.set = sets_->adding(entry.set, candidate.process);
+            }
+        }
+    }
+}
+
+void HTSharedPageResolver::cutRegions()
+{
+    size_t next = 0;
+    while (next < candidates_.size()) {
+        // The candidates of one process, and the pieces cut from each.
+        const uint32_t process = candidates_[next].process;
+        std::unordered_map<const HTMemoryRegion*, std::vector<std::shared_ptr<HTMemoryRegion>>> piecesOf;
+        for (; next < candidates_.size() && candidates_[next].process == process; ++next) {
+            std::vector<std::shared_ptr<HTMemoryRegion>> pieces;
+            cutRegion(candidates_[next], pieces);
+            if (!pieces.empty()) piecesOf.emplace(candidates_[next].region.get(), std::move(pieces));
+        }
+        if (piecesOf.empty()) continue;
+
+        // The pieces follow their region in the walk's order.
+        HTProcess& owner = *processes_[process];
+        std::vector<std::shared_ptr<HTMemoryRegion>> regions;
+        regions.reserve(owner.memoryRegions().size() + piecesOf.size());
+        for (const auto& region : owner.memoryRegions()) {
+            regions.push_back(region);
+            auto found = piecesOf.find(region.get());
+            if (found != piecesOf.end()) regions.insert(regions.end(), found->second.begin(), found->second.end());
+        }
+        owner.setMemoryRegions(std::move(regions));
+    }
+}
+
+namespace {
+
+// One piece of a region: the pages of one shared object, with their runs
+// at the addresses of the object's first process.
+struct Piece {
+    uint64_t objectId;
+    std::shared_ptr<HTMemoryRegion> region;
+    std::unique_ptr<HTSubrangeBuilder> runs;
+    HTMemoryTotals totals;
+    uint64_t pages = 0;
+};
+
+std::shared_ptr<HTMemoryRegion> makePiece(const HTMemoryRegion& region, uint64_t objectId, uint64_t start,
+                                          uint64_t offset)
+{
+    auto piece = std::make_shared<HTMemoryRegion>();
+    piece->setStart(start);
+    piece->setOffset(offset);
+    piece->setUser_tag(region.user_tag());
+    piece->setSegment(region.segment());
+    piece->setName(region.name());
+    piece->setDetailedName(region.detailedName());
+    piece->setWired(region.wired());
+    // The same pages in every process that maps them: shared, not the
+    // process's own copy.
+    piece->setShare_mode(SM_SHARED);
+    piece->setObject_id(objectId);
+    return piece;
+}
+
+void addTotals(HTMemoryTotals& sum, const HTMemoryTotals& more)
+{
+    sum.dirty += more.dirty;
+    sum.swapped += more.swapped;
+    sum.clean += more.clean;
+    sum.reclaimable += more.reclaimable;
+    sum.wired += more.wired;
+}
+
+}  // namespace
+
+void HTSharedPageResolver::cutRegion(const Candidate& candidate, std::vector<std::shared_ptr<HTMemoryRegion>>& cut)
+{
+    HTMemoryRegion& region = *candidate.region;
+    const std::unique_ptr<HTSharedPageList> list = region.takeSharedPageList();
+    const uint64_t page = candidate.pageSize;
+    HTSubrangeBuilder own(&region, page);
+    std::vector<Piece> pieces;
+    size_t lastPiece = 0;
+
+    auto pieceFor = [&](uint64_t objectId, uint64_t start, uint64_t offset) -> Piece& {
+        if (lastPiece < pieces.size() && pieces[lastPiece].objectId == objectId) return pieces[lastPiece];
+        for (lastPiece = 0; lastPiece < pieces.size(); ++lastPiece)
+            if (pieces[lastPiece].objectId == objectId) return pieces[lastPiece];
+        Piece made{objectId, makePiece(region, objectId, start, offset), nullptr, {}, 0};
+        made.runs = std::make_unique<HTSubrangeBuilder>(made.region.get(), page);
+        pieces.push_back(std::move(made));
+        return pieces.back();
+    };
+
+    for (const HTSharedPageList::Run& run : list->runs()) {
+        for (uint32_t i = 0; i < run.count; ++i) {
+            const uint64_t index = uint64_t{run.firstPage} + i;
+            if (run.firstIdentity != HTSharedPageList::kNoIdentity) {
+                const IdentityTable::Entry& entry = identities_->find(list->identity(run, i));
+                if (sets_->size(entry.set) > 1) {
+                    const uint64_t address = region.start() + index * page;
+                    Piece& piece = pieceFor(sharedObjectId(entry.set, entry.region), address, entry.address);
+                    piece.runs->add(entry.address, run.kind);
+                    addTotals(piece.totals, htTotalsForPageKind(run.kind, page, false));
+                    ++piece.pages;
+                    continue;
+                }
+            }
+            own.add(region.offset() + index * page, run.kind);
+        }
+    }
+    own.flush();
+
+    HTMemoryTotals moved;
+    for (Piece& piece : pieces) {
+        piece.runs->flush();
+        HTMemoryRegion& made = *piece.region;
+        made.setSize(piece.pages * page);
+        made.setDirtySize(piece.totals.dirty);
+        made.setSwappedSize(piece.totals.swapped);
+        made.setCleanNonSpecSize(piece.totals.clean);
+        made.setReclaimableSize(piece.totals.reclaimable);
+        addTotals(moved, piece.totals);
+        cut.push_back(piece.region);
+    }
+    // What the region keeps is what it held less what moved; the kernel's
+    // counts and the pages' kinds may differ by a page read a moment apart.
+    region.setDirtySize(less(region.dirtySize(), moved.dirty));
+    region.setSwappedSize(less(region.swappedSize(), moved.swapped));
+    region.setCleanNonSpecSize(less(region.cleanNonSpecSize(), moved.clean));
+    region.setReclaimableSize(less(region.reclaimableSize(), moved.reclaimable));
+}

@@ -1,0 +1,54 @@
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <vector>
+
+class HTMemoryRegion;
+class HTProcess;
+
+// Memory that several processes map after a fork: the same physical pages
+// in each, with no kernel object to name them. Gathering records, for each
+// region that may hold such pages, its pages with the identities the kernel
+// gives them. Once every process is gathered, and before the regions are
+// routed to their objects, the resolver finds which processes map each page
+// and cuts the regions accordingly:
+//
+// - pages that only one of the analysed processes maps stay in their region,
+//   as sub-ranges of the region's own object;
+// - pages mapped by a set of processes move to a new region, one per
+//   object. An object is the pages with the same set of mapping processes
+//   that the first of them (in the order of the process list) maps through
+//   the same region; it is named after that region. Every process's piece
+//   of an object holds the same pages, placed at the addresses where that
+//   first process maps them, so the object counts each page once while each
+//   process is still charged with all of them.
+//
+// The piece regions follow their region in the process's region list; the
+// page lists are released.
+class HTSharedPageResolver {
+public:
+    using ProcessList = std::vector<std::shared_ptr<HTProcess>>;
+
+    explicit HTSharedPageResolver(const ProcessList& processes);
+    ~HTSharedPageResolver();
+    HTSharedPageResolver(const HTSharedPageResolver&) = delete;
+    HTSharedPageResolver& operator=(const HTSharedPageResolver&) = delete;
+
+    // Cuts every region that recorded a page list. Called once.
+    void resolve();
+
+private:
+    struct Candidate;
+    class IdentityTable;
+    class ProcessSets;
+
+    void registerPages();
+    void cutRegions();
+    void cutRegion(const Candidate& candidate, std::vector<std::shared_ptr<HTMemoryRegion>>& pieces);
+
+    const ProcessList& processes_;
+    std::vector<Candidate> candidates_;
+    std::unique_ptr<IdentityTable> identities_;
+    std::unique_ptr<ProcessSets> sets_;
+};
