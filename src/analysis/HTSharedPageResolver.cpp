@@ -45,6 +45,8 @@ struct HTSharedPageResolver::Candidate {
     std::shared_ptr<HTMemoryRegion> region;
     uint32_t process;
     uint64_t pageSize;
+    // The number of the region's first identified page (see registerPages).
+    uint32_t firstOrdinal = 0;
 };
 
 // Every identity met, with the set of processes mapping it and where the
@@ -55,19 +57,20 @@ public:
     struct Entry {
         uint64_t identity;
         uint32_t set;
-        uint32_t region;   // the candidate through which the page was first met
-        uint64_t address;  // its address in that region's process
+        // The page's number in the order pages were first met: consecutive
+        // pages of the first region that met them have consecutive numbers.
+        uint32_t ordinal;
     };
 
     // The entry of the identity, or a fresh one holding it with the other
     // fields zero; `fresh` says which.
     Entry& entryFor(uint64_t identity, bool& fresh)
     {
-        if ((count_ + 1) * 10 > slots_.size() * 7) grow();
+        if ((count_ + 1) * 4 > slots_.size() * 3) grow();
         Entry& entry = slots_[slotFor(identity)];
         fresh = entry.identity == 0;
         if (fresh) {
-            entry = Entry{identity, 0, 0, 0};
+            entry = Entry{identity, 0, 0};
             ++count_;
         }
         return entry;
@@ -113,20 +116,26 @@ public:
         // Processes come in ascending order: one already in the set is last.
         if (!members.empty() && members.back() == process) return set;
         const uint64_t step = uint64_t{set} << 32 | process;
-        auto [found, inserted] = steps_.emplace(step, 0);
-        if (inserted) {
+        // Neighbouring pages mostly take the same step.
+        if (step == lastStep_) return lastResult_;
+        auto found = steps_.find(step);
+        if (found == steps_.end()) {
             std::vector<uint32_t> grown = members;
             grown.push_back(process);
-            found->second = static_cast<uint32_t>(members_.size());
+            found = steps_.emplace(step, static_cast<uint32_t>(members_.size())).first;
             members_.push_back(std::move(grown));
         }
-        return found->second;
+        lastStep_ = step;
+        lastResult_ = found->second;
+        return lastResult_;
     }
     size_t size(uint32_t set) const { return members_[set].size(); }
 
 private:
     std::vector<std::vector<uint32_t>> members_;
     std::unordered_map<uint64_t, uint32_t> steps_;
+    uint64_t lastStep_ = UINT64_MAX;
+    uint32_t lastResult_ = 0;
 };
 
 HTSharedPageResolver::HTSharedPageResolver(const ProcessList& processes)
@@ -141,7 +150,7 @@ void HTSharedPageResolver::resolve()
     for (uint32_t index = 0; index < processes_.size(); ++index) {
         const HTProcess& process = *processes_[index];
         for (const auto& region : process.memoryRegions())
-            if (region->sharedPageList()) candidates_.push_back(Candidate{region, index, process.pageSize()});
+            if (region->sharedPageList()) candidates_.push_back(Candidate{region, index, process.pageSize(), 0});
     }
     if (candidates_.empty()) return;
     registerPages();
@@ -153,22 +162,31 @@ void HTSharedPageResolver::resolve()
 
 void HTSharedPageResolver::registerPages()
 {
-    for (uint32_t index = 0; index < candidates_.size(); ++index) {
-        const Candidate& candidate = candidates_[index];
+    uint32_t ordinal = 0;
+    for (Candidate& candidate : candidates_) {
+        candidate.firstOrdinal = ordinal;
         const HTSharedPageList& list = *candidate.region->sharedPageList();
         for (const HTSharedPageList::Run& run : list.runs()) {
             if (run.firstIdentity == HTSharedPageList::kNoIdentity) continue;
-            for (uint32_t i = 0; i < run.count; ++i) {
+            for (uint32_t i = 0; i < run.count; ++i, ++ordinal) {
                 bool fresh = false;
                 IdentityTable::Entry& entry = identities_->entryFor(list.identity(run, i), fresh);
-                if (fresh) {
-                    entry.region = index;
-                    entry.address = candidate.region->start() + uint64_t{run.firstPage + i} * candidate.pageSize;
-                }
+                if (fresh) entry.ordinal = ordinal;
                 entry.set = sets_->adding(entry.set, candidate.process);
             }
         }
     }
+}
+
+uint32_t HTSharedPageResolver::candidateOfOrdinal(uint32_t ordinal, uint32_t hint) const
+{
+    // Pages of one run mostly come from the same region.
+    if (hint < candidates_.size() && candidates_[hint].firstOrdinal <= ordinal &&
+        (hint + 1 == candidates_.size() || ordinal < candidates_[hint + 1].firstOrdinal))
+        return hint;
+    auto after = std::upper_bound(candidates_.begin(), candidates_.end(), ordinal,
+                                  [](uint32_t value, const Candidate& candidate) { return value < candidate.firstOrdinal; });
+    return static_cast<uint32_t>(after - candidates_.begin()) - 1;
 }
 
 void HTSharedPageResolver::cutRegions()
@@ -258,15 +276,20 @@ void HTSharedPageResolver::cutRegion(const Candidate& candidate, std::vector<std
         return pieces.back();
     };
 
+    uint32_t firstMapping = 0;
     for (const HTSharedPageList::Run& run : list->runs()) {
         for (uint32_t i = 0; i < run.count; ++i) {
             const uint64_t index = uint64_t{run.firstPage} + i;
             if (run.firstIdentity != HTSharedPageList::kNoIdentity) {
                 const IdentityTable::Entry& entry = identities_->find(list->identity(run, i));
                 if (sets_->size(entry.set) > 1) {
+                    // The object's pages lie in the order the first process
+                    // maps them: the same place in every process's piece.
+                    firstMapping = candidateOfOrdinal(entry.ordinal, firstMapping);
+                    const uint64_t offset = uint64_t{entry.ordinal} * page;
                     const uint64_t address = region.start() + index * page;
-                    Piece& piece = pieceFor(sharedObjectId(entry.set, entry.region), address, entry.address);
-                    piece.runs->add(entry.address, run.kind);
+                    Piece& piece = pieceFor(sharedObjectId(entry.set, firstMapping), address, offset);
+                    piece.runs->add(offset, run.kind);
                     addTotals(piece.totals, htTotalsForPageKind(run.kind, page, false));
                     ++piece.pages;
                     continue;

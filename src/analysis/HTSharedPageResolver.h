@@ -20,7 +20,7 @@ class HTProcess;
 //   object. An object is the pages with the same set of mapping processes
 //   that the first of them (in the order of the process list) maps through
 //   the same region; it is named after that region. Every process's piece
-//   of an object holds the same pages, placed at the addresses where that
+//   of an object holds the same pages, placed in the order in which that
 //   first process maps them, so the object counts each page once while each
 //   process is still charged with all of them.
 //
@@ -46,6 +46,8 @@ private:
     void registerPages();
     void cutRegions();
     void cutRegion(const Candidate& candidate, std::vector<std::shared_ptr<HTMemoryRegion>>& pieces);
+    // The candidate whose pages got the number; `hint` is tried first.
+    uint32_t candidateOfOrdinal(uint32_t ordinal, uint32_t hint) const;
 
     const ProcessList& processes_;
     std::vector<Candidate> candidates_;

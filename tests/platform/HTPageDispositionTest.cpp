@@ -111,6 +111,51 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPlainAnonymous));
 }
 
+TEST(HTPageDisposition, CopiesOfAPrivateFileMappingAreMarked)
+{
+    HTPageMapping privateFile;
+    privateFile.privateFile = true;
+    const int32_t copied = VM_PAGE_QUERY_PAGE_COPIED;
+    EXPECT_EQ(htPageDisposition(kPresentEntry, nullptr, privateFile) & copied, copied);
+    EXPECT_EQ(htPageDisposition(kSwappedEntry, nullptr, privateFile) & copied, copied);
+    EXPECT_EQ(htPageDisposition(kFileEntry, nullptr, privateFile) & copied, 0);
+    EXPECT_EQ(htPageDisposition(0, nullptr, privateFile), 0);
+    EXPECT_EQ(htPageDisposition(kPresentEntry, nullptr, kPrivate) & copied, 0);
+}
+
+TEST(HTPageDisposition, SharedPageIdentities)
+{
+    constexpr uint64_t kExclusive = HT_PAGEMAP_EXCLUSIVE;
+    struct Row {
+        uint64_t entry;
+        bool swapShared;
+        bool zeroPage;
+        bool named;
+    };
+    const Row rows[] = {
+        {kPresentEntry, false, false, true},               // resident, mapped by others too
+        {kPresentEntry | kExclusive, false, false, false},  // mapped here alone
+        {kFileEntry, false, false, false},                  // the file's page, not a copy
+        {kPresentEntry, false, true, false},                // the zero page holds nothing
+        {HT_PAGEMAP_PRESENT, false, false, false},          // frames hidden from the reader
+        {kSwappedEntry, true, false, true},                 // a swap slot shared after fork
+        {kSwappedEntry, false, false, false},               // no swap slot of the mapping is shared
+        {kSwappedEntry | HT_PAGEMAP_GUARD_REGION, true, false, false},
+        {0, true, false, false},
+    };
+    for (const Row& row : rows) {
+        uint64_t identity = htSharedPageIdentity(row.entry, row.swapShared, row.zeroPage);
+        EXPECT_EQ(identity != 0, row.named) << std::hex << row.entry;
+        EXPECT_LT(identity, HTMaxPageIdentity);
+    }
+    // A frame and a swap slot of the same number are different pages; the
+    // same frame seen from two processes is one.
+    EXPECT_NE(htSharedPageIdentity(HT_PAGEMAP_PRESENT | 0x5678, false, false),
+              htSharedPageIdentity(kSwappedEntry, true, false));
+    EXPECT_EQ(htSharedPageIdentity(kPresentEntry, false, false),
+              htSharedPageIdentity(kPresentEntry, true, false));
+}
+
 TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)
 {
     constexpr std::string_view live = "Name:\tcat\nState:\tR (running)\nVmPeak:\t    3060 kB\n"

@@ -594,10 +594,11 @@ kern_return_t HTLinuxPlatform::vmaAtOrAbove(HTTaskPort& task, uint64_t address, 
     if (loaded != KERN_SUCCESS) return loaded;
     *vma = linuxTask->vmaAtOrAbove(address);
     if (*vma != nullptr) return KERN_SUCCESS;
-    // Past the last mapping the walk is over. The pagemap is let go until
-    // the next page query: a run over thousands of processes keeps all
-    // their handles at once.
+    // Past the last mapping the walk is over. The pagemap and the parsed
+    // mappings are let go until the next query: a run over thousands of
+    // processes keeps all their handles at once.
     linuxTask->closePagemap();
+    linuxTask->releaseVmas();
     return KERN_INVALID_ADDRESS;
 }
 

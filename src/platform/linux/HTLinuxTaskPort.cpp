@@ -34,6 +34,13 @@ void HTLinuxTaskPort::clearVmas()
     hasParsedVmas_ = false;
 }
 
+void HTLinuxTaskPort::releaseVmas()
+{
+    clearVmas();
+    vmas_.shrink_to_fit();
+    zeroPageAnswers_.shrink_to_fit();
+}
+
 const HTSmapsEntry* HTLinuxTaskPort::vmaAtOrAbove(uint64_t address) const
 {
     // Mappings do not overlap, so their ends ascend with their starts.

@@ -34,6 +34,8 @@ public:
     void parseVmas(std::string_view smaps);
     // Forgets the mappings: the next look-up reads them again.
     void clearVmas();
+    // Forgets the mappings and frees what held them.
+    void releaseVmas();
     // The first mapping whose end is above the address (the one holding
     // it, or the next one); null when there is none.
     const HTSmapsEntry* vmaAtOrAbove(uint64_t address) const;
