@@ -1,8 +1,9 @@
 // Cost of adding ranges to a range list. The list is a singly linked list
-// walked from its head on every insertion, so where new spans land decides
-// the cost: at the tail (ascending, disjoint) every insertion walks the
-// whole list; at the head (descending) none does; merging ranges keep the
-// list short.
+// that remembers where the last range went: ranges in ascending order (as
+// sub-ranges and whole lists come) each start looking there and cost a
+// constant; a range before that point walks from the head, which is cheap
+// at the head (descending) and costs the list's length at random places.
+// Merging ranges keep the list short.
 
 #include "model/HTMemoryRegion.h"
 #include "model/HTRangeList.h"
@@ -82,7 +83,8 @@ void BM_AddOverlappingMerging(benchmark::State& state)
 }
 
 // A region whose sub-ranges are `count` one-page runs, alternately dirty
-// and clean, touching or `gap` pages apart.
+// and clean, touching or `gap` pages apart. Runs of different kinds stay
+// separate spans either way.
 std::shared_ptr<HTMemoryRegion> alternatingRuns(int64_t count, int64_t gap)
 {
     auto region = std::make_shared<HTMemoryRegion>();
