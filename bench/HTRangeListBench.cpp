@@ -1,15 +1,18 @@
 // Cost of adding ranges to a range list. The list is a singly linked list
-// walked from its head on every insertion, so where new spans land decides
-// the cost: at the tail (ascending, disjoint) every insertion walks the
-// whole list; at the head (descending) none does; merging ranges keep the
-// list short.
+// that remembers where the last range went: ranges in ascending order (as
+// sub-ranges and whole lists come) each start looking there and cost a
+// constant; a range before that point walks from the head, which is cheap
+// at the head (descending) and costs the list's length at random places.
+// Merging ranges keep the list short.
 
+#include "model/HTMemoryRegion.h"
 #include "model/HTRangeList.h"
 
 #include <benchmark/benchmark.h>
 
 #include <algorithm>
 #include <cstdint>
+#include <memory>
 #include <numeric>
 #include <random>
 #include <vector>
@@ -79,9 +82,51 @@ void BM_AddOverlappingMerging(benchmark::State& state)
     countInsertions(state, count);
 }
 
+// A region whose sub-ranges are `count` one-page runs, alternately dirty
+// and clean, touching or `gap` pages apart. Runs of different kinds stay
+// separate spans either way.
+std::shared_ptr<HTMemoryRegion> alternatingRuns(int64_t count, int64_t gap)
+{
+    auto region = std::make_shared<HTMemoryRegion>();
+    const uint64_t stride = static_cast<uint64_t>(1 + gap) * kPage;
+    region->setSize(static_cast<uint64_t>(count) * stride);
+    for (int64_t i = 0; i < count; ++i) {
+        HTMemoryTotals totals;
+        (i % 2 ? totals.clean : totals.dirty) = kPage;
+        region->addSubrange(static_cast<uint64_t>(i) * stride, kPage, totals, kPage);
+    }
+    return region;
+}
+
+// Several processes forked from one parent report the same runs of the
+// memory they share: the second region's sub-ranges land on spans that hold
+// the same runs already. Only that second addition is timed.
+void BM_AddSharedRunsAgain(benchmark::State& state)
+{
+    const int64_t count = state.range(0);
+    std::shared_ptr<HTMemoryRegion> region = alternatingRuns(count, state.range(1));
+    for (auto _ : state) {
+        state.PauseTiming();
+        auto list = std::make_unique<HTRangeList>();
+        list->addRegion(*region, kPage);
+        state.ResumeTiming();
+        list->addRegion(*region, kPage);
+        benchmark::DoNotOptimize(list->head());
+        state.PauseTiming();
+        list.reset();
+        state.ResumeTiming();
+    }
+    countInsertions(state, count);
+}
+
 }  // namespace
 
 BENCHMARK(BM_AddAscendingDisjoint)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_AddDescendingDisjoint)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_AddShuffledDisjoint)->Arg(1000)->Arg(10000)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_AddOverlappingMerging)->Arg(1000)->Arg(10000)->Arg(100000)->Unit(benchmark::kMillisecond);
+// Arguments: runs, pages between runs.
+BENCHMARK(BM_AddSharedRunsAgain)
+    ->ArgsProduct({{1000, 10000, 100000}, {0, 1}})
+    ->ArgNames({"runs", "gap"})
+    ->Unit(benchmark::kMillisecond);

@@ -4,6 +4,8 @@
 #include "model/HTMemoryRegion.h"
 #include "process/HTProcess.h"
 
+#include <algorithm>
+
 HTMemoryObject::HTMemoryObject() : memoryRegions_(std::make_shared<RegionSet>()) {}
 HTMemoryObject::~HTMemoryObject() = default;
 
@@ -34,6 +36,7 @@ void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, u
 
     if (!rangeList_) rangeList_ = std::make_unique<HTRangeList>();
     rangeList_->addRegion(*region, pageSize);
+    pageSize_ = pageSize;
     // The range list now holds the region's sub-ranges.
     region->freeSubrangeList();
 }
@@ -69,6 +72,7 @@ void HTMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize, bool 
     totalCleanSize_ = pages.clean;
     totalReclaimableSize_ = pages.reclaimable;
     totalWiredSize_ = pages.wired;
+    if (rangeList_ && !rangeList_->exact() && processMemoryRegions_) raiseTotalsToProcessViews();
 
     rangeList_.reset();
     pruneProcessMemoryRegions();
@@ -89,6 +93,26 @@ void HTMemoryObject::raiseTotalsToProcessSums()
         }
         if (dirty > totalDirtySize_) totalDirtySize_ = dirty;
         if (swapped > totalSwappedSize_) totalSwappedSize_ = swapped;
+    }
+}
+
+// The object must never show less than one process is shown of it. Where
+// the range list had to settle for a lower bound of the union, the order in
+// which regions came can leave it below what one process's regions count,
+// and that process's view (viewForProcess) would hold more than the whole.
+// So each total is raised to what each process's regions, added whole as
+// its view adds them, count.
+void HTMemoryObject::raiseTotalsToProcessViews()
+{
+    for (const auto& [pid, regions] : *processMemoryRegions_) {
+        HTRangeList view;
+        for (const auto& region : regions) view.addRegion(*region, pageSize_);
+        const HTMemoryTotals seen = view.sum();
+        totalDirtySize_ = std::max(totalDirtySize_, seen.dirty);
+        totalSwappedSize_ = std::max(totalSwappedSize_, seen.swapped);
+        totalCleanSize_ = std::max(totalCleanSize_, seen.clean);
+        totalReclaimableSize_ = std::max(totalReclaimableSize_, seen.reclaimable);
+        totalWiredSize_ = std::max(totalWiredSize_, seen.wired);
     }
 }
 

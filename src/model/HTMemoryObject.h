@@ -94,6 +94,7 @@ protected:
 private:
     void recordRegionForProcess(const std::shared_ptr<HTMemoryRegion>& region, int32_t pid);
     void raiseTotalsToProcessSums();
+    void raiseTotalsToProcessViews();
     void pruneProcessMemoryRegions();
     void nameFakeRegions();
 
@@ -108,4 +109,6 @@ private:
     std::shared_ptr<RegionSet> memoryRegions_;
     std::optional<ProcessRegionMap> processMemoryRegions_;
     std::unique_ptr<HTRangeList> rangeList_;
+    // The page size the range list aligns to, as the regions were added.
+    uint64_t pageSize_ = 0;
 };

@@ -146,6 +146,29 @@ TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
     EXPECT_EQ(object->viewForProcess(*process(3), true), object) << "no list of its own";
 }
 
+TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
+{
+    // p2 reports one dirty page somewhere in four; p1, coming after it, one
+    // dirty and one clean page in each half. The range list can only bound
+    // the union (one page of each), yet p1's own view holds two of each.
+    Processes process(false);
+    auto p1 = process(1);
+    auto p2 = process(2);
+    auto object = std::make_shared<HTMemoryObject>();
+    object->addRegion(region(5, 0, 4, 1), *p2);
+    for (uint64_t half : {0, 2}) {
+        auto mapped = region(5, half, 2, 1);
+        mapped->setCleanNonSpecSize(kPage);
+        object->addRegion(mapped, *p1);
+    }
+    object->finalize(false);
+    EXPECT_EQ(object->totalDirtySize(), 2 * kPage);
+    EXPECT_EQ(object->totalCleanSize(), 2 * kPage);
+    auto view = object->viewForProcess(*p1, false);
+    EXPECT_EQ(view->totalDirtySize(), 2 * kPage);
+    EXPECT_EQ(view->totalCleanSize(), 2 * kPage);
+}
+
 TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
 {
     Processes process(false);

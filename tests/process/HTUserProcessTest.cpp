@@ -444,9 +444,10 @@ TEST_F(HTUserProcessSubrangeTest, RunsOfOneKindBecomeSubranges)
     EXPECT_EQ(spans(regionAt(*process, 0x100000)),
               (std::vector<Span>{{0x40000, 2 * kPage, 2 * kPage, 0, 0, 0, 0},
                                  {0x40000 + 3 * kPage, 2 * kPage, 0, 0, 2 * kPage, 0, 0}}));
-    // Adjacent runs of one region share a span of the list.
+    // Adjacent runs of different kinds stay apart, so that each page keeps its kind.
     EXPECT_EQ(spans(regionAt(*process, 0x200000)),
-              (std::vector<Span>{{0, 2 * kPage, 0, kPage, 0, kPage, 2 * kPage},
+              (std::vector<Span>{{0, kPage, 0, kPage, 0, 0, kPage},
+                                 {kPage, kPage, 0, 0, 0, kPage, kPage},
                                  {3 * kPage, kPage, 0, 0, kPage, 0, kPage}}));
     EXPECT_EQ(spans(regionAt(*process, 0x300000)),
               (std::vector<Span>{{0, kPage, 0, 0, 0, kPage, 0}, {2 * kPage, kPage, kPage, 0, 0, 0, 0}}));
