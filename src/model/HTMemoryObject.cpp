@@ -72,7 +72,7 @@ void HTMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize, bool 
     totalCleanSize_ = pages.clean;
     totalReclaimableSize_ = pages.reclaimable;
     totalWiredSize_ = pages.wired;
-    if (rangeList_ && !rangeList_->exact() && processMemoryRegions_) raiseTotalsToProcessViews();
+    if (rangeList_ && processMemoryRegions_) raiseTotalsToProcessViews();
 
     rangeList_.reset();
     pruneProcessMemoryRegions();
@@ -98,10 +98,13 @@ void HTMemoryObject::raiseTotalsToProcessSums()
 
 // The object must never show less than one process is shown of it. Where
 // the range list had to settle for a lower bound of the union, the order in
-// which regions came can leave it below what one process's regions count,
-// and that process's view (viewForProcess) would hold more than the whole.
-// So each total is raised to what each process's regions, added whole as
-// its view adds them, count.
+// which regions came can leave it below what one process's regions count;
+// and where it counted page by page, the pages' kinds can differ from the
+// kernel's per-mapping counts that a view is built from (smaps counts a
+// shared-memory page read but never written as clean). Either way that
+// process's view (viewForProcess) would hold more than the whole. So each
+// total is raised to what each process's regions, added whole as its view
+// adds them, count.
 void HTMemoryObject::raiseTotalsToProcessViews()
 {
     for (const auto& [pid, regions] : *processMemoryRegions_) {
