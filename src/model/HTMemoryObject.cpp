@@ -72,7 +72,9 @@ void HTMemoryObject::finalizeUsingRegionDirtySize(bool useRegionDirtySize, bool 
     totalCleanSize_ = pages.clean;
     totalReclaimableSize_ = pages.reclaimable;
     totalWiredSize_ = pages.wired;
-    if (rangeList_ && processMemoryRegions_) raiseTotalsToProcessViews();
+    // A process alone sees the object whole: only where several map it can
+    // one of them be shown a view of its own.
+    if (rangeList_ && processMemoryRegions_ && processMemoryRegions_->size() > 1) raiseTotalsToProcessViews();
 
     rangeList_.reset();
     pruneProcessMemoryRegions();
