@@ -1,7 +1,8 @@
 // Support for the tests that run the built heft on live processes: running
-// a program and capturing its streams, child processes that lay out known
-// memory and then wait, temporary directories and swap files that remove
-// themselves, and what the kernel itself says about a process's memory.
+// a program and capturing its streams, child processes (alone, or a parent
+// and the children it forked) that lay out known memory and then wait,
+// temporary directories and swap files that remove themselves, and what the
+// kernel itself says about a process's memory.
 
 #pragma once
 
@@ -27,6 +28,8 @@
 #include <filesystem>
 #include <functional>
 #include <map>
+#include <memory>
+#include <set>
 #include <sstream>
 #include <string>
 #include <string_view>
@@ -180,6 +183,7 @@ inline constexpr const char* kLayoutProgramSource = R"layout(
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
+#include <poll.h>
 #include <signal.h>
 #include <stdint.h>
 #include <stdio.h>
@@ -187,6 +191,7 @@ inline constexpr const char* kLayoutProgramSource = R"layout(
 #include <string.h>
 #include <sys/mman.h>
 #include <sys/prctl.h>
+#include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -239,6 +244,84 @@ static void churn(void)
     }
 }
 
+static void readPages(const char* start, size_t size)
+{
+    for (size_t offset = 0; offset < size; offset += page) (void)*(volatile const char*)(start + offset);
+}
+
+/* Maps `path` privately. "written": writable, the first half of its pages
+ * written (the process's own copies) and the second half read (the file's
+ * pages); "read": read-only, its first and third quarter read, two runs of
+ * pages with a gap between them. */
+static char* mapFilePrivately(const char* how, const char* path)
+{
+    int fd = open(path, O_RDONLY);
+    struct stat status;
+    if (fd < 0 || fstat(fd, &status) != 0) exit(3);
+    size_t size = (size_t)status.st_size, quarter = size / page / 4 * page;
+    int writable = strcmp(how, "written") == 0;
+    char* pages = mmap(NULL, size, writable ? PROT_READ | PROT_WRITE : PROT_READ, MAP_PRIVATE, fd, 0);
+    if (pages == MAP_FAILED) exit(3);
+    close(fd);
+    if (writable) {
+        touch(pages, 2 * quarter);
+        readPages(pages + 2 * quarter, size - 2 * quarter);
+    } else {
+        readPages(pages, quarter);
+        readPages(pages + 2 * quarter, quarter);
+    }
+    return pages;
+}
+
+/* A family that shares memory by fork alone. The parent writes one mapping
+ * of `shared` bytes, pushes its first `pagedOut` bytes to swap and maps a
+ * file privately (unless `how` is "-"), then forks `count` children. Child
+ * i overwrites slice i of the shared mapping, counted from its end, writes
+ * `own` bytes of new memory, tells the parent and waits; once all have, the
+ * parent writes `after` bytes of new memory. Printed: the shared mapping,
+ * the file mapping (0 for none), the parent's new memory, the MADV_PAGEOUT
+ * error (0 for none), then the children's pids. */
+static void prefork(size_t shared, int count, size_t slice, size_t own, size_t after, size_t pagedOut,
+                    const char* how, const char* path)
+{
+    char* pages = mapGuarded(shared);
+    touch(pages, shared);
+    int pageoutError = pagedOut > 0 && madvise(pages, pagedOut, MADV_PAGEOUT) != 0 ? errno : 0;
+    char* file = strcmp(how, "-") == 0 ? NULL : mapFilePrivately(how, path);
+    int ready[2];
+    if (pipe(ready) != 0) exit(3);
+    pid_t parent = getpid();
+    pid_t* children = calloc((size_t)count, sizeof(pid_t));
+    for (int i = 0; i < count; ++i) {
+        children[i] = fork();
+        if (children[i] < 0) exit(3);
+        if (children[i] > 0) continue;
+        /* The children go with the parent, also when it died before this. */
+        prctl(PR_SET_PDEATHSIG, SIGKILL);
+        if (getppid() != parent) _exit(0);
+        touch(pages + shared - (size_t)(i + 1) * slice, slice);
+        char* mine = mapGuarded(own);
+        touch(mine, own);
+        if (write(ready[1], "", 1) != 1) _exit(3);
+        for (;;) pause();
+    }
+    close(ready[1]);
+    /* A child that died on the way would leave the parent waiting for ever:
+     * the others keep the pipe open. */
+    for (int i = 0; i < count;) {
+        struct pollfd wait = {ready[0], POLLIN, 0};
+        char byte;
+        if (poll(&wait, 1, 100) == 1 && read(ready[0], &byte, 1) == 1) ++i;
+        else if (waitpid(-1, NULL, WNOHANG) > 0) exit(5);
+    }
+    close(ready[0]);
+    char* extra = mapGuarded(after);
+    touch(extra, after);
+    printf("%lu %lu %lu %d", (unsigned long)pages, (unsigned long)file, (unsigned long)extra, pageoutError);
+    for (int i = 0; i < count; ++i) printf(" %d", (int)children[i]);
+    printf("\n");
+}
+
 int main(int argc, char** argv)
 {
     page = (size_t)sysconf(_SC_PAGESIZE);
@@ -275,6 +358,9 @@ int main(int argc, char** argv)
         close(fd);
         touch(pages, size);
         printf("%lu\n", (unsigned long)pages);
+    } else if (strcmp(mode, "prefork") == 0 && argc == 10) {
+        prefork(strtoull(argv[2], NULL, 10), atoi(argv[3]), strtoull(argv[4], NULL, 10), strtoull(argv[5], NULL, 10),
+                strtoull(argv[6], NULL, 10), strtoull(argv[7], NULL, 10), argv[8], argv[9]);
     } else if (strcmp(mode, "churn") == 0) {
         printf("0\n");
         fflush(stdout);
@@ -499,6 +585,74 @@ private:
     bool available_ = false;
 };
 
+// What the prefork mode of the layout program lays out (see there): by
+// default a parent and four children sharing 64 MiB.
+struct PreforkLayout {
+    uint64_t shared = 64 * kMiB;
+    int children = 4;
+    uint64_t slice = kMiB;
+    uint64_t own = 8 * kMiB;
+    uint64_t after = 16 * kMiB;
+    uint64_t pagedOut = 0;
+    std::string file = "-";
+    std::string path = "-";
+};
+
+// Whether `pid` still runs: a child that died with its parent waits, dead,
+// for init to reap it.
+inline bool processRunning(pid_t pid)
+{
+    std::string stat;
+    if (!SwapArea::readWholeFile("/proc/" + std::to_string(pid) + "/stat", stat)) return false;
+    size_t state = stat.rfind(") ");
+    return state != std::string::npos && state + 2 < stat.size() && stat[state + 2] != 'Z' && stat[state + 2] != 'X';
+}
+
+// A family laid out by the prefork mode: the parent is a laid-out child, its
+// children are the pids it reported. Taking the family down kills the
+// parent; a child that does not die with it is a failure, and killed.
+class LaidOutFamily {
+public:
+    explicit LaidOutFamily(const PreforkLayout& layout, uid_t user = static_cast<uid_t>(-1))
+    {
+        auto number = [](uint64_t value) { return std::to_string(value); };
+        parent_ = std::make_unique<LaidOutChild>(
+            std::vector<std::string>{"prefork", number(layout.shared), number(layout.children), number(layout.slice),
+                                     number(layout.own), number(layout.after), number(layout.pagedOut), layout.file,
+                                     layout.path},
+            user);
+        for (int i = 0; i < layout.children && parent_->value(4 + i) != 0; ++i)
+            children_.push_back(static_cast<pid_t>(parent_->value(4 + i)));
+        ready_ = parent_->ready() && children_.size() == static_cast<size_t>(layout.children);
+        all_.insert(children_.begin(), children_.end());
+        all_.insert(parent_->pid());
+    }
+    ~LaidOutFamily()
+    {
+        parent_.reset();
+        for (pid_t child : children_) {
+            for (int wait = 0; processRunning(child) && wait < 500; ++wait) usleep(10000);
+            if (!processRunning(child)) continue;
+            ADD_FAILURE() << "child " << child << " outlived its parent";
+            kill(child, SIGKILL);
+        }
+    }
+
+    bool ready() const { return ready_; }
+    pid_t parent() const { return parent_->pid(); }
+    const std::vector<pid_t>& children() const { return children_; }
+    const std::set<int>& all() const { return all_; }
+    uint64_t sharedAddress() const { return parent_->value(0); }
+    uint64_t fileAddress() const { return parent_->value(1); }
+    int pageoutError() const { return static_cast<int>(parent_->value(3)); }
+
+private:
+    std::unique_ptr<LaidOutChild> parent_;
+    std::vector<pid_t> children_;
+    std::set<int> all_;
+    bool ready_ = false;
+};
+
 // The "Name: value kB" lines of a /proc file section, in bytes (the numbers
 // of lines without a kB unit are kept as they are).
 inline std::map<std::string, uint64_t> parseKernelFields(std::string_view text)
@@ -574,6 +728,23 @@ inline uint64_t kernelHeft(pid_t pid)
     auto statusFields = parseKernelFields(status);
     return rollupFields["Private_Dirty"] + rollupFields["Shared_Dirty"] + rollupFields["Swap"] +
            statusFields["VmPTE"];
+}
+
+// The kernel's share of `pid` in what cannot be taken back: each written or
+// swapped page divided among the processes that map it, and the page
+// tables. Summed over a set of processes it counts each of their pages once.
+inline uint64_t kernelShareOfHeft(pid_t pid)
+{
+    std::string rollup;
+    std::string status;
+    std::string base = "/proc/" + std::to_string(pid);
+    if (!SwapArea::readWholeFile(base + "/smaps_rollup", rollup) ||
+        !SwapArea::readWholeFile(base + "/status", status)) {
+        ADD_FAILURE() << "cannot read the memory figures of " << pid;
+        return 0;
+    }
+    auto rollupFields = parseKernelFields(rollup);
+    return rollupFields["Pss_Dirty"] + rollupFields["SwapPss"] + parseKernelFields(status)["VmPTE"];
 }
 
 }  // namespace heft_e2e

@@ -4,6 +4,7 @@
 // image, checked in the JSON document and in the text report against the
 // layout and against the kernel's own figures for the same process.
 
+#include "e2e/HTE2EReport.h"
 #include "e2e/HTE2ESupport.h"
 
 #include <sys/mman.h>
@@ -21,50 +22,6 @@ namespace {
 using namespace heft_e2e;
 
 constexpr const char* kUntagged = "untagged (\"VM_ALLOCATE\")";
-
-bool loadReport(const std::string& path, rapidjson::Document& document)
-{
-    std::string text;
-    if (!SwapArea::readWholeFile(path, text)) {
-        ADD_FAILURE() << "no JSON report at " << path;
-        return false;
-    }
-    document.Parse(text.c_str());
-    if (document.HasParseError() || !document.IsObject()) {
-        ADD_FAILURE() << "the JSON report does not parse: " << text.substr(0, 200);
-        return false;
-    }
-    return true;
-}
-
-const rapidjson::Value* processIn(const rapidjson::Document& report, pid_t pid)
-{
-    if (!report.HasMember("processes") || !report["processes"].IsArray()) return nullptr;
-    for (const auto& process : report["processes"].GetArray()) {
-        if (process.HasMember("pid") && process["pid"].IsInt() && process["pid"].GetInt() == pid) return &process;
-    }
-    return nullptr;
-}
-
-uint64_t number(const rapidjson::Value& object, const char* key)
-{
-    if (!object.IsObject() || !object.HasMember(key) || !object[key].IsUint64()) return 0;
-    return object[key].GetUint64();
-}
-
-const rapidjson::Value* member(const rapidjson::Value& object, const std::string& key)
-{
-    if (!object.IsObject()) return nullptr;
-    auto found = object.FindMember(key.c_str());
-    return found == object.MemberEnd() ? nullptr : &found->value;
-}
-
-// The categories object of a process's own memory, or of a shared entry.
-const rapidjson::Value* categoryIn(const rapidjson::Value& owner, const std::string& name)
-{
-    const rapidjson::Value* categories = member(owner, "categories");
-    return categories ? member(*categories, name) : nullptr;
-}
 
 std::vector<std::string> categoryNames(const rapidjson::Value& owner)
 {
