@@ -933,6 +933,10 @@ void HTUserProcess::_gatherMemoryData()
             if (region->segment() == HTSegmentOther)
                 region->setObject_id(mixIdentity(region->object_id(), region->offset()) | kFileIdentityBit);
             copies = _splitCopiedPages(*region, info);
+            // The file's pages belong to the file, shared with every process
+            // that maps it, dirty or not: only the copies are this
+            // process's own.
+            if (region->share_mode() == SM_COW) region->setShare_mode(SM_SHARED);
         }
         _measurePages(*region, copies.get(), info, purgeState);
 
