@@ -1,6 +1,7 @@
 #include "analysis/HTSharedPageResolver.h"
 
 #include "base/HTAssert.h"
+#include "base/HTMix.h"
 #include "model/HTMemoryRegion.h"
 #include "model/HTSharedPageList.h"
 #include "model/HTSubrangeBuilder.h"
@@ -17,21 +18,11 @@ constexpr const char* kModule = "HTSharedPageResolver";
 // top two bits 00 keep them apart from files (1x) and anonymous memory (01).
 constexpr uint64_t kIdentityNamespaceBits = uint64_t{3} << 62;
 
-uint64_t mix(uint64_t value)
-{
-    value ^= value >> 30;
-    value *= 0xbf58476d1ce4e5b9ULL;
-    value ^= value >> 27;
-    value *= 0x94d049bb133111ebULL;
-    value ^= value >> 31;
-    return value;
-}
-
 // The identity of the object of the pages that the process set `set` maps
 // and that its first process maps through its region `region`.
 uint64_t sharedObjectId(uint32_t set, uint32_t region)
 {
-    uint64_t id = mix(mix(set) ^ (uint64_t{region} << 32 | 0x5A5A)) & ~kIdentityNamespaceBits;
+    uint64_t id = htMix(htMix(set) ^ (uint64_t{region} << 32 | 0x5A5A)) & ~kIdentityNamespaceBits;
     return id == 0 ? 1 : id;
 }
 
@@ -86,7 +77,7 @@ private:
     size_t slotFor(uint64_t identity) const
     {
         const size_t mask = slots_.size() - 1;
-        size_t slot = static_cast<size_t>(mix(identity)) & mask;
+        size_t slot = static_cast<size_t>(htMix(identity)) & mask;
         while (slots_[slot].identity != 0 && slots_[slot].identity != identity) slot = (slot + 1) & mask;
         return slot;
     }

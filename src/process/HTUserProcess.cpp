@@ -2,6 +2,7 @@
 
 #include "analysis/HTHeft.h"
 #include "base/HTAssert.h"
+#include "base/HTMix.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
@@ -75,16 +76,7 @@ HTPageKind pageKind(int32_t disposition, int32_t purgeState)
 }
 
 // A 64-bit mix of two values, for identities derived from another.
-uint64_t mixIdentity(uint64_t id, uint64_t salt)
-{
-    uint64_t value = id ^ (salt * 0x9e3779b97f4a7c15ULL);
-    value ^= value >> 30;
-    value *= 0xbf58476d1ce4e5b9ULL;
-    value ^= value >> 27;
-    value *= 0x94d049bb133111ebULL;
-    value ^= value >> 31;
-    return value;
-}
+uint64_t mixIdentity(uint64_t id, uint64_t salt) { return htMix(id ^ (salt * 0x9e3779b97f4a7c15ULL)); }
 
 // strerror_r comes in two flavours; both give the text here.
 [[maybe_unused]] const char* errnoText(int result, const char* buffer) { return result == 0 ? buffer : "Unknown error"; }

@@ -1,5 +1,6 @@
 #include "platform/linux/HTLinuxRegionInfo.h"
 
+#include "base/HTMix.h"
 #include <algorithm>
 #include <limits>
 
@@ -8,18 +9,6 @@ namespace {
 constexpr uint64_t kTopBit = uint64_t{1} << 63;
 constexpr uint64_t kTopTwoBits = uint64_t{3} << 62;
 constexpr uint64_t kAnonymousMark = uint64_t{1} << 62;
-
-// A 64-bit finaliser that spreads every input bit over the whole result, so
-// that neighbouring inodes or addresses give unrelated identities.
-uint64_t mix(uint64_t value)
-{
-    value ^= value >> 30;
-    value *= 0xbf58476d1ce4e5b9ULL;
-    value ^= value >> 27;
-    value *= 0x94d049bb133111ebULL;
-    value ^= value >> 31;
-    return value;
-}
 
 uint32_t pages(uint64_t bytes, uint64_t pageSize)
 {
@@ -69,10 +58,10 @@ uint64_t htRegionObjectId(const HTSmapsEntry& entry, int32_t pid)
         // The inode may be 0 (the first System V segment has id 0): the
         // device and the top bit still keep the identity apart from 0.
         uint64_t device = (uint64_t{entry.devMajor} << 32) | entry.devMinor;
-        uint64_t id = mix(mix(device) ^ entry.inode) | kTopBit;
+        uint64_t id = htMix(htMix(device) ^ entry.inode) | kTopBit;
         return id == ~uint64_t{0} ? id ^ 1 : id;
     }
-    uint64_t id = mix(mix(static_cast<uint32_t>(pid)) ^ entry.start);
+    uint64_t id = htMix(htMix(static_cast<uint32_t>(pid)) ^ entry.start);
     return (id & ~kTopTwoBits) | kAnonymousMark;
 }
 
