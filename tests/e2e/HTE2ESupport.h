@@ -409,6 +409,14 @@ private:
             if (access(compiler, X_OK) != 0) continue;
             Outcome built = runProgram(compiler, {"cc", "-O1", "-o", binary, source});
             if (built.status == 0) {
+                // Written back at once: the children's code and data are then
+                // clean file pages, not dirty ones that every child shares
+                // until writeback comes round.
+                int fd = open(binary.c_str(), O_RDONLY | O_CLOEXEC);
+                if (fd >= 0) {
+                    fsync(fd);
+                    close(fd);
+                }
                 path_ = binary;
                 return;
             }
