@@ -136,6 +136,9 @@ TEST(HTRangeList, SharedPagesCountOnce)
          {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(3 * P)}}, dirty(4 * P), false},
         {"an inexact view larger than the spans can hold of it",
          {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(7 * P)}}, dirty(7 * P), false},
+        // At most 4P of the span's 6P lie on the range's pages.
+        {"an inexact view over part of an inexact span", {{0, 8 * P, dirty(6 * P)}, {4 * P, 8 * P, dirty(6 * P)}},
+         dirty(8 * P), false},
         // The span has 2P dirty somewhere; the run's 4P on it may include them.
         {"a run over an inexact span and past it",
          {{0, 8 * P, HTMemoryTotals{2 * P, 0, P, 0, 0, 0}}, {4 * P, 8 * P, dirty(8 * P)}},
