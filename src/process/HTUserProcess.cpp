@@ -698,7 +698,7 @@ void HTUserProcess::_addSubrangesForRegion(HTMemoryRegion& region, int32_t purge
     _walkPagesOfRegion(region, PageTargets{&region, nullptr, false}, purgeState);
 }
 
-bool HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState)
+void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState)
 {
     const uint64_t page = pageSize();
     const uint64_t from = roundDown(region.start(), page);
@@ -709,7 +709,8 @@ bool HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageT
     const bool separateCopies = targets.filePages != nullptr || targets.copiesOnly;
     uint64_t identities[kDispositionChunkPages];
 
-    return _enumerateDispositionChunksWithStartAddr(
+    // A failed query is recorded on the process; the runs found so far stay.
+    _enumerateDispositionChunksWithStartAddr(
         from, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t) {
             // A stretch with nothing in it leaves a gap in the runs.
             if (dispositions == nullptr) return;

@@ -147,8 +147,8 @@ protected:
         bool copiesOnly = false;
     };
     // Queries the dispositions of every page of the region and hands each
-    // populated page to its target; false when a query failed.
-    bool _walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState);
+    // populated page to its target.
+    void _walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState);
     // Measures the region's pages where the kernel's counts do not say
     // enough: runs of one kind, the file's pages apart from the copies of a
     // private file mapping, and the identities of pages shared after a fork.
