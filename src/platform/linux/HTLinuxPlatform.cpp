@@ -161,6 +161,32 @@ private:
     size_t next_ = 0;
 };
 
+// The pagemap entries of the last page query on this thread. Page queries
+// and identity queries come in pairs over the same pages; the second one
+// takes the entries from here instead of reading them again.
+struct HTLastPagemapRead {
+    const HTLinuxTaskPort* task = nullptr;
+    uint64_t firstPage = 0;
+    size_t count = 0;
+    HTPageQueryChunk chunk;
+};
+thread_local HTLastPagemapRead lastPagemapRead;
+
+// Reads `count` (at most a chunk's worth) pagemap entries from `firstPage`.
+// A process without an address space reads nothing; a live one reads short
+// only past the top of the user address space, where no page is mapped.
+kern_return_t readPagemap(HTLinuxTaskPort& task, int pagemap, uint64_t firstPage, size_t count, uint64_t* entries)
+{
+    ssize_t bytes = htPreadFully(pagemap, entries, count * sizeof(uint64_t), firstPage * sizeof(uint64_t));
+    if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+    const size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
+    if (read < count) {
+        if (processHasExited(task.procDirFd())) return KERN_INVALID_ARGUMENT;
+        std::fill(entries + read, entries + count, uint64_t{0});
+    }
+    return KERN_SUCCESS;
+}
+
 }  // namespace
 
 HTLinuxPlatform::HTLinuxPlatform()
@@ -664,8 +690,9 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     if (pagemap < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
     int pageFlagsFd = kpageflagsFd();
 
-    thread_local HTPageQueryChunk chunkData;
+    HTPageQueryChunk& chunkData = lastPagemapRead.chunk;
     auto& entries = chunkData.entries;
+    lastPagemapRead.task = nullptr;
     const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
     size_t vmaIndex = 0;
     // What the page rules need of the mapping in hand, worked out once.
@@ -674,17 +701,11 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
     for (uint64_t done = 0; done < pages;) {
         size_t chunk = static_cast<size_t>(std::min<uint64_t>(HTPageQueryChunk::kPages, pages - done));
         uint64_t chunkPage = firstPage + done;
-        ssize_t bytes = htPreadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), chunkPage * sizeof(uint64_t));
-        if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
-        size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
-        if (read < chunk) {
-            // A process without an address space reads nothing; a live one
-            // reads short only past the top of the user address space,
-            // where no page is mapped.
-            if (processHasExited(linuxTask->procDirFd())) return KERN_INVALID_ARGUMENT;
-            std::fill(entries.begin() + static_cast<ptrdiff_t>(read), entries.begin() + static_cast<ptrdiff_t>(chunk),
-                      0);
-        }
+        kern_return_t read = readPagemap(*linuxTask, pagemap, chunkPage, chunk, entries.data());
+        if (read != KERN_SUCCESS) return read;
+        lastPagemapRead.task = linuxTask;
+        lastPagemapRead.firstPage = chunkPage;
+        lastPagemapRead.count = chunk;
 
         for (size_t at = 0; at < chunk; ++at) {
             uint64_t pageAddress = (chunkPage + at) * pageSize;
@@ -876,16 +897,17 @@ kern_return_t HTLinuxPlatform::identifyPages(HTLinuxTaskPort& task, size_t index
     const bool zeroRunsKnown = checkZero && htPagemapZeroPageRuns(pagemap, from, to, zeroRuns);
     HTRunCursor zeroPages(zeroRuns);
 
-    thread_local std::array<uint64_t, HTPageQueryChunk::kPages> entries;
+    thread_local std::array<uint64_t, HTPageQueryChunk::kPages> ownEntries;
     for (uint64_t at = from; at < to;) {
         const size_t chunk = static_cast<size_t>(std::min<uint64_t>(HTPageQueryChunk::kPages, (to - at) / pageSize));
-        ssize_t bytes = htPreadFully(pagemap, entries.data(), chunk * sizeof(uint64_t), at / pageSize * sizeof(uint64_t));
-        if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
-        const size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
-        if (read < chunk) {
-            if (processHasExited(task.procDirFd())) return KERN_INVALID_ARGUMENT;
-            std::fill(entries.begin() + static_cast<ptrdiff_t>(read), entries.begin() + static_cast<ptrdiff_t>(chunk),
-                      uint64_t{0});
+        const uint64_t firstPage = at / pageSize;
+        const HTLastPagemapRead& last = lastPagemapRead;
+        const uint64_t* entries = ownEntries.data();
+        if (last.task == &task && firstPage >= last.firstPage && firstPage + chunk <= last.firstPage + last.count) {
+            entries = last.chunk.entries.data() + (firstPage - last.firstPage);
+        } else {
+            kern_return_t read = readPagemap(task, pagemap, firstPage, chunk, ownEntries.data());
+            if (read != KERN_SUCCESS) return read;
         }
         for (size_t i = 0; i < chunk; ++i) {
             uint64_t identity = htSharedPageIdentity(entries[i], swapShared, false);
