@@ -172,211 +172,10 @@ private:
     std::string path_;
 };
 
-// The program the children run to lay out their memory. It is built by the
-// tests with the system's C compiler rather than forked from the test
-// itself, so that the children carry no sanitizer runtime (whose shadow
-// memory would dwarf and blur the memory being measured). It writes the
-// addresses the test needs on one line to its standard output, then sits
-// blocked reading its standard input, so that its memory stays exactly as
-// laid out while heft and the test read it.
-inline constexpr const char* kLayoutProgramSource = R"layout(
-#define _GNU_SOURCE
-#include <errno.h>
-#include <fcntl.h>
-#include <poll.h>
-#include <signal.h>
-#include <stdint.h>
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
-#include <sys/mman.h>
-#include <sys/prctl.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#ifndef MADV_PAGEOUT
-#define MADV_PAGEOUT 21
-#endif
-
-static size_t page;
-
-static void touch(char* start, size_t size)
-{
-    for (size_t offset = 0; offset < size; offset += page) start[offset] = (char)(1 + (offset / page) % 255);
-}
-
-/* Private anonymous memory between two inaccessible pages: the kernel
- * cannot merge it with a neighbour, so it is one mapping of exactly `size`. */
-static char* mapGuarded(size_t size)
-{
-    char* base = mmap(NULL, size + 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-    if (base == MAP_FAILED) exit(3);
-    mprotect(base, page, PROT_NONE);
-    mprotect(base + page + size, page, PROT_NONE);
-    return base + page;
-}
-
-static char* mapShared(int fd, size_t size)
-{
-    char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-    if (pages == MAP_FAILED) exit(3);
-    return pages;
-}
-
-static void churn(void)
-{
-    unsigned seed = (unsigned)getpid();
-    int alive = 0;
-    for (;;) {
-        while (waitpid(-1, NULL, alive >= 16 ? 0 : WNOHANG) > 0) --alive;
-        pid_t pid = fork();
-        if (pid == 0) {
-            prctl(PR_SET_PDEATHSIG, SIGKILL);
-            size_t size = (1 + rand_r(&seed) % 8) << 20;
-            char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-            if (pages != MAP_FAILED) touch(pages, size);
-            usleep(rand_r(&seed) % 20000);
-            _exit(0);
-        }
-        if (pid > 0) ++alive;
-        usleep(500);
-    }
-}
-
-static void readPages(const char* start, size_t size)
-{
-    for (size_t offset = 0; offset < size; offset += page) (void)*(volatile const char*)(start + offset);
-}
-
-/* Maps `path` privately. "written": writable, the first half of its pages
- * written (the process's own copies) and the second half read (the file's
- * pages); "read": read-only, its first and third quarter read, two runs of
- * pages with a gap between them. */
-static char* mapFilePrivately(const char* how, const char* path)
-{
-    int fd = open(path, O_RDONLY);
-    struct stat status;
-    if (fd < 0 || fstat(fd, &status) != 0) exit(3);
-    size_t size = (size_t)status.st_size, quarter = size / page / 4 * page;
-    int writable = strcmp(how, "written") == 0;
-    char* pages = mmap(NULL, size, writable ? PROT_READ | PROT_WRITE : PROT_READ, MAP_PRIVATE, fd, 0);
-    if (pages == MAP_FAILED) exit(3);
-    close(fd);
-    if (writable) {
-        touch(pages, 2 * quarter);
-        readPages(pages + 2 * quarter, size - 2 * quarter);
-    } else {
-        readPages(pages, quarter);
-        readPages(pages + 2 * quarter, quarter);
-    }
-    return pages;
-}
-
-/* A family that shares memory by fork alone. The parent writes one mapping
- * of `shared` bytes, pushes its first `pagedOut` bytes to swap and maps a
- * file privately (unless `how` is "-"), then forks `count` children. Child
- * i overwrites slice i of the shared mapping, counted from its end, writes
- * `own` bytes of new memory, tells the parent and waits; once all have, the
- * parent writes `after` bytes of new memory. Printed: the shared mapping,
- * the file mapping (0 for none), the parent's new memory, the MADV_PAGEOUT
- * error (0 for none), then the children's pids. */
-static void prefork(size_t shared, int count, size_t slice, size_t own, size_t after, size_t pagedOut,
-                    const char* how, const char* path)
-{
-    char* pages = mapGuarded(shared);
-    touch(pages, shared);
-    int pageoutError = pagedOut > 0 && madvise(pages, pagedOut, MADV_PAGEOUT) != 0 ? errno : 0;
-    char* file = strcmp(how, "-") == 0 ? NULL : mapFilePrivately(how, path);
-    int ready[2];
-    if (pipe(ready) != 0) exit(3);
-    pid_t parent = getpid();
-    pid_t* children = calloc((size_t)count, sizeof(pid_t));
-    for (int i = 0; i < count; ++i) {
-        children[i] = fork();
-        if (children[i] < 0) exit(3);
-        if (children[i] > 0) continue;
-        /* The children go with the parent, also when it died before this. */
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
-        if (getppid() != parent) _exit(0);
-        touch(pages + shared - (size_t)(i + 1) * slice, slice);
-        char* mine = mapGuarded(own);
-        touch(mine, own);
-        if (write(ready[1], "", 1) != 1) _exit(3);
-        for (;;) pause();
-    }
-    close(ready[1]);
-    /* A child that died on the way would leave the parent waiting for ever:
-     * the others keep the pipe open. */
-    for (int i = 0; i < count;) {
-        struct pollfd wait = {ready[0], POLLIN, 0};
-        char byte;
-        if (poll(&wait, 1, 100) == 1 && read(ready[0], &byte, 1) == 1) ++i;
-        else if (waitpid(-1, NULL, WNOHANG) > 0) exit(5);
-    }
-    close(ready[0]);
-    char* extra = mapGuarded(after);
-    touch(extra, after);
-    printf("%lu %lu %lu %d", (unsigned long)pages, (unsigned long)file, (unsigned long)extra, pageoutError);
-    for (int i = 0; i < count; ++i) printf(" %d", (int)children[i]);
-    printf("\n");
-}
-
-int main(int argc, char** argv)
-{
-    page = (size_t)sysconf(_SC_PAGESIZE);
-    prctl(PR_SET_DUMPABLE, 1);
-    const char* mode = argc > 1 ? argv[1] : "";
-    if (strcmp(mode, "anonymous") == 0 && argc == 5) {
-        size_t written = strtoull(argv[2], NULL, 10), freed = strtoull(argv[3], NULL, 10),
-               locked = strtoull(argv[4], NULL, 10);
-        char* w = mapGuarded(written);
-        char* f = mapGuarded(freed);
-        char* l = mapGuarded(locked);
-        touch(w, written);
-        touch(f, freed);
-        if (madvise(f, freed, MADV_FREE) != 0) return 4;
-        touch(l, locked);
-        int lockError = mlock(l, locked) == 0 ? 0 : errno;
-        printf("%lu %lu %lu %d\n", (unsigned long)w, (unsigned long)f, (unsigned long)l, lockError);
-    } else if (strcmp(mode, "pageout") == 0 && argc == 3) {
-        size_t size = strtoull(argv[2], NULL, 10);
-        char* pages = mapGuarded(size);
-        touch(pages, size);
-        int error = madvise(pages, size, MADV_PAGEOUT) == 0 ? 0 : errno;
-        printf("%lu %d\n", (unsigned long)pages, error);
-    } else if (strcmp(mode, "shared") == 0 && argc == 4) {
-        size_t size = strtoull(argv[3], NULL, 10);
-        char* pages = mapShared(atoi(argv[2]), size);
-        touch(pages, size);
-        printf("%lu\n", (unsigned long)pages);
-    } else if (strcmp(mode, "file") == 0 && argc == 4) {
-        size_t size = strtoull(argv[3], NULL, 10);
-        int fd = open(argv[2], O_RDWR);
-        if (fd < 0) return 3;
-        char* pages = mapShared(fd, size);
-        close(fd);
-        touch(pages, size);
-        printf("%lu\n", (unsigned long)pages);
-    } else if (strcmp(mode, "prefork") == 0 && argc == 10) {
-        prefork(strtoull(argv[2], NULL, 10), atoi(argv[3]), strtoull(argv[4], NULL, 10), strtoull(argv[5], NULL, 10),
-                strtoull(argv[6], NULL, 10), strtoull(argv[7], NULL, 10), argv[8], argv[9]);
-    } else if (strcmp(mode, "churn") == 0) {
-        printf("0\n");
-        fflush(stdout);
-        churn();
-    } else {
-        return 2;
-    }
-    fflush(stdout);
-    char byte;
-    while (read(0, &byte, 1) != 0) {}
-    for (;;) pause();
-}
-)layout";
-
-// Builds the layout program once per run of the tests; an empty path, with
-// the reason, when there is no C compiler to build it.
+// The layout program the children run (tests/e2e/layout.c), built with the
+// tests. Written back once before the first child runs: the children's code
+// and data are then clean file pages, not dirty ones that every child shares
+// until writeback comes round.
 class LayoutProgram {
 public:
     static const LayoutProgram& shared()
@@ -390,43 +189,16 @@ public:
 private:
     LayoutProgram()
     {
-        if (!directory_.ok()) {
-            reason_ = "cannot create a directory for the layout program";
+        int fd = open(HEFT_LAYOUT_PROGRAM, O_RDONLY | O_CLOEXEC);
+        if (fd < 0) {
+            reason_ = std::string("no layout program at " HEFT_LAYOUT_PROGRAM ": ") + std::strerror(errno);
             return;
         }
-        // Children running as another user must reach the program.
-        chmod(directory_.path().c_str(), 0755);
-        std::string source = directory_.file("layout.c");
-        FILE* file = std::fopen(source.c_str(), "w");
-        if (!file) {
-            reason_ = "cannot write the layout program";
-            return;
-        }
-        std::fputs(kLayoutProgramSource, file);
-        std::fclose(file);
-        std::string binary = directory_.file("heft-e2e-layout");
-        for (const char* compiler : {"/usr/bin/cc", "/usr/bin/gcc", "/usr/bin/clang"}) {
-            if (access(compiler, X_OK) != 0) continue;
-            Outcome built = runProgram(compiler, {"cc", "-O1", "-o", binary, source});
-            if (built.status == 0) {
-                // Written back at once: the children's code and data are then
-                // clean file pages, not dirty ones that every child shares
-                // until writeback comes round.
-                int fd = open(binary.c_str(), O_RDONLY | O_CLOEXEC);
-                if (fd >= 0) {
-                    fsync(fd);
-                    close(fd);
-                }
-                path_ = binary;
-                return;
-            }
-            reason_ = "the layout program does not build: " + built.standardError;
-            return;
-        }
-        reason_ = "no C compiler to build the layout program";
+        fsync(fd);
+        close(fd);
+        path_ = HEFT_LAYOUT_PROGRAM;
     }
 
-    TempDir directory_;
     std::string path_;
     std::string reason_;
 };

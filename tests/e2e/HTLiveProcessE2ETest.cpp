@@ -229,8 +229,9 @@ TEST_F(HTLiveProcessE2ETest, SegmentSharedByTwoProcessesCountsOnce)
     int segment = memfd_create("heft-e2e-segment", 0);
     ASSERT_GE(segment, 0) << std::strerror(errno);
     ASSERT_EQ(ftruncate(segment, static_cast<off_t>(kSize)), 0) << std::strerror(errno);
-    LaidOutChild first({"shared", std::to_string(segment), std::to_string(kSize)});
-    LaidOutChild second({"shared", std::to_string(segment), std::to_string(kSize)});
+    const std::string segmentPath = "/proc/self/fd/" + std::to_string(segment);
+    LaidOutChild first({"file", segmentPath, std::to_string(kSize)});
+    LaidOutChild second({"file", segmentPath, std::to_string(kSize)});
     close(segment);
     ASSERT_TRUE(first.ready());
     ASSERT_TRUE(second.ready());
