@@ -1,5 +1,7 @@
-// Reading heft's JSON report in the tests that run the built heft: the
-// document, a process in it, and the figures of its categories.
+// Reading heft's reports in the tests that run the built heft: the JSON
+// document, a process, region or shared table in it and the figures of their
+// categories, a row of the text report, and a fixture that runs heft for
+// both at once.
 
 #pragma once
 
@@ -8,32 +10,24 @@
 #include <rapidjson/document.h>
 
 #include <cstdint>
+#include <set>
+#include <sstream>
 #include <string>
+#include <vector>
 
 namespace heft_e2e {
 
+inline constexpr const char* kUntagged = "untagged (\"VM_ALLOCATE\")";
+
 inline bool loadReport(const std::string& path, rapidjson::Document& document)
 {
-    std::string text;
-    if (!SwapArea::readWholeFile(path, text)) {
-        ADD_FAILURE() << "no JSON report at " << path;
-        return false;
-    }
+    std::string text = readFile(path);
     document.Parse(text.c_str());
     if (document.HasParseError() || !document.IsObject()) {
-        ADD_FAILURE() << "the JSON report does not parse: " << text.substr(0, 200);
+        ADD_FAILURE() << "no JSON report at " << path << ": " << text.substr(0, 200);
         return false;
     }
     return true;
-}
-
-inline const rapidjson::Value* processIn(const rapidjson::Document& report, pid_t pid)
-{
-    if (!report.HasMember("processes") || !report["processes"].IsArray()) return nullptr;
-    for (const auto& process : report["processes"].GetArray()) {
-        if (process.HasMember("pid") && process["pid"].IsInt() && process["pid"].GetInt() == pid) return &process;
-    }
-    return nullptr;
 }
 
 inline uint64_t number(const rapidjson::Value& object, const char* key)
@@ -49,11 +43,125 @@ inline const rapidjson::Value* member(const rapidjson::Value& object, const std:
     return found == object.MemberEnd() ? nullptr : &found->value;
 }
 
-// The categories object of a process's own memory, or of a shared entry.
+// The elements of the array `key` of `object`; none when it is not one.
+inline auto arrayIn(const rapidjson::Value& object, const char* key)
+{
+    static const rapidjson::Value empty(rapidjson::kArrayType);
+    const rapidjson::Value* array = member(object, key);
+    return (array && array->IsArray() ? *array : empty).GetArray();
+}
+
+inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t pid)
+{
+    for (const auto& process : arrayIn(report, "processes")) {
+        if (process.HasMember("pid") && process["pid"].IsInt() && process["pid"].GetInt() == pid) return &process;
+    }
+    return nullptr;
+}
+
+// The region of `process` (listed with -v) that holds `address`.
+inline const rapidjson::Value* regionContaining(const rapidjson::Value& process, uint64_t address)
+{
+    for (const auto& region : arrayIn(process, "regions")) {
+        uint64_t start = number(region, "addr");
+        if (start <= address && address < start + number(region, "vsize")) return &region;
+    }
+    return nullptr;
+}
+
+// The category of a process's own memory, or of a shared table.
 inline const rapidjson::Value* categoryIn(const rapidjson::Value& owner, const std::string& name)
 {
     const rapidjson::Value* categories = member(owner, "categories");
     return categories ? member(*categories, name) : nullptr;
 }
+
+// A figure of a category of `owner`: 0 when either is missing.
+inline uint64_t figure(const rapidjson::Value* owner, const std::string& category, const char* key)
+{
+    const rapidjson::Value* found = owner ? categoryIn(*owner, category) : nullptr;
+    return found ? number(*found, key) : 0;
+}
+
+// The names of the categories of `owner`, one a line, for failure messages.
+inline std::string categoryNames(const rapidjson::Value& owner)
+{
+    std::string names;
+    const rapidjson::Value* categories = member(owner, "categories");
+    if (categories && categories->IsObject()) {
+        for (const auto& entry : categories->GetObject()) names += std::string("\n  ") + entry.name.GetString();
+    }
+    return names;
+}
+
+inline std::set<int> pidsOf(const rapidjson::Value& shared)
+{
+    std::set<int> pids;
+    for (const auto& pid : arrayIn(shared, "pids")) pids.insert(pid.GetInt());
+    return pids;
+}
+
+// The table common to exactly `pids`; null when there is none.
+inline const rapidjson::Value* sharedBy(const rapidjson::Value& report, const std::set<int>& pids)
+{
+    for (const auto& shared : arrayIn(report, "shared")) {
+        if (!shared.HasMember("specific_to_pid") && pidsOf(shared) == pids) return &shared;
+    }
+    return nullptr;
+}
+
+// The numbers of the text row (printed with -v -w -f bytes, which name
+// categories in full) that ends with `category`: dirty, swapped, clean,
+// reclaimable, wired, regions.
+inline std::vector<uint64_t> textRow(const std::string& report, const std::string& category)
+{
+    std::istringstream lines(report);
+    const std::string ending = "    " + category;
+    for (std::string line; std::getline(lines, line);) {
+        if (!line.ends_with(ending)) continue;
+        std::vector<uint64_t> numbers;
+        std::istringstream words(line.substr(0, line.size() - ending.size()));
+        for (std::string word; words >> word;) {
+            if (word != "B") numbers.push_back(std::strtoull(word.c_str(), nullptr, 10));
+        }
+        if (numbers.size() == 6) return numbers;
+    }
+    return {};
+}
+
+// A process's heft against the kernel's own count of what cannot be taken
+// back from it, read right after heft ran while the process sat still.
+// `cleanedSince` is how much of the count writeback may have cleaned in
+// between (dirty file pages); anonymous memory of a blocked process stays as
+// it is, so for it the two must agree exactly.
+inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0)
+{
+    const rapidjson::Value* process = processIn(report, pid);
+    ASSERT_NE(process, nullptr) << "pid " << pid;
+    uint64_t heft = number(*process, "heft");
+    uint64_t kernel = kernelHeft(pid);
+    EXPECT_GE(heft, kernel) << "pid " << pid;
+    EXPECT_LE(heft, kernel + cleanedSince) << "pid " << pid;
+}
+
+class HTE2EReportTest : public testing::Test {
+protected:
+    void SetUp() override { ASSERT_TRUE(directory_.ok()) << "mkdtemp: " << std::strerror(errno); }
+
+    // Runs heft for the text report with every region and figure in bytes,
+    // and for the JSON report, which it parses into `report`.
+    Outcome runForReport(std::vector<std::string> arguments, rapidjson::Document& report)
+    {
+        std::string path = directory_.file("report.json");
+        unlink(path.c_str());
+        arguments.insert(arguments.begin(), {"-v", "-w", "-f", "bytes", "-j", path});
+        Outcome outcome = runHeft(arguments);
+        EXPECT_EQ(outcome.status, 0) << outcome.standardError;
+        loadReport(path, report);
+        return outcome;
+    }
+
+    TempDir directory_;
+};
 
 }  // namespace heft_e2e
