@@ -140,7 +140,7 @@ TEST(HTCommandLineE2ETest, UnprivilegedRunsNeedingRootStop)
 
 TEST(HTCommandLineE2ETest, SelectingALiveProcessReportsItOnceAndWritesTheJSONFile)
 {
-    LaidOutChild child({"pageout", "0"});  // lays out nothing, and waits
+    LaidOutChild child({"anonymous", "0", "0", "0", "0"});  // lays out nothing, and waits
     ASSERT_TRUE(child.ready());
     const std::string pid = child.pidString();
     TempDir directory;

@@ -4,11 +4,12 @@
  * being measured). It prints the numbers the test needs on one line, then
  * sleeps until it is killed, its memory exactly as laid out.
  *
- *   anonymous WRITTEN FREED LOCKED   three mappings: written, written then
- *                                    MADV_FREE'd, written then mlocked;
- *                                    prints their addresses and mlock's errno
- *   pageout SIZE                     SIZE written then MADV_PAGEOUT'd; prints
- *                                    its address and madvise's errno
+ *   anonymous WRITTEN FREED LOCKED PAGEDOUT
+ *                                    four mappings, each written, then left,
+ *                                    MADV_FREE'd, mlocked or MADV_PAGEOUT'd;
+ *                                    prints the first three addresses,
+ *                                    mlock's errno, the fourth address and
+ *                                    madvise's errno
  *   file PATH SIZE                   PATH mapped shared and written; prints
  *                                    its address
  *   prefork ...                      a family sharing memory by fork (below)
@@ -152,16 +153,16 @@ int main(int argc, char** argv)
     const char* mode = argc > 1 ? argv[1] : "";
     size_t size[8] = {0};
     for (int i = 2; i < argc && i < 10; ++i) size[i - 2] = strtoull(argv[i], NULL, 10);
-    if (strcmp(mode, "anonymous") == 0 && argc == 5) {
+    if (strcmp(mode, "anonymous") == 0 && argc == 6) {
         char* written = mapWritten(size[0]);
         char* freed = mapWritten(size[1]);
         if (madvise(freed, size[1], MADV_FREE) != 0) return 4;
         char* locked = mapWritten(size[2]);
         int lockError = mlock(locked, size[2]) == 0 ? 0 : errno;
-        printf("%lu %lu %lu %d\n", (unsigned long)written, (unsigned long)freed, (unsigned long)locked, lockError);
-    } else if (strcmp(mode, "pageout") == 0 && argc == 3) {
-        char* pages = mapWritten(size[0]);
-        printf("%lu %d\n", (unsigned long)pages, madvise(pages, size[0], MADV_PAGEOUT) == 0 ? 0 : errno);
+        char* out = mapWritten(size[3]);
+        int pageoutError = madvise(out, size[3], MADV_PAGEOUT) == 0 ? 0 : errno;
+        printf("%lu %lu %lu %d %lu %d\n", (unsigned long)written, (unsigned long)freed, (unsigned long)locked, lockError,
+               (unsigned long)out, pageoutError);
     } else if (strcmp(mode, "file") == 0 && argc == 4) {
         int fd = open(argv[2], O_RDWR);
         char* pages = fd < 0 ? MAP_FAILED : mmap(NULL, size[1], PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
