@@ -19,6 +19,8 @@ namespace heft_e2e {
 
 inline constexpr const char* kUntagged = "untagged (\"VM_ALLOCATE\")";
 
+inline bool between(uint64_t value, uint64_t least, uint64_t most) { return least <= value && value <= most; }
+
 inline bool loadReport(const std::string& path, rapidjson::Document& document)
 {
     std::string text = readFile(path);
@@ -83,17 +85,6 @@ inline uint64_t figure(const rapidjson::Value* owner, const std::string& categor
     return found ? number(*found, key) : 0;
 }
 
-// The names of the categories of `owner`, one a line, for failure messages.
-inline std::string categoryNames(const rapidjson::Value& owner)
-{
-    std::string names;
-    const rapidjson::Value* categories = member(owner, "categories");
-    if (categories && categories->IsObject()) {
-        for (const auto& entry : categories->GetObject()) names += std::string("\n  ") + entry.name.GetString();
-    }
-    return names;
-}
-
 inline std::set<int> pidsOf(const rapidjson::Value& shared)
 {
     std::set<int> pids;
@@ -138,10 +129,8 @@ inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, u
 {
     const rapidjson::Value* process = processIn(report, pid);
     ASSERT_NE(process, nullptr) << "pid " << pid;
-    uint64_t heft = number(*process, "heft");
     uint64_t kernel = kernelHeft(pid);
-    EXPECT_GE(heft, kernel) << "pid " << pid;
-    EXPECT_LE(heft, kernel + cleanedSince) << "pid " << pid;
+    EXPECT_PRED3(between, number(*process, "heft"), kernel, kernel + cleanedSince) << "pid " << pid;
 }
 
 class HTE2EReportTest : public testing::Test {

@@ -111,27 +111,23 @@ inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
 }
 
 // A directory under /tmp, removed with everything in it.
-class TempDir {
-public:
+struct TempDir {
     TempDir()
     {
         char pattern[] = "/tmp/heft-e2e-XXXXXX";
-        if (mkdtemp(pattern) != nullptr) path_ = pattern;
+        if (mkdtemp(pattern) != nullptr) path = pattern;
     }
     ~TempDir()
     {
         std::error_code ignored;
-        if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
+        if (!path.empty()) std::filesystem::remove_all(path, ignored);
     }
     TempDir(const TempDir&) = delete;
-    TempDir& operator=(const TempDir&) = delete;
 
-    bool ok() const { return !path_.empty(); }
-    const std::string& path() const { return path_; }
-    std::string file(const char* name) const { return path_ + "/" + name; }
+    bool ok() const { return !path.empty(); }
+    std::string file(const char* name) const { return path + "/" + name; }
 
-private:
-    std::string path_;
+    std::string path;
 };
 
 // The layout program (tests/e2e/layout.c, built with the tests), written back
@@ -196,39 +192,22 @@ private:
     std::vector<uint64_t> values_;
 };
 
-// Swap for the tests that push pages out: the system's own when it has some,
-// otherwise a 256 MiB swap file under /tmp, turned off and removed again with
-// this object, also when the test fails.
+// Swap for the tests that push pages out: the system's own when it has some
+// (/proc/swaps lists one after its heading line), otherwise a 256 MiB swap
+// file under /tmp, turned off and removed again with this object, also when
+// the test fails.
 class SwapArea {
 public:
     SwapArea()
     {
-        // A heading line, then one line per active swap area.
         std::string swaps = readFile("/proc/swaps");
-        if (swaps.find('\n') + 1 < swaps.size()) {
-            available_ = true;
-            return;
-        }
-        char pattern[] = "/tmp/heft-e2e-swap-XXXXXX";
-        int fd = mkstemp(pattern);  // 0600, as swapon wants
-        if (fd < 0) {
-            reason_ = std::string("cannot create a swap file: ") + std::strerror(errno);
-            return;
-        }
-        path_ = pattern;
-        int error = posix_fallocate(fd, 0, 256 * kMiB);
-        close(fd);
-        const char* mkswap = access("/sbin/mkswap", X_OK) == 0 ? "/sbin/mkswap" : "/usr/sbin/mkswap";
-        Outcome made;
-        if (error != 0) {
-            reason_ = std::string("cannot allocate a swap file: ") + std::strerror(error);
-        } else if ((made = runProgram(mkswap, {"mkswap", path_})).status != 0) {
-            reason_ = "mkswap failed: " + made.standardError;
-        } else if (swapon(path_.c_str(), 0) != 0) {
-            reason_ = std::string("swapon failed: ") + std::strerror(errno);
-        } else {
-            enabled_ = available_ = true;
-        }
+        available_ = swaps.find('\n') + 1 < swaps.size();
+        if (available_) return;
+        Outcome made = runProgram("/bin/sh", {"sh", "-ec", "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
+                                                           "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
+        path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
+        enabled_ = available_ = made.status == 0;
+        reason_ = made.standardError;
     }
     ~SwapArea()
     {

@@ -4,16 +4,12 @@
  * being measured). It prints the numbers the test needs on one line, then
  * sleeps until it is killed, its memory exactly as laid out.
  *
- *   anonymous WRITTEN FREED LOCKED PAGEDOUT
- *                                    four mappings, each written, then left,
- *                                    MADV_FREE'd, mlocked or MADV_PAGEOUT'd;
- *                                    prints the first three addresses,
- *                                    mlock's errno, the fourth address and
- *                                    madvise's errno
- *   file PATH SIZE                   PATH mapped shared and written; prints
- *                                    its address
- *   prefork ...                      a family sharing memory by fork (below)
- *   churn                            forks short-lived children for ever
+ * "anonymous WRITTEN FREED LOCKED PAGEDOUT" lays out four mappings, each
+ * written and then left, MADV_FREE'd, mlocked or MADV_PAGEOUT'd, and prints
+ * the first three addresses, mlock's errno, the fourth address and madvise's
+ * errno; "file PATH SIZE" maps PATH shared, writes it and prints its address;
+ * "prefork" lays out a family (below); "churn" forks short-lived children for
+ * ever.
  */
 #define _GNU_SOURCE
 #include <errno.h>
@@ -66,9 +62,7 @@ static void churn(void)
         pid_t pid = fork();
         if (pid == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
-            size_t size = (1 + rand_r(&seed) % 8) << 20;
-            char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-            if (pages != MAP_FAILED) touch(pages, size);
+            mapWritten((1 + rand_r(&seed) % 8) << 20);
             usleep(rand_r(&seed) % 20000);
             _exit(0);
         }
