@@ -203,15 +203,16 @@ public:
         std::string swaps = readFile("/proc/swaps");
         available_ = swaps.find('\n') + 1 < swaps.size();
         if (available_) return;
-        Outcome made = runProgram("/bin/sh", {"sh", "-ec", "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
-                                                           "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
+        Outcome made = runProgram("/bin/sh", {"sh", "-ec",
+                                              "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
+                                              "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
         path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
         enabled_ = available_ = made.status == 0;
         reason_ = made.standardError;
     }
     ~SwapArea()
     {
-        if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << std::strerror(errno);
+        if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << strerror(errno);
         if (!path_.empty()) unlink(path_.c_str());
     }
     SwapArea(const SwapArea&) = delete;

@@ -112,7 +112,8 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
         EXPECT_LE(ownDirtyBesidesPageTables(processIn(report_, child)), layout.own + layout.slice + kSlack);
         std::set<int> others = family_->all();
         others.erase(child);
-        EXPECT_PRED3(between, figure(sharedBy(report_, others), kUntagged, "dirty"), layout.slice, layout.slice + kSlack);
+        uint64_t slice = figure(sharedBy(report_, others), kUntagged, "dirty");
+        EXPECT_PRED3(between, slice, layout.slice, layout.slice + kSlack);
     }
     EXPECT_GE(figure(processIn(report_, family_->parent()), kUntagged, "dirty"), layout.after);
     EXPECT_LE(ownDirtyBesidesPageTables(processIn(report_, family_->parent())), layout.after + kSlack);

@@ -136,7 +136,7 @@ TEST_F(HTLiveProcessE2ETest, SegmentSharedByTwoProcessesCountsOnce)
     // exactly one shared table, the one of the two of them, whole. Shared
     // memory is named by its kind alone.
     int tablesWithSegment = 0;
-    for (const auto& shared : arrayIn(report, "shared")) tablesWithSegment += categoryIn(shared, "shared memory") != nullptr;
+    for (const auto& shared : arrayIn(report, "shared")) tablesWithSegment += !!categoryIn(shared, "shared memory");
     EXPECT_EQ(tablesWithSegment, 1);
     const rapidjson::Value* both = sharedBy(report, {first.pid(), second.pid()});
     EXPECT_EQ(figure(both, "shared memory", "dirty"), kSize);

@@ -155,8 +155,8 @@ int main(int argc, char** argv)
         int lockError = mlock(locked, size[2]) == 0 ? 0 : errno;
         char* out = mapWritten(size[3]);
         int pageoutError = madvise(out, size[3], MADV_PAGEOUT) == 0 ? 0 : errno;
-        printf("%lu %lu %lu %d %lu %d\n", (unsigned long)written, (unsigned long)freed, (unsigned long)locked, lockError,
-               (unsigned long)out, pageoutError);
+        printf("%lu %lu %lu %d %lu %d\n", (unsigned long)written, (unsigned long)freed, (unsigned long)locked,
+               lockError, (unsigned long)out, pageoutError);
     } else if (strcmp(mode, "file") == 0 && argc == 4) {
         int fd = open(argv[2], O_RDWR);
         char* pages = fd < 0 ? MAP_FAILED : mmap(NULL, size[1], PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
