@@ -9,11 +9,7 @@
 
 #include <rapidjson/document.h>
 
-#include <cstdint>
-#include <set>
 #include <sstream>
-#include <string>
-#include <vector>
 
 namespace heft_e2e {
 
@@ -32,17 +28,17 @@ inline bool loadReport(const std::string& path, rapidjson::Document& document)
     return true;
 }
 
-inline uint64_t number(const rapidjson::Value& object, const char* key)
-{
-    if (!object.IsObject() || !object.HasMember(key) || !object[key].IsUint64()) return 0;
-    return object[key].GetUint64();
-}
-
 inline const rapidjson::Value* member(const rapidjson::Value& object, const std::string& key)
 {
     if (!object.IsObject()) return nullptr;
     auto found = object.FindMember(key.c_str());
     return found == object.MemberEnd() ? nullptr : &found->value;
+}
+
+inline uint64_t number(const rapidjson::Value& object, const char* key)
+{
+    const rapidjson::Value* found = member(object, key);
+    return found && found->IsUint64() ? found->GetUint64() : 0;
 }
 
 // The elements of the array `key` of `object`; none when it is not one.
@@ -61,14 +57,23 @@ inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t p
     return nullptr;
 }
 
-// The region of `process` (listed with -v) that holds `address`.
-inline const rapidjson::Value* regionContaining(const rapidjson::Value& process, uint64_t address)
+// The region of `process` (listed with -v) that holds `address`; when none
+// does, a failure and an empty object, whose figures are all 0.
+inline const rapidjson::Value& regionAt(const rapidjson::Value& process, uint64_t address)
 {
     for (const auto& region : arrayIn(process, "regions")) {
         uint64_t start = number(region, "addr");
-        if (start <= address && address < start + number(region, "vsize")) return &region;
+        if (start <= address && address < start + number(region, "vsize")) return region;
     }
-    return nullptr;
+    ADD_FAILURE() << "no region holds " << std::hex << address;
+    static const rapidjson::Value none(rapidjson::kObjectType);
+    return none;
+}
+
+inline std::string nameOf(const rapidjson::Value& object)
+{
+    const rapidjson::Value* name = member(object, "name");
+    return name && name->IsString() ? name->GetString() : "";
 }
 
 // The category of a process's own memory, or of a shared table.
@@ -101,23 +106,26 @@ inline const rapidjson::Value* sharedBy(const rapidjson::Value& report, const st
     return nullptr;
 }
 
-// The numbers of the text row (printed with -v -w -f bytes, which name
-// categories in full) that ends with `category`: dirty, swapped, clean,
-// reclaimable, wired, regions.
-inline std::vector<uint64_t> textRow(const std::string& report, const std::string& category)
+// The first table row of `category` in the text report (printed with -v -w
+// -f bytes, which name categories in full) shows the same figures as the
+// JSON report gives the category: dirty, swapped, clean, reclaimable, wired
+// and regions.
+inline void expectTextRowShows(const std::string& report, const std::string& category, const rapidjson::Value* figures)
 {
+    ASSERT_NE(figures, nullptr) << report;
+    std::vector<uint64_t> expected, numbers;
+    for (const char* key : {"dirty", "swapped", "clean", "reclaimable", "wired", "regions"})
+        expected.push_back(number(*figures, key));
     std::istringstream lines(report);
     const std::string ending = "    " + category;
-    for (std::string line; std::getline(lines, line);) {
-        if (!line.ends_with(ending)) continue;
-        std::vector<uint64_t> numbers;
-        std::istringstream words(line.substr(0, line.size() - ending.size()));
+    for (std::string line; numbers.size() != 6 && std::getline(lines, line);) {
+        numbers.clear();
+        std::istringstream words(line.ends_with(ending) ? line.substr(0, line.size() - ending.size()) : "");
         for (std::string word; words >> word;) {
             if (word != "B") numbers.push_back(std::strtoull(word.c_str(), nullptr, 10));
         }
-        if (numbers.size() == 6) return numbers;
     }
-    return {};
+    EXPECT_EQ(numbers, expected) << report;
 }
 
 // A process's heft against the kernel's own count of what cannot be taken

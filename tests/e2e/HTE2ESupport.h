@@ -24,7 +24,6 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
-#include <memory>
 #include <set>
 #include <sstream>
 #include <string>
@@ -242,41 +241,35 @@ struct PreforkLayout {
 };
 
 // A family laid out by the prefork mode: the parent is a laid-out child, its
-// children are the pids it reported. Taken down children first, while the
-// parent still holds their pids, so that no other process can have them.
-class LaidOutFamily {
+// children are the pids it printed (once all of them were ready). Taken down
+// children first, while the parent still holds their pids, so that no other
+// process can have them.
+class LaidOutFamily : public LaidOutChild {
 public:
-    explicit LaidOutFamily(const PreforkLayout& layout, uid_t user = kSameUser)
+    explicit LaidOutFamily(const PreforkLayout& l, uid_t user = kSameUser)
+        : LaidOutChild({"prefork", std::to_string(l.shared), std::to_string(l.children), std::to_string(l.slice),
+                        std::to_string(l.own), std::to_string(l.after), std::to_string(l.pagedOut), l.file, l.path},
+                       user)
     {
-        auto n = [](uint64_t value) { return std::to_string(value); };
-        parent_ = std::make_unique<LaidOutChild>(
-            std::vector<std::string>{"prefork", n(layout.shared), n(layout.children), n(layout.slice), n(layout.own),
-                                     n(layout.after), n(layout.pagedOut), layout.file, layout.path},
-            user);
-        for (int i = 0; i < layout.children && parent_->value(4 + i) != 0; ++i)
-            children_.push_back(static_cast<pid_t>(parent_->value(4 + i)));
-        ready_ = parent_->ready() && children_.size() == static_cast<size_t>(layout.children);
-        all_.insert(children_.begin(), children_.end());
-        all_.insert(parent_->pid());
+        for (int i = 0; i < l.children && value(4 + i) != 0; ++i) children_.push_back(static_cast<pid_t>(value(4 + i)));
+        all_ = {children_.begin(), children_.end()};
+        all_.insert(pid());
     }
     ~LaidOutFamily()
     {
         for (pid_t child : children_) kill(child, SIGKILL);
     }
 
-    bool ready() const { return ready_; }
-    pid_t parent() const { return parent_->pid(); }
+    pid_t parent() const { return pid(); }
     const std::vector<pid_t>& children() const { return children_; }
     const std::set<int>& all() const { return all_; }
-    uint64_t sharedAddress() const { return parent_->value(0); }
-    uint64_t fileAddress() const { return parent_->value(1); }
-    int pageoutError() const { return static_cast<int>(parent_->value(3)); }
+    uint64_t sharedAddress() const { return value(0); }
+    uint64_t fileAddress() const { return value(1); }
+    int pageoutError() const { return static_cast<int>(value(3)); }
 
 private:
-    std::unique_ptr<LaidOutChild> parent_;
     std::vector<pid_t> children_;
     std::set<int> all_;
-    bool ready_ = false;
 };
 
 // A "Name:  123 kB" field of a /proc file's text, in bytes (every field the

@@ -39,31 +39,28 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     // Each mapping is one region of its exact size. Every written page is
     // resident and dirty (nothing pushes a blocked child's pages out on a
     // machine without memory pressure), so the figures are exact.
-    const rapidjson::Value* written = regionContaining(*process, child.value(0));
-    ASSERT_NE(written, nullptr);
-    EXPECT_EQ(number(*written, "addr"), child.value(0));
-    EXPECT_EQ(number(*written, "vsize"), kWritten);
-    EXPECT_EQ(number(*written, "dirty") + number(*written, "swapped"), kWritten);
-    EXPECT_EQ(number(*written, "reclaimable") + number(*written, "wired"), 0u);
-    EXPECT_EQ((*written)["name"].GetString(), std::string(kUntagged));
+    const rapidjson::Value& written = regionAt(*process, child.value(0));
+    EXPECT_EQ(number(written, "addr"), child.value(0));
+    EXPECT_EQ(number(written, "vsize"), kWritten);
+    EXPECT_EQ(number(written, "dirty") + number(written, "swapped"), kWritten);
+    EXPECT_EQ(number(written, "reclaimable") + number(written, "wired"), 0u);
+    EXPECT_EQ(nameOf(written), kUntagged);
 
     // Lazily freed pages are the kernel's to take at any moment, so heft's
     // figure lies between what the kernel still holds after heft ran and the
     // whole mapping; they are neither dirty nor part of the heft.
-    const rapidjson::Value* freed = regionContaining(*process, child.value(1));
-    ASSERT_NE(freed, nullptr);
+    const rapidjson::Value& freed = regionAt(*process, child.value(1));
     uint64_t lazyFreeAfter = kernelField(mappingAt(child.pid(), child.value(1)), "LazyFree");
-    EXPECT_PRED3(between, number(*freed, "reclaimable"), lazyFreeAfter, kFreed);
+    EXPECT_PRED3(between, number(freed, "reclaimable"), lazyFreeAfter, kFreed);
     EXPECT_GT(lazyFreeAfter, kFreed / 2) << "the kernel reclaimed the freed pages at once";
-    EXPECT_EQ(number(*freed, "dirty"), kFreed - number(*freed, "reclaimable") - number(*freed, "clean"));
+    EXPECT_EQ(number(freed, "dirty"), kFreed - number(freed, "reclaimable") - number(freed, "clean"));
 
     // A locked region is wired in full (locked pages cannot leave memory).
     if (locked) {
-        const rapidjson::Value* region = regionContaining(*process, child.value(2));
-        ASSERT_NE(region, nullptr);
-        EXPECT_EQ(number(*region, "vsize"), kLocked);
-        EXPECT_EQ(number(*region, "wired"), kLocked);
-        EXPECT_EQ(number(*region, "dirty"), kLocked);
+        const rapidjson::Value& region = regionAt(*process, child.value(2));
+        EXPECT_EQ(number(region, "vsize"), kLocked);
+        EXPECT_EQ(number(region, "wired"), kLocked);
+        EXPECT_EQ(number(region, "dirty"), kLocked);
     }
 
     // Swapped pages stay out while the child does not touch them: heft's
@@ -71,10 +68,9 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     const bool pagedOut = swap.available() && child.value(5) == 0;
     uint64_t swapped = kernelField(mappingAt(child.pid(), child.value(4)), "Swap");
     EXPECT_TRUE(!pagedOut || swapped > kPagedOut / 2) << "the kernel left most pages in memory: " << swapped;
-    const rapidjson::Value* out = regionContaining(*process, child.value(4));
-    ASSERT_NE(out, nullptr);
-    EXPECT_EQ(number(*out, "swapped"), swapped);
-    EXPECT_EQ(number(*out, "dirty") + number(*out, "swapped"), kPagedOut);
+    const rapidjson::Value& out = regionAt(*process, child.value(4));
+    EXPECT_EQ(number(out, "swapped"), swapped);
+    EXPECT_EQ(number(out, "dirty") + number(out, "swapped"), kPagedOut);
 
     // The category holds the four regions at least, its dirty figure their
     // swapped bytes too; other anonymous memory of the child (its
@@ -83,7 +79,7 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     ASSERT_NE(untagged, nullptr) << text.standardOutput;
     EXPECT_GE(number(*untagged, "dirty"), kWritten + locked + kPagedOut);
     EXPECT_GE(number(*untagged, "swapped"), swapped);
-    EXPECT_GE(number(*untagged, "reclaimable"), number(*freed, "reclaimable"));
+    EXPECT_GE(number(*untagged, "reclaimable"), number(freed, "reclaimable"));
     EXPECT_GE(number(*untagged, "wired"), locked);
     EXPECT_GE(number(*untagged, "regions"), 4u);
 
@@ -92,12 +88,7 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
                                        std::to_string(number(*process, "heft")) + " B ("),
               std::string::npos)
         << text.standardOutput;
-    std::vector<uint64_t> row = textRow(text.standardOutput, kUntagged);
-    ASSERT_EQ(row.size(), 6u) << text.standardOutput;
-    EXPECT_EQ(row[0], number(*untagged, "dirty"));
-    EXPECT_EQ(row[1], number(*untagged, "swapped"));
-    EXPECT_EQ(row[4], number(*untagged, "wired"));
-    EXPECT_EQ(row[5], number(*untagged, "regions"));
+    expectTextRowShows(text.standardOutput, kUntagged, untagged);
     if (!locked) GTEST_SKIP() << "mlock: " << std::strerror(static_cast<int>(child.value(3))) << "; not checked";
     if (!pagedOut) GTEST_SKIP() << "no swap (" << swap.reason() << ") or MADV_PAGEOUT failed; swap not checked";
 }
@@ -124,11 +115,9 @@ TEST_F(HTLiveProcessE2ETest, SegmentSharedByTwoProcessesCountsOnce)
         const rapidjson::Value* process = processIn(report, child->pid());
         ASSERT_NE(process, nullptr);
         EXPECT_EQ(categoryIn(*process, "shared memory"), nullptr) << "the segment is listed as one process's own";
-        const rapidjson::Value* region = regionContaining(*process, child->value(0));
-        ASSERT_NE(region, nullptr);
-        EXPECT_EQ(std::string((*region)["name"].GetString()), "shared memory");
-        EXPECT_EQ(number(*region, "dirty"), kSize);
-        EXPECT_GE(number(*process, "heft"), kSize);
+        const rapidjson::Value& region = regionAt(*process, child->value(0));
+        EXPECT_EQ(nameOf(region), "shared memory");
+        EXPECT_EQ(number(region, "dirty"), kSize);
         hefts += number(*process, "heft");
     }
 
@@ -151,7 +140,7 @@ TEST_F(HTLiveProcessE2ETest, SegmentSharedByTwoProcessesCountsOnce)
     EXPECT_EQ(totalHeft, number(report["summary"]["total"], "dirty"));
 
     // The text report names the other process over the shared table.
-    const std::string name = (*processIn(report, first.pid()))["name"].GetString();
+    const std::string name = nameOf(*processIn(report, first.pid()));
     for (const LaidOutChild* other : {&first, &second}) {
         EXPECT_NE(outcome.standardOutput.find("Shared with " + name + " [" + other->pidString() + "]:\n"),
                   std::string::npos)
@@ -184,22 +173,19 @@ TEST_F(HTLiveProcessE2ETest, FileMappingsAndLibrariesAreNamedByPath)
     EXPECT_EQ(number(*file, "dirty") + number(*file, "clean"), kSize);
     EXPECT_GE(number(*file, "dirty"), fileDirtyAfter);
     EXPECT_EQ(number(*file, "regions"), 1u);
-    const rapidjson::Value* region = regionContaining(*process, child.value(0));
-    ASSERT_NE(region, nullptr);
-    EXPECT_EQ((*region)["name"].GetString(), "mapped file " + path);
-    std::vector<uint64_t> row = textRow(text.standardOutput, "mapped file " + path);
-    ASSERT_EQ(row.size(), 6u) << text.standardOutput;
-    EXPECT_EQ(row[0], number(*file, "dirty"));
-    EXPECT_EQ(row[2], number(*file, "clean"));
+    const rapidjson::Value& region = regionAt(*process, child.value(0));
+    EXPECT_EQ(nameOf(region), "mapped file " + path);
+    expectTextRowShows(text.standardOutput, "mapped file " + path, file);
 
     // The C library is an image: its segments are named by their role and
     // its path, its code among them.
-    const auto& categories = (*process)["categories"];
-    auto libcText = std::find_if(categories.MemberBegin(), categories.MemberEnd(), [](const auto& entry) {
+    const rapidjson::Value* categories = member(*process, "categories");
+    ASSERT_TRUE(categories && categories->IsObject());
+    auto libcText = std::find_if(categories->MemberBegin(), categories->MemberEnd(), [](const auto& entry) {
         std::string name = entry.name.GetString();
         return name.starts_with("__TEXT /") && name.find("/libc.so") != std::string::npos;
     });
-    ASSERT_NE(libcText, categories.MemberEnd()) << text.standardOutput;
+    ASSERT_NE(libcText, categories->MemberEnd()) << text.standardOutput;
     EXPECT_GT(number(libcText->value, "clean") + number(libcText->value, "dirty"), 0u);
 }
 
@@ -229,10 +215,8 @@ TEST_F(HTLiveProcessE2ETest, ProcessesExitingDuringTheRunLeaveAWholeReport)
                   run == 0)
             << outcome.standardError;
         rapidjson::Document report;
-        if (loadReport(path, report)) {
-            EXPECT_TRUE(report.HasMember("total heft"));
-            EXPECT_GT(arrayIn(report, "processes").Size(), 1u);
-        }
+        EXPECT_TRUE(loadReport(path, report) && report.HasMember("total heft"));
+        EXPECT_GT(arrayIn(report, "processes").Size(), 1u);
         if (outcome.standardError.find("(process exited)") != std::string::npos) ++runsWithExitedProcesses;
     }
     RecordProperty("runsThatSawAProcessExit", runsWithExitedProcesses);
