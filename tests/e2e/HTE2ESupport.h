@@ -1,17 +1,16 @@
-// Support for the tests that run the built heft on live processes: running
-// a program and capturing its streams, child processes (alone, or a parent
-// and the children it forked) that lay out known memory and then wait,
-// temporary directories and swap files that remove themselves, and what the
-// kernel itself says about a process's memory.
+// Support for the tests that run the built heft on live processes: running a
+// program and capturing its streams, child processes (alone, or a parent and
+// the children it forked) that lay out known memory and then wait, temporary
+// directories and swap that clean up after themselves, and what the kernel
+// itself says about a process's memory.
 
 #pragma once
 
 #include <fcntl.h>
 #include <grp.h>
-#include <poll.h>
 #include <signal.h>
+#include <sys/mman.h>
 #include <sys/prctl.h>
-#include <sys/stat.h>
 #include <sys/swap.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -19,20 +18,15 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
-#include <charconv>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <filesystem>
-#include <functional>
-#include <map>
-#include <memory>
+#include <fstream>
 #include <set>
 #include <sstream>
 #include <string>
-#include <string_view>
 #include <vector>
 
 extern char** environ;
@@ -42,94 +36,62 @@ namespace heft_e2e {
 inline constexpr const char* kHeftBinary = HEFT_BINARY;
 inline constexpr const char* kSetpriv = "/usr/bin/setpriv";
 inline constexpr uid_t kNobody = 65534;
+inline constexpr uid_t kSameUser = static_cast<uid_t>(-1);
 inline constexpr uint64_t kMiB = 1024 * 1024;
+
+// The whole of a file; empty when it cannot be read.
+inline std::string readFile(const std::string& path)
+{
+    std::ifstream file(path);
+    std::ostringstream contents;
+    contents << file.rdbuf();
+    return contents.str();
+}
+
+inline std::vector<char*> argvOf(std::vector<std::string>& arguments)
+{
+    std::vector<char*> argv;
+    for (auto& argument : arguments) argv.push_back(argument.data());
+    argv.push_back(nullptr);
+    return argv;
+}
 
 struct Outcome {
     int status = -1;  // the exit status, or -1 when the program did not exit normally
-    bool timedOut = false;
     std::string standardOutput;
     std::string standardError;
 };
 
 // No run of heft in these tests takes more than seconds; one that takes
-// minutes is stopped and reported rather than left to hang the suite.
-inline constexpr int kRunLimitSeconds = 180;
-
-// Reads both pipes to their end at once, so that neither fills up while the
-// other is waited on; kills `child` when it runs past the limit.
-inline void drain(int outputFd, int errorFd, pid_t child, Outcome& outcome)
-{
-    struct pollfd fds[2] = {{outputFd, POLLIN, 0}, {errorFd, POLLIN, 0}};
-    std::string* sinks[2] = {&outcome.standardOutput, &outcome.standardError};
-    int openStreams = 2;
-    const time_t deadline = time(nullptr) + kRunLimitSeconds;
-    while (openStreams > 0) {
-        time_t now = time(nullptr);
-        if (now >= deadline && !outcome.timedOut) {
-            outcome.timedOut = true;
-            kill(child, SIGKILL);
-        }
-        int ready = poll(fds, 2, outcome.timedOut ? -1 : static_cast<int>(deadline - now) * 1000);
-        if (ready < 0) {
-            if (errno == EINTR) continue;
-            break;
-        }
-        for (int i = 0; i < 2; ++i) {
-            if (fds[i].fd < 0 || fds[i].revents == 0) continue;
-            char buffer[65536];
-            ssize_t count = read(fds[i].fd, buffer, sizeof(buffer));
-            if (count > 0) {
-                sinks[i]->append(buffer, static_cast<size_t>(count));
-            } else if (count == 0 || errno != EINTR) {
-                close(fds[i].fd);
-                fds[i].fd = -1;
-                --openStreams;
-            }
-        }
-    }
-}
+// minutes is stopped by an alarm (which survives exec) and reported rather
+// than left to hang the suite.
+inline constexpr unsigned kRunLimitSeconds = 180;
 
 // Runs `program` with `arguments` (arguments[0] is the name the program sees
-// itself called by), capturing both streams and the exit status.
+// itself called by), capturing both streams in memory files, which unlike
+// pipes never fill up and stall the program.
 inline Outcome runProgram(const char* program, std::vector<std::string> arguments)
 {
     Outcome outcome;
-    int outputPipe[2];
-    int errorPipe[2];
-    if (pipe2(outputPipe, O_CLOEXEC) != 0) {
-        ADD_FAILURE() << "pipe2: " << std::strerror(errno);
-        return outcome;
-    }
-    if (pipe2(errorPipe, O_CLOEXEC) != 0) {
-        ADD_FAILURE() << "pipe2: " << std::strerror(errno);
-        close(outputPipe[0]);
-        close(outputPipe[1]);
-        return outcome;
-    }
-    std::vector<char*> argv;
-    for (auto& argument : arguments) argv.push_back(argument.data());
-    argv.push_back(nullptr);
-
-    pid_t child = fork();
+    const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
+    std::vector<char*> argv = argvOf(arguments);
+    pid_t child = streams[0] < 0 || streams[1] < 0 ? -1 : fork();
     if (child == 0) {
-        dup2(outputPipe[1], STDOUT_FILENO);
-        dup2(errorPipe[1], STDERR_FILENO);
+        dup2(streams[0], STDOUT_FILENO);
+        dup2(streams[1], STDERR_FILENO);
+        alarm(kRunLimitSeconds);
         execve(program, argv.data(), environ);
         _exit(127);
     }
-    close(outputPipe[1]);
-    close(errorPipe[1]);
-    if (child < 0) {
-        ADD_FAILURE() << "fork: " << std::strerror(errno);
-        close(outputPipe[0]);
-        close(errorPipe[0]);
-        return outcome;
-    }
-    drain(outputPipe[0], errorPipe[0], child, outcome);
     int status = 0;
-    while (waitpid(child, &status, 0) < 0 && errno == EINTR) {}
-    outcome.status = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-    EXPECT_FALSE(outcome.timedOut) << arguments[0] << " ran for more than " << kRunLimitSeconds << " s";
+    if (child < 0) ADD_FAILURE() << "cannot run " << program << ": " << std::strerror(errno);
+    while (child > 0 && waitpid(child, &status, 0) < 0 && errno == EINTR) {}
+    outcome.status = child > 0 && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    EXPECT_FALSE(WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM)
+        << arguments[0] << " ran for more than " << kRunLimitSeconds << " s";
+    outcome.standardOutput = readFile("/proc/self/fd/" + std::to_string(streams[0]));
+    outcome.standardError = readFile("/proc/self/fd/" + std::to_string(streams[1]));
+    for (int fd : streams) close(fd);
     return outcome;
 }
 
@@ -143,353 +105,74 @@ inline Outcome runHeft(std::vector<std::string> arguments)
 inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
 {
     std::string id = std::to_string(kNobody);
-    std::vector<std::string> command = {"setpriv", "--reuid=" + id, "--regid=" + id, "--clear-groups", kHeftBinary};
-    command.insert(command.end(), arguments.begin(), arguments.end());
-    return runProgram(kSetpriv, std::move(command));
+    arguments.insert(arguments.begin(), {"setpriv", "--reuid=" + id, "--regid=" + id, "--clear-groups", kHeftBinary});
+    return runProgram(kSetpriv, std::move(arguments));
 }
 
 // A directory under /tmp, removed with everything in it.
-class TempDir {
-public:
+struct TempDir {
     TempDir()
     {
         char pattern[] = "/tmp/heft-e2e-XXXXXX";
-        if (mkdtemp(pattern) != nullptr) path_ = pattern;
+        if (mkdtemp(pattern) != nullptr) path = pattern;
     }
     ~TempDir()
     {
         std::error_code ignored;
-        if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
+        if (!path.empty()) std::filesystem::remove_all(path, ignored);
     }
     TempDir(const TempDir&) = delete;
-    TempDir& operator=(const TempDir&) = delete;
 
-    bool ok() const { return !path_.empty(); }
-    const std::string& path() const { return path_; }
-    std::string file(const char* name) const { return path_ + "/" + name; }
+    bool ok() const { return !path.empty(); }
+    std::string file(const char* name) const { return path + "/" + name; }
 
-private:
-    std::string path_;
+    std::string path;
 };
 
-// The program the children run to lay out their memory. It is built by the
-// tests with the system's C compiler rather than forked from the test
-// itself, so that the children carry no sanitizer runtime (whose shadow
-// memory would dwarf and blur the memory being measured). It writes the
-// addresses the test needs on one line to its standard output, then sits
-// blocked reading its standard input, so that its memory stays exactly as
-// laid out while heft and the test read it.
-inline constexpr const char* kLayoutProgramSource = R"layout(
-#define _GNU_SOURCE
-#include <errno.h>
-#include <fcntl.h>
-#include <poll.h>
-#include <signal.h>
-#include <stdint.h>
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
-#include <sys/mman.h>
-#include <sys/prctl.h>
-#include <sys/stat.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
-#ifndef MADV_PAGEOUT
-#define MADV_PAGEOUT 21
-#endif
-
-static size_t page;
-
-static void touch(char* start, size_t size)
+// The layout program (tests/e2e/layout.c, built with the tests), written back
+// before the first child runs it: the children's code and data are then clean
+// file pages, not dirty ones that all of them share until writeback comes.
+inline const char* layoutProgram()
 {
-    for (size_t offset = 0; offset < size; offset += page) start[offset] = (char)(1 + (offset / page) % 255);
+    static const bool writtenBack = [] {
+        int fd = open(HEFT_LAYOUT_PROGRAM, O_RDONLY | O_CLOEXEC);
+        return fd >= 0 && fsync(fd) == 0 && close(fd) == 0;
+    }();
+    EXPECT_TRUE(writtenBack) << HEFT_LAYOUT_PROGRAM;
+    return HEFT_LAYOUT_PROGRAM;
 }
 
-/* Private anonymous memory between two inaccessible pages: the kernel
- * cannot merge it with a neighbour, so it is one mapping of exactly `size`. */
-static char* mapGuarded(size_t size)
-{
-    char* base = mmap(NULL, size + 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-    if (base == MAP_FAILED) exit(3);
-    mprotect(base, page, PROT_NONE);
-    mprotect(base + page + size, page, PROT_NONE);
-    return base + page;
-}
-
-static char* mapShared(int fd, size_t size)
-{
-    char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-    if (pages == MAP_FAILED) exit(3);
-    return pages;
-}
-
-static void churn(void)
-{
-    unsigned seed = (unsigned)getpid();
-    int alive = 0;
-    for (;;) {
-        while (waitpid(-1, NULL, alive >= 16 ? 0 : WNOHANG) > 0) --alive;
-        pid_t pid = fork();
-        if (pid == 0) {
-            prctl(PR_SET_PDEATHSIG, SIGKILL);
-            size_t size = (1 + rand_r(&seed) % 8) << 20;
-            char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-            if (pages != MAP_FAILED) touch(pages, size);
-            usleep(rand_r(&seed) % 20000);
-            _exit(0);
-        }
-        if (pid > 0) ++alive;
-        usleep(500);
-    }
-}
-
-static void readPages(const char* start, size_t size)
-{
-    for (size_t offset = 0; offset < size; offset += page) (void)*(volatile const char*)(start + offset);
-}
-
-/* Maps `path` privately. "written": writable, the first half of its pages
- * written (the process's own copies) and the second half read (the file's
- * pages); "read": read-only, its first and third quarter read, two runs of
- * pages with a gap between them. */
-static char* mapFilePrivately(const char* how, const char* path)
-{
-    int fd = open(path, O_RDONLY);
-    struct stat status;
-    if (fd < 0 || fstat(fd, &status) != 0) exit(3);
-    size_t size = (size_t)status.st_size, quarter = size / page / 4 * page;
-    int writable = strcmp(how, "written") == 0;
-    char* pages = mmap(NULL, size, writable ? PROT_READ | PROT_WRITE : PROT_READ, MAP_PRIVATE, fd, 0);
-    if (pages == MAP_FAILED) exit(3);
-    close(fd);
-    if (writable) {
-        touch(pages, 2 * quarter);
-        readPages(pages + 2 * quarter, size - 2 * quarter);
-    } else {
-        readPages(pages, quarter);
-        readPages(pages + 2 * quarter, quarter);
-    }
-    return pages;
-}
-
-/* A family that shares memory by fork alone. The parent writes one mapping
- * of `shared` bytes, pushes its first `pagedOut` bytes to swap and maps a
- * file privately (unless `how` is "-"), then forks `count` children. Child
- * i overwrites slice i of the shared mapping, counted from its end, writes
- * `own` bytes of new memory, tells the parent and waits; once all have, the
- * parent writes `after` bytes of new memory. Printed: the shared mapping,
- * the file mapping (0 for none), the parent's new memory, the MADV_PAGEOUT
- * error (0 for none), then the children's pids. */
-static void prefork(size_t shared, int count, size_t slice, size_t own, size_t after, size_t pagedOut,
-                    const char* how, const char* path)
-{
-    char* pages = mapGuarded(shared);
-    touch(pages, shared);
-    int pageoutError = pagedOut > 0 && madvise(pages, pagedOut, MADV_PAGEOUT) != 0 ? errno : 0;
-    char* file = strcmp(how, "-") == 0 ? NULL : mapFilePrivately(how, path);
-    int ready[2];
-    if (pipe(ready) != 0) exit(3);
-    pid_t parent = getpid();
-    pid_t* children = calloc((size_t)count, sizeof(pid_t));
-    for (int i = 0; i < count; ++i) {
-        children[i] = fork();
-        if (children[i] < 0) exit(3);
-        if (children[i] > 0) continue;
-        /* The children go with the parent, also when it died before this. */
-        prctl(PR_SET_PDEATHSIG, SIGKILL);
-        if (getppid() != parent) _exit(0);
-        touch(pages + shared - (size_t)(i + 1) * slice, slice);
-        char* mine = mapGuarded(own);
-        touch(mine, own);
-        if (write(ready[1], "", 1) != 1) _exit(3);
-        for (;;) pause();
-    }
-    close(ready[1]);
-    /* A child that died on the way would leave the parent waiting for ever:
-     * the others keep the pipe open. */
-    for (int i = 0; i < count;) {
-        struct pollfd wait = {ready[0], POLLIN, 0};
-        char byte;
-        if (poll(&wait, 1, 100) == 1 && read(ready[0], &byte, 1) == 1) ++i;
-        else if (waitpid(-1, NULL, WNOHANG) > 0) exit(5);
-    }
-    close(ready[0]);
-    char* extra = mapGuarded(after);
-    touch(extra, after);
-    printf("%lu %lu %lu %d", (unsigned long)pages, (unsigned long)file, (unsigned long)extra, pageoutError);
-    for (int i = 0; i < count; ++i) printf(" %d", (int)children[i]);
-    printf("\n");
-}
-
-int main(int argc, char** argv)
-{
-    page = (size_t)sysconf(_SC_PAGESIZE);
-    prctl(PR_SET_DUMPABLE, 1);
-    const char* mode = argc > 1 ? argv[1] : "";
-    if (strcmp(mode, "anonymous") == 0 && argc == 5) {
-        size_t written = strtoull(argv[2], NULL, 10), freed = strtoull(argv[3], NULL, 10),
-               locked = strtoull(argv[4], NULL, 10);
-        char* w = mapGuarded(written);
-        char* f = mapGuarded(freed);
-        char* l = mapGuarded(locked);
-        touch(w, written);
-        touch(f, freed);
-        if (madvise(f, freed, MADV_FREE) != 0) return 4;
-        touch(l, locked);
-        int lockError = mlock(l, locked) == 0 ? 0 : errno;
-        printf("%lu %lu %lu %d\n", (unsigned long)w, (unsigned long)f, (unsigned long)l, lockError);
-    } else if (strcmp(mode, "pageout") == 0 && argc == 3) {
-        size_t size = strtoull(argv[2], NULL, 10);
-        char* pages = mapGuarded(size);
-        touch(pages, size);
-        int error = madvise(pages, size, MADV_PAGEOUT) == 0 ? 0 : errno;
-        printf("%lu %d\n", (unsigned long)pages, error);
-    } else if (strcmp(mode, "shared") == 0 && argc == 4) {
-        size_t size = strtoull(argv[3], NULL, 10);
-        char* pages = mapShared(atoi(argv[2]), size);
-        touch(pages, size);
-        printf("%lu\n", (unsigned long)pages);
-    } else if (strcmp(mode, "file") == 0 && argc == 4) {
-        size_t size = strtoull(argv[3], NULL, 10);
-        int fd = open(argv[2], O_RDWR);
-        if (fd < 0) return 3;
-        char* pages = mapShared(fd, size);
-        close(fd);
-        touch(pages, size);
-        printf("%lu\n", (unsigned long)pages);
-    } else if (strcmp(mode, "prefork") == 0 && argc == 10) {
-        prefork(strtoull(argv[2], NULL, 10), atoi(argv[3]), strtoull(argv[4], NULL, 10), strtoull(argv[5], NULL, 10),
-                strtoull(argv[6], NULL, 10), strtoull(argv[7], NULL, 10), argv[8], argv[9]);
-    } else if (strcmp(mode, "churn") == 0) {
-        printf("0\n");
-        fflush(stdout);
-        churn();
-    } else {
-        return 2;
-    }
-    fflush(stdout);
-    char byte;
-    while (read(0, &byte, 1) != 0) {}
-    for (;;) pause();
-}
-)layout";
-
-// Builds the layout program once per run of the tests; an empty path, with
-// the reason, when there is no C compiler to build it.
-class LayoutProgram {
-public:
-    static const LayoutProgram& shared()
-    {
-        static LayoutProgram program;
-        return program;
-    }
-    const std::string& path() const { return path_; }
-    const std::string& reason() const { return reason_; }
-
-private:
-    LayoutProgram()
-    {
-        if (!directory_.ok()) {
-            reason_ = "cannot create a directory for the layout program";
-            return;
-        }
-        // Children running as another user must reach the program.
-        chmod(directory_.path().c_str(), 0755);
-        std::string source = directory_.file("layout.c");
-        FILE* file = std::fopen(source.c_str(), "w");
-        if (!file) {
-            reason_ = "cannot write the layout program";
-            return;
-        }
-        std::fputs(kLayoutProgramSource, file);
-        std::fclose(file);
-        std::string binary = directory_.file("heft-e2e-layout");
-        for (const char* compiler : {"/usr/bin/cc", "/usr/bin/gcc", "/usr/bin/clang"}) {
-            if (access(compiler, X_OK) != 0) continue;
-            Outcome built = runProgram(compiler, {"cc", "-O1", "-o", binary, source});
-            if (built.status == 0) {
-                // Written back at once: the children's code and data are then
-                // clean file pages, not dirty ones that every child shares
-                // until writeback comes round.
-                int fd = open(binary.c_str(), O_RDONLY | O_CLOEXEC);
-                if (fd >= 0) {
-                    fsync(fd);
-                    close(fd);
-                }
-                path_ = binary;
-                return;
-            }
-            reason_ = "the layout program does not build: " + built.standardError;
-            return;
-        }
-        reason_ = "no C compiler to build the layout program";
-    }
-
-    TempDir directory_;
-    std::string path_;
-    std::string reason_;
-};
-
-// A child process running the layout program with `arguments`, optionally
-// as another user; it dies with the test, and is killed and reaped with this
-// object. `value(i)` is the i-th number the program reported.
+// A child process running the layout program with `arguments`, as `user`
+// when one is given; it dies with the test, and is killed and reaped with
+// this object. `value(i)` is the i-th number it printed once laid out.
 class LaidOutChild {
 public:
-    explicit LaidOutChild(std::vector<std::string> arguments, uid_t user = static_cast<uid_t>(-1))
+    explicit LaidOutChild(std::vector<std::string> arguments, uid_t user = kSameUser)
     {
-        const std::string& program = LayoutProgram::shared().path();
-        if (program.empty()) return;
         arguments.insert(arguments.begin(), "heft-e2e-layout");
-        std::vector<char*> argv;
-        for (auto& argument : arguments) argv.push_back(argument.data());
-        argv.push_back(nullptr);
+        std::vector<char*> argv = argvOf(arguments);
+        const char* program = layoutProgram();
         int ready[2];
-        int hold[2];
         if (pipe2(ready, O_CLOEXEC) != 0) return;
-        if (pipe2(hold, O_CLOEXEC) != 0) {
-            close(ready[0]);
-            close(ready[1]);
-            return;
-        }
         pid_ = fork();
         if (pid_ == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
-            dup2(hold[0], STDIN_FILENO);
             dup2(ready[1], STDOUT_FILENO);
-            if (user != static_cast<uid_t>(-1)) {
-                if (setgroups(0, nullptr) != 0 || setgid(user) != 0 || setuid(user) != 0) _exit(2);
-            }
-            execv(program.c_str(), argv.data());
+            if (user != kSameUser && (setgroups(0, nullptr) != 0 || setgid(user) != 0 || setuid(user) != 0)) _exit(2);
+            execv(program, argv.data());
             _exit(127);
         }
         close(ready[1]);
-        close(hold[0]);
-        holdFd_ = hold[1];
-        if (pid_ < 0) {
-            close(ready[0]);
-            return;
-        }
         std::string line;
-        char byte;
-        for (;;) {
-            ssize_t count = read(ready[0], &byte, 1);
-            if (count < 0 && errno == EINTR) continue;
-            if (count <= 0) break;
-            if (byte == '\n') {
-                ready_ = true;
-                break;
-            }
-            line += byte;
-        }
+        char byte = 0;
+        while (pid_ > 0 && read(ready[0], &byte, 1) == 1 && byte != '\n') line += byte;
         close(ready[0]);
+        ready_ = byte == '\n';
         std::istringstream numbers(line);
-        uint64_t value;
-        while (numbers >> value) values_.push_back(value);
+        for (uint64_t value; numbers >> value;) values_.push_back(value);
     }
     ~LaidOutChild()
     {
-        if (holdFd_ >= 0) close(holdFd_);
         if (pid_ <= 0) return;
         kill(pid_, SIGKILL);
         while (waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {}
@@ -504,55 +187,31 @@ public:
 
 private:
     pid_t pid_ = -1;
-    int holdFd_ = -1;
     bool ready_ = false;
     std::vector<uint64_t> values_;
 };
 
-// A swap area for tests that push pages out. When the system already swaps,
-// that is used and nothing is changed; otherwise a 256 MiB swap file is made
-// under /tmp, and turned off and removed again with this object, also when
+// Swap for the tests that push pages out: the system's own when it has some
+// (/proc/swaps lists one after its heading line), otherwise a 256 MiB swap
+// file under /tmp, turned off and removed again with this object, also when
 // the test fails.
 class SwapArea {
 public:
     SwapArea()
     {
-        if (systemHasSwap()) {
-            available_ = true;
-            return;
-        }
-        char pattern[] = "/tmp/heft-e2e-swap-XXXXXX";
-        int fd = mkstemp(pattern);
-        if (fd < 0) {
-            reason_ = std::string("cannot create a swap file: ") + std::strerror(errno);
-            return;
-        }
-        path_ = pattern;
-        int error = posix_fallocate(fd, 0, 256 * kMiB);
-        fchmod(fd, 0600);
-        close(fd);
-        if (error != 0) {
-            reason_ = std::string("cannot allocate a swap file: ") + std::strerror(error);
-            return;
-        }
-        const char* mkswap = access("/sbin/mkswap", X_OK) == 0 ? "/sbin/mkswap" : "/usr/sbin/mkswap";
-        Outcome made = runProgram(mkswap, {"mkswap", path_});
-        if (made.status != 0) {
-            reason_ = "mkswap failed: " + made.standardError;
-            return;
-        }
-        if (swapon(path_.c_str(), 0) != 0) {
-            reason_ = std::string("swapon failed: ") + std::strerror(errno);
-            return;
-        }
-        enabled_ = true;
-        available_ = true;
+        std::string swaps = readFile("/proc/swaps");
+        available_ = swaps.find('\n') + 1 < swaps.size();
+        if (available_) return;
+        Outcome made = runProgram("/bin/sh", {"sh", "-ec",
+                                              "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
+                                              "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
+        path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
+        enabled_ = available_ = made.status == 0;
+        reason_ = made.standardError;
     }
     ~SwapArea()
     {
-        if (enabled_ && swapoff(path_.c_str()) != 0) {
-            ADD_FAILURE() << "swapoff " << path_ << ": " << std::strerror(errno);
-        }
+        if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << strerror(errno);
         if (!path_.empty()) unlink(path_.c_str());
     }
     SwapArea(const SwapArea&) = delete;
@@ -560,31 +219,6 @@ public:
 
     bool available() const { return available_; }
     const std::string& reason() const { return reason_; }
-
-    static bool systemHasSwap()
-    {
-        std::string swaps;
-        if (!readWholeFile("/proc/swaps", swaps)) return false;
-        // A heading line, then one line per active swap area.
-        size_t firstLineEnd = swaps.find('\n');
-        return firstLineEnd != std::string::npos && firstLineEnd + 1 < swaps.size();
-    }
-
-    static bool readWholeFile(const std::string& path, std::string& contents)
-    {
-        contents.clear();
-        int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-        if (fd < 0) return false;
-        char buffer[65536];
-        for (;;) {
-            ssize_t count = read(fd, buffer, sizeof(buffer));
-            if (count < 0 && errno == EINTR) continue;
-            if (count <= 0) break;
-            contents.append(buffer, static_cast<size_t>(count));
-        }
-        close(fd);
-        return true;
-    }
 
 private:
     std::string path_;
@@ -606,153 +240,73 @@ struct PreforkLayout {
     std::string path = "-";
 };
 
-// Whether `pid` still runs: a child that died with its parent waits, dead,
-// for init to reap it.
-inline bool processRunning(pid_t pid)
-{
-    std::string stat;
-    if (!SwapArea::readWholeFile("/proc/" + std::to_string(pid) + "/stat", stat)) return false;
-    size_t state = stat.rfind(") ");
-    return state != std::string::npos && state + 2 < stat.size() && stat[state + 2] != 'Z' && stat[state + 2] != 'X';
-}
-
 // A family laid out by the prefork mode: the parent is a laid-out child, its
-// children are the pids it reported. Taking the family down kills the
-// parent; a child that does not die with it is a failure, and killed.
-class LaidOutFamily {
+// children are the pids it printed (once all of them were ready). Taken down
+// children first, while the parent still holds their pids, so that no other
+// process can have them.
+class LaidOutFamily : public LaidOutChild {
 public:
-    explicit LaidOutFamily(const PreforkLayout& layout, uid_t user = static_cast<uid_t>(-1))
+    explicit LaidOutFamily(const PreforkLayout& l, uid_t user = kSameUser)
+        : LaidOutChild({"prefork", std::to_string(l.shared), std::to_string(l.children), std::to_string(l.slice),
+                        std::to_string(l.own), std::to_string(l.after), std::to_string(l.pagedOut), l.file, l.path},
+                       user)
     {
-        auto number = [](uint64_t value) { return std::to_string(value); };
-        parent_ = std::make_unique<LaidOutChild>(
-            std::vector<std::string>{"prefork", number(layout.shared), number(layout.children), number(layout.slice),
-                                     number(layout.own), number(layout.after), number(layout.pagedOut), layout.file,
-                                     layout.path},
-            user);
-        for (int i = 0; i < layout.children && parent_->value(4 + i) != 0; ++i)
-            children_.push_back(static_cast<pid_t>(parent_->value(4 + i)));
-        ready_ = parent_->ready() && children_.size() == static_cast<size_t>(layout.children);
-        all_.insert(children_.begin(), children_.end());
-        all_.insert(parent_->pid());
+        for (int i = 0; i < l.children && value(4 + i) != 0; ++i) children_.push_back(static_cast<pid_t>(value(4 + i)));
+        all_ = {children_.begin(), children_.end()};
+        all_.insert(pid());
     }
     ~LaidOutFamily()
     {
-        parent_.reset();
-        for (pid_t child : children_) {
-            for (int wait = 0; processRunning(child) && wait < 500; ++wait) usleep(10000);
-            if (!processRunning(child)) continue;
-            ADD_FAILURE() << "child " << child << " outlived its parent";
-            kill(child, SIGKILL);
-        }
+        for (pid_t child : children_) kill(child, SIGKILL);
     }
 
-    bool ready() const { return ready_; }
-    pid_t parent() const { return parent_->pid(); }
+    pid_t parent() const { return pid(); }
     const std::vector<pid_t>& children() const { return children_; }
     const std::set<int>& all() const { return all_; }
-    uint64_t sharedAddress() const { return parent_->value(0); }
-    uint64_t fileAddress() const { return parent_->value(1); }
-    int pageoutError() const { return static_cast<int>(parent_->value(3)); }
+    uint64_t sharedAddress() const { return value(0); }
+    uint64_t fileAddress() const { return value(1); }
+    int pageoutError() const { return static_cast<int>(value(3)); }
 
 private:
-    std::unique_ptr<LaidOutChild> parent_;
     std::vector<pid_t> children_;
     std::set<int> all_;
-    bool ready_ = false;
 };
 
-// The "Name: value kB" lines of a /proc file section, in bytes (the numbers
-// of lines without a kB unit are kept as they are).
-inline std::map<std::string, uint64_t> parseKernelFields(std::string_view text)
+// A "Name:  123 kB" field of a /proc file's text, in bytes (every field the
+// tests read is in kB); 0 when it is not there.
+inline uint64_t kernelField(const std::string& text, const char* name)
 {
-    std::map<std::string, uint64_t> fields;
-    while (!text.empty()) {
-        size_t end = text.find('\n');
-        std::string_view line = text.substr(0, end);
-        text = end == std::string_view::npos ? std::string_view() : text.substr(end + 1);
-        size_t colon = line.find(':');
-        if (colon == std::string_view::npos) continue;
-        std::string_view rest = line.substr(colon + 1);
-        size_t digits = rest.find_first_of("0123456789");
-        if (digits == std::string_view::npos) continue;
-        uint64_t value = 0;
-        auto parsed = std::from_chars(rest.data() + digits, rest.data() + rest.size(), value);
-        if (parsed.ec != std::errc()) continue;
-        if (std::string_view(parsed.ptr, rest.data() + rest.size()).find("kB") != std::string_view::npos) {
-            value *= 1024;
-        }
-        fields[std::string(line.substr(0, colon))] = value;
-    }
-    return fields;
+    size_t at = text.find("\n" + std::string(name) + ":");
+    return at == std::string::npos ? 0 : std::strtoull(text.c_str() + at + std::strlen(name) + 2, nullptr, 10) * 1024;
 }
 
-// The smaps fields of the mapping of `pid` that starts at `address`; empty
-// when there is none.
-inline std::map<std::string, uint64_t> smapsOfMappingAt(pid_t pid, uint64_t address)
+// The smaps entry, heading line first, of the mapping of `pid` that starts
+// at `address`; empty when there is none.
+inline std::string mappingAt(pid_t pid, uint64_t address)
 {
-    std::string smaps;
-    if (!SwapArea::readWholeFile("/proc/" + std::to_string(pid) + "/smaps", smaps)) return {};
-    char start[32];
-    std::snprintf(start, sizeof(start), "%llx-", static_cast<unsigned long long>(address));
-    size_t at = smaps.rfind(std::string("\n") + start);
-    if (smaps.rfind(start, 0) == 0) {
-        at = 0;
-    } else if (at == std::string::npos) {
-        return {};
-    } else {
-        ++at;
-    }
-    size_t bodyStart = smaps.find('\n', at);
-    if (bodyStart == std::string::npos) return {};
-    ++bodyStart;
-    // The next mapping's header is the first line that does not hold a colon
-    // before its first blank.
-    size_t bodyEnd = bodyStart;
-    while (bodyEnd < smaps.size()) {
-        size_t lineEnd = smaps.find('\n', bodyEnd);
-        if (lineEnd == std::string::npos) lineEnd = smaps.size();
-        std::string_view line(smaps.data() + bodyEnd, lineEnd - bodyEnd);
-        size_t blank = line.find(' ');
-        size_t colon = line.find(':');
-        if (colon == std::string_view::npos || (blank != std::string_view::npos && blank < colon)) break;
-        bodyEnd = lineEnd + 1;
-    }
-    return parseKernelFields(std::string_view(smaps.data() + bodyStart, bodyEnd - bodyStart));
+    std::string smaps = "\n" + readFile("/proc/" + std::to_string(pid) + "/smaps");
+    char heading[32];
+    std::snprintf(heading, sizeof(heading), "\n%llx-", static_cast<unsigned long long>(address));
+    size_t start = smaps.find(heading);
+    // VmFlags is the last field of every entry.
+    size_t end = start == std::string::npos ? start : smaps.find("\nVmFlags:", start);
+    return end == std::string::npos ? std::string() : smaps.substr(start, end - start);
 }
 
-// What the kernel charges `pid` that it cannot take back: written and swapped
-// pages of every mapping, and the page tables.
-inline uint64_t kernelHeft(pid_t pid)
+// What the kernel charges `pid` that it cannot take back: the written and
+// swapped pages of all its mappings, and its page tables. `proportionally`
+// divides each page among the processes that map it, so that summed over a
+// set of processes each of their pages counts once.
+inline uint64_t kernelHeft(pid_t pid, bool proportionally = false)
 {
-    std::string rollup;
-    std::string status;
     std::string base = "/proc/" + std::to_string(pid);
-    if (!SwapArea::readWholeFile(base + "/smaps_rollup", rollup) ||
-        !SwapArea::readWholeFile(base + "/status", status)) {
-        ADD_FAILURE() << "cannot read the memory figures of " << pid;
-        return 0;
-    }
-    auto rollupFields = parseKernelFields(rollup);
-    auto statusFields = parseKernelFields(status);
-    return rollupFields["Private_Dirty"] + rollupFields["Shared_Dirty"] + rollupFields["Swap"] +
-           statusFields["VmPTE"];
-}
-
-// The kernel's share of `pid` in what cannot be taken back: each written or
-// swapped page divided among the processes that map it, and the page
-// tables. Summed over a set of processes it counts each of their pages once.
-inline uint64_t kernelShareOfHeft(pid_t pid)
-{
-    std::string rollup;
-    std::string status;
-    std::string base = "/proc/" + std::to_string(pid);
-    if (!SwapArea::readWholeFile(base + "/smaps_rollup", rollup) ||
-        !SwapArea::readWholeFile(base + "/status", status)) {
-        ADD_FAILURE() << "cannot read the memory figures of " << pid;
-        return 0;
-    }
-    auto rollupFields = parseKernelFields(rollup);
-    return rollupFields["Pss_Dirty"] + rollupFields["SwapPss"] + parseKernelFields(status)["VmPTE"];
+    std::string rollup = readFile(base + "/smaps_rollup");
+    std::string status = readFile(base + "/status");
+    EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;
+    uint64_t pages = proportionally ? kernelField(rollup, "Pss_Dirty") + kernelField(rollup, "SwapPss")
+                                    : kernelField(rollup, "Private_Dirty") + kernelField(rollup, "Shared_Dirty") +
+                                          kernelField(rollup, "Swap");
+    return pages + kernelField(status, "VmPTE");
 }
 
 }  // namespace heft_e2e
