@@ -83,21 +83,10 @@ std::string sharedObject(uint64_t relroSize)
     return elfFile<Ehdr, Phdr>(ET_DYN, headers, 0x4800);
 }
 
-int memoryFile(const std::string& bytes)
-{
-    int fd = ::memfd_create("heft-elf-test", MFD_CLOEXEC);
-    if (fd < 0) return -1;
-    if (::write(fd, bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size())) {
-        ::close(fd);
-        return -1;
-    }
-    return fd;
-}
-
 HTElfImageReader::ReadResult readBytes(const std::string& bytes, std::shared_ptr<const Layout>* layout)
 {
-    int fd = memoryFile(bytes);
-    EXPECT_GE(fd, 0);
+    int fd = ::memfd_create("heft-elf-test", MFD_CLOEXEC);
+    EXPECT_EQ(::write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
     auto result = HTElfImageReader::readLayout(fd, kPage, layout);
     ::close(fd);
     return result;
@@ -246,19 +235,19 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
     std::shared_ptr<const Layout> layout;
     ASSERT_EQ(readBytes(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000), &layout), HTElfImageReader::ReadResult::Image);
     const uint64_t base = 0x7f1234560000;
+    // Data lies one page ahead of its file offset: the RELRO page split off
+    // by mprotect, and the page after it. The last row is beyond every
+    // PT_LOAD's file contents.
+    struct Row { uint64_t address, offset; bool executable, found; };
+    const Row rows[] = {{0, 0, false, true},           {0x1000, 0x1000, true, true}, {0x4000, 0x3000, false, true},
+                        {0x5000, 0x4000, false, true}, {0x9000, 0x8000, false, false}};
+    for (const Row& row : rows) {
+        uint64_t bias = 0;
+        EXPECT_EQ(HTElfImageReader::biasForMapping(*layout, base + row.address, row.offset, row.executable, kPage, &bias),
+                  row.found) << std::hex << row.address;
+        EXPECT_EQ(bias, row.found ? base : 0) << std::hex << row.address;
+    }
     uint64_t bias = 0;
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base, 0, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x1000, 0x1000, true, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    // Data: addresses one page ahead of file offsets; the RELRO page split
-    // off by mprotect, and the page after it.
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x4000, 0x3000, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x5000, 0x4000, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    // Beyond every PT_LOAD's file contents.
-    EXPECT_FALSE(HTElfImageReader::biasForMapping(*layout, base + 0x9000, 0x8000, false, kPage, &bias));
 
     std::vector<Elf64_Phdr> fixed = {programHeader<Elf64_Phdr>(PT_LOAD, PF_R | PF_X, 0, 0x400000, 0x1800, 0x1800)};
     ASSERT_EQ(readBytes(elfFile<Elf64_Ehdr, Elf64_Phdr>(ET_EXEC, fixed, 0x2000), &layout),
@@ -292,7 +281,6 @@ TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
     EXPECT_EQ(libc->baseAddress, reinterpret_cast<uintptr_t>(info.dli_fbase));
 
     expectMappingsMatchSegments(::getpid(), images);
-
 }
 
 TEST(HTElfImageReader, ListsAChildProcess)
