@@ -183,18 +183,33 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     for (size_t i = 1; i < regions_.size(); ++i)
         EXPECT_GE(regions_[i].start, regions_[i - 1].start + regions_[i - 1].size) << "regions overlap or go back";
 
-    // Touched anonymous pages: resident and dirty, each page alike.
+    // Written pages are resident and dirty: mlock faults the locked ones
+    // in, and the test looks well within the kernel's 30 s before it writes
+    // dirty file pages back. Files have an external pager.
+    struct Row { uint64_t start; size_t pages, written; uint8_t shareMode; uint32_t inheritance; int external, wired; };
+    const Row rows[] = {{layout_.touched, kTouchedPages, kTouchedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 0},
+                        {layout_.locked, kLockedPages, kLockedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 1},
+                        {layout_.file, kFilePages, kFileWrittenPages, SM_SHARED, VM_INHERIT_SHARE, 1, 0}};
+    for (const Row& row : rows) {
+        const WalkedRegion* region = regionAt(regions_, row.start);
+        ASSERT_NE(region, nullptr) << std::hex << row.start;
+        SCOPED_TRACE(testing::Message() << "region of " << row.pages << " pages");
+        EXPECT_EQ(region->size, row.pages * pageSize());
+        EXPECT_EQ(region->info.pages_resident, row.written);
+        EXPECT_EQ(region->info.pages_dirtied, row.written);
+        EXPECT_EQ(region->info.share_mode, row.shareMode);
+        EXPECT_EQ(region->info.inheritance, row.inheritance);
+        EXPECT_EQ(region->info.external_pager, row.external);
+        EXPECT_EQ(region->info.user_wired_count, row.wired);
+        EXPECT_EQ(region->info.user_tag, 0u);
+        // Files' identities carry the top bit, anonymous memory's the next.
+        EXPECT_EQ(region->info.object_id_full >> (row.external ? 63 : 62), 1u);
+    }
     const WalkedRegion* touched = regionAt(regions_, layout_.touched);
-    ASSERT_NE(touched, nullptr);
-    EXPECT_EQ(touched->size, kTouchedPages * pageSize());
-    EXPECT_EQ(touched->info.pages_resident, kTouchedPages);
-    EXPECT_EQ(touched->info.pages_dirtied, kTouchedPages);
-    EXPECT_EQ(touched->info.share_mode, SM_PRIVATE);
-    EXPECT_EQ(touched->info.user_tag, 0u);
-    EXPECT_EQ(touched->info.external_pager, 0);
-    EXPECT_EQ(touched->info.user_wired_count, 0);
-    EXPECT_EQ(touched->info.object_id_full >> 62, 1u);
-    // With the inaccessible, never touched page on either side.
+    const WalkedRegion* mapped = regionAt(regions_, layout_.file);
+
+    // The touched pages each alike, the inaccessible page on either side
+    // never touched.
     kern_return_t result;
     std::vector<int32_t> pages = dispositions(platform_, *task_, layout_.touched - pageSize(), kTouchedPages + 2, result);
     ASSERT_EQ(result, KERN_SUCCESS);
@@ -203,22 +218,6 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     for (size_t i = 1; i <= kTouchedPages; ++i)
         EXPECT_EQ(pages[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
 
-    const WalkedRegion* locked = regionAt(regions_, layout_.locked);
-    ASSERT_NE(locked, nullptr);
-    EXPECT_EQ(locked->info.user_wired_count, 1);
-    EXPECT_EQ(locked->info.pages_resident, kLockedPages);  // mlock faults the pages in
-
-    // The shared file mapping: an external pager, the written pages dirty
-    // (the test looks well within the kernel's 30 s before it writes dirty
-    // file pages back) and its path.
-    const WalkedRegion* mapped = regionAt(regions_, layout_.file);
-    ASSERT_NE(mapped, nullptr);
-    EXPECT_EQ(mapped->info.external_pager, 1);
-    EXPECT_EQ(mapped->info.share_mode, SM_SHARED);
-    EXPECT_EQ(mapped->info.inheritance, VM_INHERIT_SHARE);
-    EXPECT_EQ(mapped->info.pages_resident, kFileWrittenPages);
-    EXPECT_EQ(mapped->info.pages_dirtied, kFileWrittenPages);
-    EXPECT_EQ(mapped->info.object_id_full >> 63, 1u);
     char path[1024];
     int length = platform_.proc_regionfilename(*task_, layout_.file + pageSize(), path, sizeof(path));
     EXPECT_EQ(std::string(path, static_cast<size_t>(std::max(length, 0))), filePath_);
