@@ -1,5 +1,6 @@
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/linux/HTProcBuffer.h"
 #include "platform/HTTestChildren.h"
 
 #include <gtest/gtest.h>
@@ -51,14 +52,8 @@ std::string procArgs(HTPlatform& platform, int32_t pid)
 
 std::string readWhole(const char* path)
 {
-    std::string text;
-    int fd = ::open(path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return text;
-    char chunk[4096];
-    ssize_t count;
-    while ((count = ::read(fd, chunk, sizeof(chunk))) > 0) text.append(chunk, static_cast<size_t>(count));
-    ::close(fd);
-    return text;
+    HTProcBuffer buffer;
+    return buffer.readFile(AT_FDCWD, path) ? std::string(buffer.view()) : std::string();
 }
 
 }  // namespace
