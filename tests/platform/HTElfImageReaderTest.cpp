@@ -13,6 +13,7 @@
 #include <dlfcn.h>
 #include <elf.h>
 #include <fcntl.h>
+#include <filesystem>
 #include <gnu/libc-version.h>
 #include <string>
 #include <sys/mman.h>
@@ -104,16 +105,14 @@ std::string segmentsText(const Layout& layout)
     return text;
 }
 
-// A new file under /tmp holding `bytes`; empty on failure.
-std::string temporaryFile(const std::string& bytes)
+// A new file under /tmp holding `bytes`, open at `fd`; empty on failure.
+std::string temporaryFile(const std::string& bytes, int& fd)
 {
     char pattern[] = "/tmp/heft-elf-XXXXXX";
-    int fd = ::mkstemp(pattern);
+    fd = ::mkstemp(pattern);
     if (fd < 0) return "";
-    bool written = ::write(fd, bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size());
-    ::close(fd);
-    if (!written) ::unlink(pattern);
-    return written ? pattern : "";
+    EXPECT_EQ(::write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    return pattern;
 }
 
 std::shared_ptr<HTLinuxTaskPort> openTask(pid_t pid)
@@ -133,11 +132,9 @@ std::vector<HTPlatformImage> listImages(HTElfImageReader& reader, HTLinuxTaskPor
 
 std::string resolved(const std::string& path)
 {
-    char* real = ::realpath(path.c_str(), nullptr);
-    if (real == nullptr) return path;
-    std::string result(real);
-    std::free(real);
-    return result;
+    std::error_code error;
+    std::string real = std::filesystem::canonical(path, error);
+    return error ? path : real;
 }
 
 const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images, const std::string& path)
@@ -313,13 +310,11 @@ TEST(HTElfImageReader, ListsAChildProcess)
 
 TEST(HTElfImageReader, MappedFilesGiveImagesOnlyWhenTheyAreElf)
 {
-    std::string textPath = temporaryFile("not an executable\n");
-    std::string elfPath = temporaryFile(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000));
+    int textFd;
+    int elfFd;
+    std::string textPath = temporaryFile("not an executable\n", textFd);
+    std::string elfPath = temporaryFile(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000), elfFd);
     ASSERT_FALSE(textPath.empty() || elfPath.empty());
-    int textFd = ::open(textPath.c_str(), O_RDONLY | O_CLOEXEC);
-    int elfFd = ::open(elfPath.c_str(), O_RDONLY | O_CLOEXEC);
-    ASSERT_GE(textFd, 0);
-    ASSERT_GE(elfFd, 0);
     void* textMap = ::mmap(nullptr, kPage, PROT_READ, MAP_PRIVATE, textFd, 0);
     // Only the data pages of the object, placed as a loader would: the
     // object's bias must come from them alone.
