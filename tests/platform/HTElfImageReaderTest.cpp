@@ -13,6 +13,7 @@
 #include <dlfcn.h>
 #include <elf.h>
 #include <fcntl.h>
+#include <filesystem>
 #include <gnu/libc-version.h>
 #include <string>
 #include <sys/mman.h>
@@ -83,21 +84,10 @@ std::string sharedObject(uint64_t relroSize)
     return elfFile<Ehdr, Phdr>(ET_DYN, headers, 0x4800);
 }
 
-int memoryFile(const std::string& bytes)
-{
-    int fd = ::memfd_create("heft-elf-test", MFD_CLOEXEC);
-    if (fd < 0) return -1;
-    if (::write(fd, bytes.data(), bytes.size()) != static_cast<ssize_t>(bytes.size())) {
-        ::close(fd);
-        return -1;
-    }
-    return fd;
-}
-
 HTElfImageReader::ReadResult readBytes(const std::string& bytes, std::shared_ptr<const Layout>* layout)
 {
-    int fd = memoryFile(bytes);
-    EXPECT_GE(fd, 0);
+    int fd = ::memfd_create("heft-elf-test", MFD_CLOEXEC);
+    EXPECT_EQ(::write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
     auto result = HTElfImageReader::readLayout(fd, kPage, layout);
     ::close(fd);
     return result;
@@ -115,16 +105,14 @@ std::string segmentsText(const Layout& layout)
     return text;
 }
 
-// A new file under /tmp holding `bytes`; empty on failure.
-std::string temporaryFile(const std::string& bytes)
+// A new file under /tmp holding `bytes`, open at `fd`; empty on failure.
+std::string temporaryFile(const std::string& bytes, int& fd)
 {
     char pattern[] = "/tmp/heft-elf-XXXXXX";
-    int fd = ::mkstemp(pattern);
+    fd = ::mkstemp(pattern);
     if (fd < 0) return "";
-    bool written = ::write(fd, bytes.data(), bytes.size()) == static_cast<ssize_t>(bytes.size());
-    ::close(fd);
-    if (!written) ::unlink(pattern);
-    return written ? pattern : "";
+    EXPECT_EQ(::write(fd, bytes.data(), bytes.size()), static_cast<ssize_t>(bytes.size()));
+    return pattern;
 }
 
 std::shared_ptr<HTLinuxTaskPort> openTask(pid_t pid)
@@ -144,11 +132,9 @@ std::vector<HTPlatformImage> listImages(HTElfImageReader& reader, HTLinuxTaskPor
 
 std::string resolved(const std::string& path)
 {
-    char* real = ::realpath(path.c_str(), nullptr);
-    if (real == nullptr) return path;
-    std::string result(real);
-    std::free(real);
-    return result;
+    std::error_code error;
+    std::string real = std::filesystem::canonical(path, error);
+    return error ? path : real;
 }
 
 const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images, const std::string& path)
@@ -246,19 +232,19 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
     std::shared_ptr<const Layout> layout;
     ASSERT_EQ(readBytes(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000), &layout), HTElfImageReader::ReadResult::Image);
     const uint64_t base = 0x7f1234560000;
+    // Data lies one page ahead of its file offset: the RELRO page split off
+    // by mprotect, and the page after it. The last row is beyond every
+    // PT_LOAD's file contents.
+    struct Row { uint64_t address, offset; bool executable, found; };
+    const Row rows[] = {{0, 0, false, true},           {0x1000, 0x1000, true, true}, {0x4000, 0x3000, false, true},
+                        {0x5000, 0x4000, false, true}, {0x9000, 0x8000, false, false}};
+    for (const Row& row : rows) {
+        uint64_t bias = 0;
+        EXPECT_EQ(HTElfImageReader::biasForMapping(*layout, base + row.address, row.offset, row.executable, kPage, &bias),
+                  row.found) << std::hex << row.address;
+        EXPECT_EQ(bias, row.found ? base : 0) << std::hex << row.address;
+    }
     uint64_t bias = 0;
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base, 0, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x1000, 0x1000, true, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    // Data: addresses one page ahead of file offsets; the RELRO page split
-    // off by mprotect, and the page after it.
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x4000, 0x3000, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    ASSERT_TRUE(HTElfImageReader::biasForMapping(*layout, base + 0x5000, 0x4000, false, kPage, &bias));
-    EXPECT_EQ(bias, base);
-    // Beyond every PT_LOAD's file contents.
-    EXPECT_FALSE(HTElfImageReader::biasForMapping(*layout, base + 0x9000, 0x8000, false, kPage, &bias));
 
     std::vector<Elf64_Phdr> fixed = {programHeader<Elf64_Phdr>(PT_LOAD, PF_R | PF_X, 0, 0x400000, 0x1800, 0x1800)};
     ASSERT_EQ(readBytes(elfFile<Elf64_Ehdr, Elf64_Phdr>(ET_EXEC, fixed, 0x2000), &layout),
@@ -292,7 +278,6 @@ TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
     EXPECT_EQ(libc->baseAddress, reinterpret_cast<uintptr_t>(info.dli_fbase));
 
     expectMappingsMatchSegments(::getpid(), images);
-
 }
 
 TEST(HTElfImageReader, ListsAChildProcess)
@@ -325,13 +310,11 @@ TEST(HTElfImageReader, ListsAChildProcess)
 
 TEST(HTElfImageReader, MappedFilesGiveImagesOnlyWhenTheyAreElf)
 {
-    std::string textPath = temporaryFile("not an executable\n");
-    std::string elfPath = temporaryFile(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000));
+    int textFd;
+    int elfFd;
+    std::string textPath = temporaryFile("not an executable\n", textFd);
+    std::string elfPath = temporaryFile(sharedObject<Elf64_Ehdr, Elf64_Phdr>(0x1000), elfFd);
     ASSERT_FALSE(textPath.empty() || elfPath.empty());
-    int textFd = ::open(textPath.c_str(), O_RDONLY | O_CLOEXEC);
-    int elfFd = ::open(elfPath.c_str(), O_RDONLY | O_CLOEXEC);
-    ASSERT_GE(textFd, 0);
-    ASSERT_GE(elfFd, 0);
     void* textMap = ::mmap(nullptr, kPage, PROT_READ, MAP_PRIVATE, textFd, 0);
     // Only the data pages of the object, placed as a loader would: the
     // object's bias must come from them alone.

@@ -5,6 +5,7 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
@@ -23,15 +24,12 @@ constexpr size_t kLockedPages = 2;
 constexpr size_t kFilePages = 4;
 constexpr size_t kFileWrittenPages = 3;
 
-// Where the child put its memory; error and step name the first step that
-// failed in it.
+// Where the child put its memory.
 struct ChildLayout {
     uint64_t touched = 0;  // kTouchedPages pages, each written
     uint64_t freed = 0;    // kFreedPages pages, written, then freed with MADV_FREE
     uint64_t locked = 0;   // kLockedPages pages, mlocked
     uint64_t file = 0;     // kFilePages pages of a shared file mapping, the first kFileWrittenPages written
-    int error = 0;
-    int step = 0;
 };
 
 size_t pageSize()
@@ -52,129 +50,40 @@ char* isolatedAnonymous(size_t pages)
     return inner;
 }
 
-bool writeAll(int fd, const void* data, size_t length)
+// Lays out the child's memory into `layout`; answers 0, or the number of
+// the step that failed.
+int layOut(const std::string& filePath, ChildLayout& layout)
 {
-    return ::write(fd, data, length) == static_cast<ssize_t>(length);
+    size_t page = pageSize();
+    char* touched = isolatedAnonymous(kTouchedPages);
+    if (touched == nullptr) return 1;
+    std::memset(touched, 0x5a, kTouchedPages * page);
+    layout.touched = reinterpret_cast<uint64_t>(touched);
+
+    char* freed = isolatedAnonymous(kFreedPages);
+    if (freed == nullptr) return 2;
+    std::memset(freed, 0x5a, kFreedPages * page);
+    // The system calls themselves: a sanitizer's interceptors may turn
+    // them into no-ops.
+    if (::syscall(SYS_madvise, freed, kFreedPages * page, MADV_FREE) != 0) return 3;
+    layout.freed = reinterpret_cast<uint64_t>(freed);
+
+    char* locked = isolatedAnonymous(kLockedPages);
+    if (locked == nullptr || ::syscall(SYS_mlock, locked, kLockedPages * page) != 0) return 4;
+    layout.locked = reinterpret_cast<uint64_t>(locked);
+
+    int fd = ::open(filePath.c_str(), O_RDWR | O_CLOEXEC);
+    if (fd < 0) return 5;
+    void* file = ::mmap(nullptr, kFilePages * page, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+    ::close(fd);
+    if (file == MAP_FAILED) return 6;
+    std::memset(file, 0x5a, kFileWrittenPages * page);
+    layout.file = reinterpret_cast<uint64_t>(file);
+    return 0;
 }
 
-// A child that lays out known memory, reports where, and then waits until
-// released (or killed).
-class LaidOutChild {
-public:
-    LaidOutChild(const LaidOutChild&) = delete;
-    LaidOutChild& operator=(const LaidOutChild&) = delete;
-    ~LaidOutChild() { release(); }
-
-    // `filePath` names a file of at least kFilePages pages.
-    explicit LaidOutChild(const std::string& filePath)
-    {
-        int report[2];
-        int hold[2];
-        if (::pipe2(report, O_CLOEXEC) != 0) return;
-        if (::pipe2(hold, O_CLOEXEC) != 0) {
-            ::close(report[0]);
-            ::close(report[1]);
-            return;
-        }
-        child_ = HTTestChild::fork([&] {
-            ::close(report[0]);
-            ::close(hold[1]);
-            ChildLayout layout = layOut(filePath);
-            if (!writeAll(report[1], &layout, sizeof(layout))) return 1;
-            char byte;
-            while (::read(hold[0], &byte, 1) < 0 && errno == EINTR) {
-            }
-            return 0;
-        });
-        ::close(report[1]);
-        ::close(hold[0]);
-        release_ = hold[1];
-        ready_ = child_.valid() && ::read(report[0], &layout_, sizeof(layout_)) == sizeof(layout_);
-        ::close(report[0]);
-    }
-
-    bool ready() const { return ready_; }
-    const ChildLayout& layout() const { return layout_; }
-    HTTestChild& child() { return child_; }
-    pid_t pid() const { return child_.pid(); }
-
-    // Lets the child exit; it stays a zombie until reaped.
-    void release()
-    {
-        if (release_ >= 0) ::close(release_);
-        release_ = -1;
-    }
-
-private:
-    static ChildLayout layOut(const std::string& filePath)
-    {
-        ChildLayout layout;
-        size_t page = pageSize();
-        auto fail = [&](int step) {
-            layout.error = errno;
-            layout.step = step;
-            return layout;
-        };
-        char* touched = isolatedAnonymous(kTouchedPages);
-        if (touched == nullptr) return fail(1);
-        std::memset(touched, 0x5a, kTouchedPages * page);
-        layout.touched = reinterpret_cast<uint64_t>(touched);
-
-        char* freed = isolatedAnonymous(kFreedPages);
-        if (freed == nullptr) return fail(2);
-        std::memset(freed, 0x5a, kFreedPages * page);
-        // The system calls themselves: a sanitizer's interceptors may turn
-        // them into no-ops.
-        if (::syscall(SYS_madvise, freed, kFreedPages * page, MADV_FREE) != 0) return fail(3);
-        layout.freed = reinterpret_cast<uint64_t>(freed);
-
-        char* locked = isolatedAnonymous(kLockedPages);
-        if (locked == nullptr || ::syscall(SYS_mlock, locked, kLockedPages * page) != 0) return fail(4);
-        layout.locked = reinterpret_cast<uint64_t>(locked);
-
-        int fd = ::open(filePath.c_str(), O_RDWR | O_CLOEXEC);
-        if (fd < 0) return fail(5);
-        void* file = ::mmap(nullptr, kFilePages * page, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
-        ::close(fd);
-        if (file == MAP_FAILED) return fail(6);
-        std::memset(file, 0x5a, kFileWrittenPages * page);
-        layout.file = reinterpret_cast<uint64_t>(file);
-        return layout;
-    }
-
-    HTTestChild child_;
-    ChildLayout layout_;
-    int release_ = -1;
-    bool ready_ = false;
-};
-
-// A scratch file of kFilePages pages, removed with the object.
-class ScratchFile {
-public:
-    ScratchFile()
-    {
-        char pattern[] = "/tmp/heft-walk-XXXXXX";
-        int fd = ::mkstemp(pattern);
-        if (fd < 0) return;
-        path_ = pattern;
-        ok_ = ::ftruncate(fd, static_cast<off_t>(kFilePages * pageSize())) == 0;
-        ::close(fd);
-    }
-    ~ScratchFile()
-    {
-        if (!path_.empty()) ::unlink(path_.c_str());
-    }
-    bool ok() const { return ok_; }
-    const std::string& path() const { return path_; }
-
-private:
-    std::string path_;
-    bool ok_ = false;
-};
-
 struct WalkedRegion {
-    uint64_t start;
-    uint64_t size;
+    uint64_t start, size;
     vm_region_submap_info_64 info;
 };
 
@@ -220,76 +129,100 @@ std::vector<int32_t> dispositions(HTPlatform& platform, HTTaskPort& task, uint64
 
 bool pageFlagsReadable()
 {
-    int fd = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return false;
-    ::close(fd);
-    return true;
+    return ::access("/proc/kpageflags", R_OK) == 0;
 }
+
+// A child that lays out known memory, reports where through a page shared
+// with the test, and stops itself; continued, it exits. The walk of its
+// address space is taken once it has stopped.
+class HTLinuxAddressSpace : public testing::Test {
+protected:
+    void SetUp() override
+    {
+        char pattern[] = "/tmp/heft-walk-XXXXXX";
+        int fd = ::mkstemp(pattern);
+        ASSERT_GE(fd, 0);
+        filePath_ = pattern;
+        ASSERT_EQ(::ftruncate(fd, static_cast<off_t>(kFilePages * pageSize())), 0);
+        ::close(fd);
+        void* report = ::mmap(nullptr, sizeof(ChildLayout), PROT_READ | PROT_WRITE, MAP_SHARED | MAP_ANONYMOUS, -1, 0);
+        ASSERT_NE(report, MAP_FAILED);
+        child_ = HTTestChild::fork([&] {
+            int failed = layOut(filePath_, *static_cast<ChildLayout*>(report));
+            if (failed == 0) ::raise(SIGSTOP);
+            return failed;
+        });
+        siginfo_t state{};
+        ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child_.pid()), &state, WSTOPPED | WEXITED | WNOWAIT), 0);
+        layout_ = *static_cast<ChildLayout*>(report);
+        ::munmap(report, sizeof(ChildLayout));
+        ASSERT_EQ(state.si_code, CLD_STOPPED) << "the child failed in step " << state.si_status;
+        ASSERT_EQ(platform_.task_for_pid(child_.pid(), &task_), KERN_SUCCESS);
+        regions_ = walk(platform_, *task_, result_);
+    }
+    void TearDown() override
+    {
+        if (!filePath_.empty()) ::unlink(filePath_.c_str());
+    }
+
+    std::string filePath_;
+    HTTestChild child_;
+    ChildLayout layout_;
+    HTLinuxPlatform platform_;
+    std::shared_ptr<HTTaskPort> task_;
+    std::vector<WalkedRegion> regions_;
+    kern_return_t result_ = KERN_SUCCESS;
+};
 
 }  // namespace
 
-TEST(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
+TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
 {
-    ScratchFile file;
-    ASSERT_TRUE(file.ok());
-    LaidOutChild child(file.path());
-    ASSERT_TRUE(child.ready());
-    ASSERT_EQ(child.layout().error, 0) << "step " << child.layout().step << ": " << std::strerror(child.layout().error);
-    const ChildLayout& layout = child.layout();
+    EXPECT_EQ(result_, KERN_INVALID_ADDRESS);
+    ASSERT_GT(regions_.size(), 5u);
+    for (size_t i = 1; i < regions_.size(); ++i)
+        EXPECT_GE(regions_[i].start, regions_[i - 1].start + regions_[i - 1].size) << "regions overlap or go back";
 
-    HTLinuxPlatform platform;
-    std::shared_ptr<HTTaskPort> task;
-    ASSERT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
+    // Written pages are resident and dirty: mlock faults the locked ones
+    // in, and the test looks well within the kernel's 30 s before it writes
+    // dirty file pages back. Files have an external pager.
+    struct Row { uint64_t start; size_t pages, written; uint8_t shareMode; uint32_t inheritance; int external, wired; };
+    const Row rows[] = {{layout_.touched, kTouchedPages, kTouchedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 0},
+                        {layout_.locked, kLockedPages, kLockedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 1},
+                        {layout_.file, kFilePages, kFileWrittenPages, SM_SHARED, VM_INHERIT_SHARE, 1, 0}};
+    for (const Row& row : rows) {
+        const WalkedRegion* region = regionAt(regions_, row.start);
+        ASSERT_NE(region, nullptr) << std::hex << row.start;
+        SCOPED_TRACE(testing::Message() << "region of " << row.pages << " pages");
+        EXPECT_EQ(region->size, row.pages * pageSize());
+        EXPECT_EQ(region->info.pages_resident, row.written);
+        EXPECT_EQ(region->info.pages_dirtied, row.written);
+        EXPECT_EQ(region->info.share_mode, row.shareMode);
+        EXPECT_EQ(region->info.inheritance, row.inheritance);
+        EXPECT_EQ(region->info.external_pager, row.external);
+        EXPECT_EQ(region->info.user_wired_count, row.wired);
+        EXPECT_EQ(region->info.user_tag, 0u);
+        // Files' identities carry the top bit, anonymous memory's the next.
+        EXPECT_EQ(region->info.object_id_full >> (row.external ? 63 : 62), 1u);
+    }
+    const WalkedRegion* touched = regionAt(regions_, layout_.touched);
+    const WalkedRegion* mapped = regionAt(regions_, layout_.file);
+
+    // The touched pages each alike, the inaccessible page on either side
+    // never touched.
     kern_return_t result;
-    std::vector<WalkedRegion> regions = walk(platform, *task, result);
-    EXPECT_EQ(result, KERN_INVALID_ADDRESS);
-    ASSERT_GT(regions.size(), 5u);
-    for (size_t i = 1; i < regions.size(); ++i)
-        EXPECT_GE(regions[i].start, regions[i - 1].start + regions[i - 1].size) << "regions overlap or go back";
-
-    // Touched anonymous pages: resident and dirty, each page alike.
-    const WalkedRegion* touched = regionAt(regions, layout.touched);
-    ASSERT_NE(touched, nullptr);
-    EXPECT_EQ(touched->size, kTouchedPages * pageSize());
-    EXPECT_EQ(touched->info.pages_resident, kTouchedPages);
-    EXPECT_EQ(touched->info.pages_dirtied, kTouchedPages);
-    EXPECT_EQ(touched->info.share_mode, SM_PRIVATE);
-    EXPECT_EQ(touched->info.user_tag, 0u);
-    EXPECT_EQ(touched->info.external_pager, 0);
-    EXPECT_EQ(touched->info.object_id_full >> 62, 1u);
-    std::vector<int32_t> pages = dispositions(platform, *task, layout.touched, kTouchedPages, result);
-    ASSERT_EQ(result, KERN_SUCCESS);
-    for (size_t i = 0; i < kTouchedPages; ++i)
-        EXPECT_EQ(pages[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
-    // The inaccessible pages around them were never touched.
-    pages = dispositions(platform, *task, layout.touched - pageSize(), kTouchedPages + 2, result);
+    std::vector<int32_t> pages = dispositions(platform_, *task_, layout_.touched - pageSize(), kTouchedPages + 2, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     EXPECT_EQ(pages.front(), 0);
     EXPECT_EQ(pages.back(), 0);
-    EXPECT_EQ(pages[1], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY);
+    for (size_t i = 1; i <= kTouchedPages; ++i)
+        EXPECT_EQ(pages[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
 
-    const WalkedRegion* locked = regionAt(regions, layout.locked);
-    ASSERT_NE(locked, nullptr);
-    EXPECT_EQ(locked->info.user_wired_count, 1);
-    EXPECT_EQ(locked->info.pages_resident, kLockedPages);  // mlock faults the pages in
-    EXPECT_EQ(touched->info.user_wired_count, 0);
-
-    // The shared file mapping: an external pager, the written pages dirty
-    // (the test looks well within the kernel's 30 s before it writes dirty
-    // file pages back) and its path.
-    const WalkedRegion* mapped = regionAt(regions, layout.file);
-    ASSERT_NE(mapped, nullptr);
-    EXPECT_EQ(mapped->info.external_pager, 1);
-    EXPECT_EQ(mapped->info.share_mode, SM_SHARED);
-    EXPECT_EQ(mapped->info.inheritance, VM_INHERIT_SHARE);
-    EXPECT_EQ(mapped->info.pages_resident, kFileWrittenPages);
-    EXPECT_EQ(mapped->info.pages_dirtied, kFileWrittenPages);
-    EXPECT_EQ(mapped->info.object_id_full >> 63, 1u);
     char path[1024];
-    int length = platform.proc_regionfilename(*task, layout.file + pageSize(), path, sizeof(path));
-    EXPECT_EQ(std::string(path, static_cast<size_t>(std::max(length, 0))), file.path());
-    EXPECT_EQ(platform.proc_regionfilename(*task, layout.touched, path, sizeof(path)), 0);
-    pages = dispositions(platform, *task, layout.file, kFilePages, result);
+    int length = platform_.proc_regionfilename(*task_, layout_.file + pageSize(), path, sizeof(path));
+    EXPECT_EQ(std::string(path, static_cast<size_t>(std::max(length, 0))), filePath_);
+    EXPECT_EQ(platform_.proc_regionfilename(*task_, layout_.touched, path, sizeof(path)), 0);
+    pages = dispositions(platform_, *task_, layout_.file, kFilePages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     for (size_t i = 0; i < kFileWrittenPages; ++i) {
         int32_t expected = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
@@ -300,21 +233,21 @@ TEST(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
 
     // The same file mapped here names the same object; anonymous memory at
     // the same address in parent and child (the child is a fork) does not.
-    int fd = ::open(file.path().c_str(), O_RDONLY | O_CLOEXEC);
+    int fd = ::open(filePath_.c_str(), O_RDONLY | O_CLOEXEC);
     ASSERT_GE(fd, 0);
     void* own = ::mmap(nullptr, pageSize(), PROT_READ, MAP_SHARED, fd, 0);
     ::close(fd);
     ASSERT_NE(own, MAP_FAILED);
     std::shared_ptr<HTTaskPort> self;
-    ASSERT_EQ(platform.task_for_pid(::getpid(), &self), KERN_SUCCESS);
-    std::vector<WalkedRegion> ownRegions = walk(platform, *self, result);
+    ASSERT_EQ(platform_.task_for_pid(::getpid(), &self), KERN_SUCCESS);
+    std::vector<WalkedRegion> ownRegions = walk(platform_, *self, result);
     ::munmap(own, pageSize());
     const WalkedRegion* ownFile = regionAt(ownRegions, reinterpret_cast<uint64_t>(own));
     ASSERT_NE(ownFile, nullptr);
     EXPECT_EQ(ownFile->info.object_id_full, mapped->info.object_id_full);
     size_t sameStartAnonymous = 0;
     for (const WalkedRegion& region : ownRegions) {
-        const WalkedRegion* theirs = regionAt(regions, region.start);
+        const WalkedRegion* theirs = regionAt(regions_, region.start);
         if (theirs == nullptr || region.info.external_pager != 0 || (region.info.object_id_full >> 62) != 1) continue;
         ++sameStartAnonymous;
         EXPECT_NE(theirs->info.object_id_full, region.info.object_id_full);
@@ -322,34 +255,23 @@ TEST(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     EXPECT_GT(sameStartAnonymous, 0u);
 
     // The basic records name the same regions.
-    uint64_t address = layout.touched + pageSize();
+    uint64_t address = layout_.touched + pageSize();
     uint64_t size = 0;
     uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;
     vm_region_basic_info_64 basic{};
-    ASSERT_EQ(platform.mach_vm_region(*task, &address, &size, &basic, &count), KERN_SUCCESS);
-    EXPECT_EQ(address, layout.touched);
+    ASSERT_EQ(platform_.mach_vm_region(*task_, &address, &size, &basic, &count), KERN_SUCCESS);
+    EXPECT_EQ(address, layout_.touched);
     EXPECT_EQ(size, touched->size);
     EXPECT_EQ(basic.protection, VM_PROT_READ | VM_PROT_WRITE);
     EXPECT_EQ(basic.shared, 0u);
 
     int32_t state = VM_PURGABLE_NONVOLATILE;
-    EXPECT_NE(platform.mach_vm_purgable_control(*task, layout.touched, VM_PURGABLE_GET_STATE, &state), KERN_SUCCESS);
+    EXPECT_NE(platform_.mach_vm_purgable_control(*task_, layout_.touched, VM_PURGABLE_GET_STATE, &state), KERN_SUCCESS);
 }
 
-TEST(HTLinuxAddressSpace, PagesFreedWithMadvFreeAreReusable)
+TEST_F(HTLinuxAddressSpace, PagesFreedWithMadvFreeAreReusable)
 {
-    ScratchFile file;
-    ASSERT_TRUE(file.ok());
-    LaidOutChild child(file.path());
-    ASSERT_TRUE(child.ready());
-    ASSERT_EQ(child.layout().error, 0) << "step " << child.layout().step << ": " << std::strerror(child.layout().error);
-
-    HTLinuxPlatform platform;
-    std::shared_ptr<HTTaskPort> task;
-    ASSERT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
-    kern_return_t result;
-    std::vector<WalkedRegion> regions = walk(platform, *task, result);
-    const WalkedRegion* freed = regionAt(regions, child.layout().freed);
+    const WalkedRegion* freed = regionAt(regions_, layout_.freed);
     ASSERT_NE(freed, nullptr);
     if (freed->info.pages_reusable == 0) GTEST_SKIP() << "the kernel reports no LazyFree pages for MADV_FREE memory";
     // Still resident (nothing reclaimed them), none dirty any more.
@@ -358,13 +280,14 @@ TEST(HTLinuxAddressSpace, PagesFreedWithMadvFreeAreReusable)
     EXPECT_EQ(freed->info.pages_dirtied, 0u);
 
     if (!pageFlagsReadable()) GTEST_SKIP() << "reusable pages show in page queries only with /proc/kpageflags (root)";
-    std::vector<int32_t> pages = dispositions(platform, *task, child.layout().freed, kFreedPages, result);
+    kern_return_t result;
+    std::vector<int32_t> pages = dispositions(platform_, *task_, layout_.freed, kFreedPages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     for (size_t i = 0; i < kFreedPages; ++i)
         EXPECT_EQ(pages[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE) << "page " << i;
 }
 
-TEST(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
+TEST_F(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
 {
     // Anonymous memory that is only read holds the shared zero page on most
     // kernels (and, in a huge-page-aligned stretch, the huge zero page); a
@@ -383,13 +306,13 @@ TEST(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
     for (size_t i = 0; i < pages; ++i) sink = static_cast<char>(sink + aligned[i * page]);
     aligned[kHuge + 4 * page] = sink;  // one page written among the read ones
 
-    HTLinuxPlatform platform;
+    // Of the test itself, not of the child.
     std::shared_ptr<HTTaskPort> task;
-    ASSERT_EQ(platform.task_for_pid(::getpid(), &task), KERN_SUCCESS);
+    ASSERT_EQ(platform_.task_for_pid(::getpid(), &task), KERN_SUCCESS);
     kern_return_t result;
-    walk(platform, *task, result);
+    walk(platform_, *task, result);
     const auto start = reinterpret_cast<uint64_t>(aligned);
-    std::vector<int32_t> answers = dispositions(platform, *task, start, pages, result);
+    std::vector<int32_t> answers = dispositions(platform_, *task, start, pages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
 
     int pagemap = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
@@ -416,63 +339,45 @@ TEST(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
     ::munmap(base, 3 * kHuge);
 }
 
-TEST(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
+TEST_F(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
 {
-    ScratchFile file;
-    ASSERT_TRUE(file.ok());
-    LaidOutChild child(file.path());
-    ASSERT_TRUE(child.ready());
-    HTLinuxPlatform platform;
-    std::shared_ptr<HTTaskPort> task;
-    ASSERT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
     // Parsed and with its pagemap open while the child lives.
+    ASSERT_FALSE(regions_.empty());
     kern_return_t result;
-    ASSERT_FALSE(walk(platform, *task, result).empty());
-    dispositions(platform, *task, child.layout().touched, 1, result);
+    dispositions(platform_, *task_, layout_.touched, 1, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     rusage_info_v4 usage{};
-    ASSERT_EQ(platform.proc_pid_rusage(child.pid(), RUSAGE_INFO_V4, &usage), 0);
+    ASSERT_EQ(platform_.proc_pid_rusage(child_.pid(), RUSAGE_INFO_V4, &usage), 0);
 
-    child.release();
-    ASSERT_TRUE(child.child().waitForZombie());
-    EXPECT_TRUE(walk(platform, *task, result).empty());
-    EXPECT_EQ(result, MACH_SEND_INVALID_DEST);
-    dispositions(platform, *task, child.layout().touched, 1, result);
-    EXPECT_EQ(result, KERN_INVALID_ARGUMENT);
-    errno = 0;
-    EXPECT_EQ(platform.proc_pid_rusage(child.pid(), RUSAGE_INFO_V4, &usage), -1);
-    EXPECT_EQ(errno, ESRCH);
-
-    int32_t pid = child.pid();
-    child.child().reap();
-    EXPECT_TRUE(walk(platform, *task, result).empty());
-    EXPECT_EQ(result, MACH_SEND_INVALID_DEST);
-    dispositions(platform, *task, child.layout().touched, 1, result);
-    EXPECT_EQ(result, KERN_INVALID_ARGUMENT);
+    const int32_t pid = child_.pid();
+    ::kill(pid, SIGCONT);
+    ASSERT_TRUE(child_.waitForZombie());
+    for (bool reaped : {false, true}) {
+        if (reaped) child_.reap();
+        SCOPED_TRACE(reaped ? "reaped" : "zombie");
+        EXPECT_TRUE(walk(platform_, *task_, result).empty());
+        EXPECT_EQ(result, MACH_SEND_INVALID_DEST);
+        dispositions(platform_, *task_, layout_.touched, 1, result);
+        EXPECT_EQ(result, KERN_INVALID_ARGUMENT);
+        errno = 0;
+        EXPECT_EQ(platform_.proc_pid_rusage(pid, RUSAGE_INFO_V4, &usage), -1);
+        EXPECT_EQ(errno, ESRCH);
+    }
     // Later look-ups do not answer from the mappings read while it lived.
     uint64_t address = 0x1000;
     uint64_t size = 0;
     uint32_t count = VM_REGION_BASIC_INFO_COUNT_64;
     vm_region_basic_info_64 basic{};
-    EXPECT_EQ(platform.mach_vm_region(*task, &address, &size, &basic, &count), MACH_SEND_INVALID_DEST);
-    errno = 0;
-    EXPECT_EQ(platform.proc_pid_rusage(pid, RUSAGE_INFO_V4, &usage), -1);
-    EXPECT_EQ(errno, ESRCH);
+    EXPECT_EQ(platform_.mach_vm_region(*task_, &address, &size, &basic, &count), MACH_SEND_INVALID_DEST);
     ledger_entry_info entry{};
     int entries = 1;
-    EXPECT_EQ(platform.ledger_entries(pid, &entry, &entries), -1);
+    EXPECT_EQ(platform_.ledger_entries(pid, &entry, &entries), -1);
 }
 
-TEST(HTLinuxAddressSpace, PhysicalHeftPageTableLedgerAndPaths)
+TEST_F(HTLinuxAddressSpace, PhysicalHeftPageTableLedgerAndPaths)
 {
-    ScratchFile file;
-    ASSERT_TRUE(file.ok());
-    LaidOutChild child(file.path());
-    ASSERT_TRUE(child.ready());
-    HTLinuxPlatform platform;
-
     rusage_info_v4 usage{};
-    ASSERT_EQ(platform.proc_pid_rusage(child.pid(), RUSAGE_INFO_V4, &usage), 0);
+    ASSERT_EQ(platform_.proc_pid_rusage(child_.pid(), RUSAGE_INFO_V4, &usage), 0);
     // At least the pages the child wrote and locked (its lazily freed pages
     // may or may not still count), and some page tables.
     EXPECT_GE(usage.ri_phys_heft, (kTouchedPages + kLockedPages) * pageSize());
@@ -480,18 +385,18 @@ TEST(HTLinuxAddressSpace, PhysicalHeftPageTableLedgerAndPaths)
 
     std::vector<ledger_template_info> names(80);
     int count = static_cast<int>(names.size());
-    ASSERT_EQ(platform.ledger_template(names.data(), &count), 0);
+    ASSERT_EQ(platform_.ledger_template(names.data(), &count), 0);
     ASSERT_EQ(count, 1);
     EXPECT_STREQ(names[0].lti_name, "page_table");
     std::vector<ledger_entry_info> entries(static_cast<size_t>(count));
-    ASSERT_EQ(platform.ledger_entries(child.pid(), entries.data(), &count), 0);
+    ASSERT_EQ(platform_.ledger_entries(child_.pid(), entries.data(), &count), 0);
     ASSERT_EQ(count, 1);
     // Page tables come in whole pages; the child has at least one.
     EXPECT_GT(entries[0].lei_balance, 0);
     EXPECT_EQ(entries[0].lei_balance % static_cast<int64_t>(pageSize()), 0);
     EXPECT_LT(static_cast<uint64_t>(entries[0].lei_balance), usage.ri_phys_heft);
 
-    std::optional<std::string> resolved = platform.realpath("/tmp/.." + file.path());
-    EXPECT_EQ(resolved, std::optional<std::string>(file.path()));
-    EXPECT_EQ(platform.realpath(file.path() + ".missing"), std::nullopt);
+    std::optional<std::string> resolved = platform_.realpath("/tmp/.." + filePath_);
+    EXPECT_EQ(resolved, std::optional<std::string>(filePath_));
+    EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
 }

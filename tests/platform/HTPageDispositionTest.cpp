@@ -26,42 +26,52 @@ constexpr HTPageMapping kSharedMemory{true, false};
 constexpr HTPageMapping kHugetlb{false, true};
 constexpr HTPageMapping kCleanFile{false, false, true, false};
 constexpr HTPageMapping kPlainAnonymous{false, false, false, true};
+constexpr HTPageMapping kPrivateFile{false, false, false, false, true};
+
+constexpr uint64_t kNoFlags = ~uint64_t{0};  // the page flags could not be read
 
 int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPrivate)
 {
-    return htPageDisposition(entry, &flags, mapping);
+    return htPageDisposition(entry, flags == kNoFlags ? nullptr : &flags, mapping);
 }
 
-TEST(HTPageDisposition, WithPhysicalPageFlags)
+TEST(HTPageDisposition, FromPagemapAndPageFlags)
 {
-    // Anonymous memory and shared memory are swap-backed: dirty while present.
-    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON | HT_KPF_SWAPBACKED), kPresent | kDirty);
-    EXPECT_EQ(withFlags(kFileEntry, HT_KPF_SWAPBACKED, kSharedMemory), kPresent | kDirty);
-    // File pages: external, dirty only when the kernel says so.
-    EXPECT_EQ(withFlags(kFileEntry, 0), kPresent | kExternal);
-    EXPECT_EQ(withFlags(kFileEntry, HT_KPF_DIRTY), kPresent | kExternal | kDirty);
-    // Freed with MADV_FREE: anonymous without swap backing.
-    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON), kPresent | kReusable);
-    // hugetlbfs pages carry no swap-backed flag yet are neither external nor
-    // reusable.
-    EXPECT_EQ(withFlags(kPresentEntry, HT_KPF_ANON, kHugetlb), kPresent | kDirty);
-    EXPECT_EQ(withFlags(kFileEntry, 0, kHugetlb), kPresent | kDirty);
-    // The shared zero page of a read-only touch: present, clean.
-    EXPECT_EQ(withFlags(kPresentEntry, 0), kPresent);
-}
-
-TEST(HTPageDisposition, FromThePagemapAlone)
-{
-    EXPECT_EQ(htPageDisposition(0, nullptr, kPrivate), 0);
-    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT, nullptr, kPrivate), kPresent | kDirty);
-    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT | HT_PAGEMAP_FILE_OR_SHARED, nullptr, kPrivate),
-              kPresent | kExternal);
-    // Shared memory pages carry the file bit but have no file behind them.
-    EXPECT_EQ(htPageDisposition(HT_PAGEMAP_PRESENT | HT_PAGEMAP_FILE_OR_SHARED, nullptr, kSharedMemory),
-              kPresent | kDirty);
-    EXPECT_EQ(htPageDisposition(kSwappedEntry, nullptr, kPrivate), kPagedOut);
-    // Page flags never apply to a page that is not present.
-    EXPECT_EQ(withFlags(kSwappedEntry, HT_KPF_ANON), kPagedOut);
+    constexpr int32_t kCopied = VM_PAGE_QUERY_PAGE_COPIED;
+    struct Row { uint64_t entry, flags; HTPageMapping mapping; int32_t expected; };
+    const Row rows[] = {
+        // Anonymous memory and shared memory are swap-backed: dirty while present.
+        {kPresentEntry, HT_KPF_ANON | HT_KPF_SWAPBACKED, kPrivate, kPresent | kDirty},
+        {kFileEntry, HT_KPF_SWAPBACKED, kSharedMemory, kPresent | kDirty},
+        // File pages: external, dirty only when the kernel says so.
+        {kFileEntry, 0, kPrivate, kPresent | kExternal},
+        {kFileEntry, HT_KPF_DIRTY, kPrivate, kPresent | kExternal | kDirty},
+        // Freed with MADV_FREE: anonymous without swap backing.
+        {kPresentEntry, HT_KPF_ANON, kPrivate, kPresent | kReusable},
+        // hugetlbfs pages carry no swap-backed flag yet are neither external nor reusable.
+        {kPresentEntry, HT_KPF_ANON, kHugetlb, kPresent | kDirty},
+        {kFileEntry, 0, kHugetlb, kPresent | kDirty},
+        // The shared zero page of a read-only touch: present, clean.
+        {kPresentEntry, 0, kPrivate, kPresent},
+        // From the pagemap alone.
+        {0, kNoFlags, kPrivate, 0},
+        {HT_PAGEMAP_PRESENT, kNoFlags, kPrivate, kPresent | kDirty},
+        {kFileEntry, kNoFlags, kPrivate, kPresent | kExternal},
+        // Shared memory pages carry the file bit but have no file behind them.
+        {kFileEntry, kNoFlags, kSharedMemory, kPresent | kDirty},
+        {kFileEntry, kNoFlags, kHugetlb, kPresent | kDirty},
+        {kSwappedEntry, kNoFlags, kPrivate, kPagedOut},
+        // Page flags never apply to a page that is not present.
+        {kSwappedEntry, HT_KPF_ANON, kPrivate, kPagedOut},
+        // A private file mapping's anonymous pages are copies made on write.
+        {kPresentEntry, kNoFlags, kPrivateFile, kPresent | kDirty | kCopied},
+        {kSwappedEntry, kNoFlags, kPrivateFile, kPagedOut | kCopied},
+        {kFileEntry, kNoFlags, kPrivateFile, kPresent | kExternal},
+        {0, kNoFlags, kPrivateFile, 0},
+    };
+    for (const Row& row : rows)
+        EXPECT_EQ(withFlags(row.entry, row.flags, row.mapping), row.expected)
+            << std::hex << row.entry << " flags " << row.flags;
     EXPECT_EQ(htPagemapFrame(kSwappedEntry), 0u);
     EXPECT_EQ(htPagemapFrame(kFileEntry), kFrame);
 }
@@ -96,7 +106,7 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
         for (HTPageMapping mapping : mappings) {
             if (htPageFlagsMatter(entry, mapping)) continue;
             for (uint64_t flags : possibleFlags(entry, mapping))
-                EXPECT_EQ(withFlags(entry, flags, mapping), htPageDisposition(entry, nullptr, mapping))
+                EXPECT_EQ(withFlags(entry, flags, mapping), withFlags(entry, kNoFlags, mapping))
                     << std::hex << entry << " " << flags;
         }
     }
@@ -111,27 +121,10 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPlainAnonymous));
 }
 
-TEST(HTPageDisposition, CopiesOfAPrivateFileMappingAreMarked)
-{
-    HTPageMapping privateFile;
-    privateFile.privateFile = true;
-    const int32_t copied = VM_PAGE_QUERY_PAGE_COPIED;
-    EXPECT_EQ(htPageDisposition(kPresentEntry, nullptr, privateFile) & copied, copied);
-    EXPECT_EQ(htPageDisposition(kSwappedEntry, nullptr, privateFile) & copied, copied);
-    EXPECT_EQ(htPageDisposition(kFileEntry, nullptr, privateFile) & copied, 0);
-    EXPECT_EQ(htPageDisposition(0, nullptr, privateFile), 0);
-    EXPECT_EQ(htPageDisposition(kPresentEntry, nullptr, kPrivate) & copied, 0);
-}
-
 TEST(HTPageDisposition, SharedPageIdentities)
 {
     constexpr uint64_t kExclusive = HT_PAGEMAP_EXCLUSIVE;
-    struct Row {
-        uint64_t entry;
-        bool swapShared;
-        bool zeroPage;
-        bool named;
-    };
+    struct Row { uint64_t entry; bool swapShared, zeroPage, named; };
     const Row rows[] = {
         {kPresentEntry, false, false, true},               // resident, mapped by others too
         {kPresentEntry | kExclusive, false, false, false},  // mapped here alone

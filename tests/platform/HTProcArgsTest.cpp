@@ -79,26 +79,19 @@ TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
     EXPECT_EQ(buffer.view().back(), '\n');
     size_t grown = buffer.capacity();
 
-    ASSERT_TRUE(buffer.readFile(AT_FDCWD, "/proc/self/stat"));
-    EXPECT_LT(buffer.size(), 4096u);
+    // status is written whole: its last line arrives in the first read.
+    ASSERT_TRUE(buffer.readFile(AT_FDCWD, "/proc/self/status", HTProcBuffer::End::ShortRead));
+    EXPECT_EQ(buffer.view().find("Name:"), 0u);
+    EXPECT_NE(buffer.view().find("\nnonvoluntary_ctxt_switches:"), std::string_view::npos);
     EXPECT_EQ(buffer.capacity(), grown);
-    EXPECT_EQ(buffer.view().find(std::to_string(getpid()) + " ("), 0u);
 
     errno = 0;
     EXPECT_FALSE(buffer.readFile(AT_FDCWD, "/proc/self/no-such-file"));
     EXPECT_EQ(errno, ENOENT);
     EXPECT_EQ(buffer.size(), 0u);
-}
 
-TEST(HTProcBuffer, ShortReadEndsOnlyFilesWrittenWhole)
-{
-    HTProcBuffer buffer;
-    // status is written whole: its last line arrives in the first read.
-    ASSERT_TRUE(buffer.readFile(AT_FDCWD, "/proc/self/status", HTProcBuffer::End::ShortRead));
-    EXPECT_NE(buffer.view().find("\nnonvoluntary_ctxt_switches:"), std::string_view::npos);
-    EXPECT_EQ(buffer.view().back(), '\n');
-
-    // A file larger than the buffer fills it, grows it and goes on to the end.
+    // A file larger than a fresh buffer fills it, grows it and goes on to
+    // the end, also where a short read could end a /proc file.
     char path[] = "/tmp/heft-procbuffer-XXXXXX";
     int fd = ::mkstemp(path);
     ASSERT_GE(fd, 0);

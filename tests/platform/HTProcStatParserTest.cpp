@@ -45,52 +45,42 @@ TEST(HTProcStatParser, ReadsTheFieldsOfACapturedLine)
 TEST(HTProcStatParser, CommRunsToTheLastParenthesis)
 {
     // A process may call itself anything, parentheses and blanks included;
-    // the fields after the name must not shift.
-    auto stat = htParseProcStat("1234 ((a) b)) S 77 1234 1234 0 -1 4194560 0 0 0 0 0 0 0 0 39 19 1 0 500 0 0\n");
-    ASSERT_TRUE(stat);
-    EXPECT_EQ(stat->comm, "(a) b)");
-    EXPECT_EQ(stat->state, 'S');
-    EXPECT_EQ(stat->ppid, 77);
-    EXPECT_EQ(stat->nice, 19);
-    EXPECT_EQ(stat->starttime, 500u);
-    EXPECT_EQ(stat->startstack, 0u) << "the line stops before the stack address";
-
-    auto blanks = htParseProcStat("9 ( x  ) ) Z 1 9 9 0 -1 4 0 0 0 0 0 0 0 0 20 -5 1 0 7 0 0");
-    ASSERT_TRUE(blanks);
-    EXPECT_EQ(blanks->comm, " x  ) ");
-    EXPECT_EQ(blanks->state, 'Z');
-    EXPECT_EQ(blanks->nice, -5);
-    EXPECT_EQ(htProcStatusForState(blanks->state), SZOMB);
-
-    auto empty = htParseProcStat("10 () S 1 10 10 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0");
-    ASSERT_TRUE(empty);
-    EXPECT_EQ(empty->comm, "");
+    // the fields after the name must not shift. The last line stops before
+    // the stack address.
+    struct Row { const char* line; const char* comm; char state; int32_t ppid, nice; uint64_t starttime; };
+    const Row rows[] = {
+        {"1234 ((a) b)) S 77 1234 1234 0 -1 4194560 0 0 0 0 0 0 0 0 39 19 1 0 500 0 0\n", "(a) b)", 'S', 77, 19, 500},
+        {"9 ( x  ) ) Z 1 9 9 0 -1 4 0 0 0 0 0 0 0 0 20 -5 1 0 7 0 0", " x  ) ", 'Z', 1, -5, 7},
+        {"10 () S 1 10 10 0 -1 0 0 0 0 0 0 0 0 0 20 0 1 0 9 0 0", "", 'S', 1, 0, 9},
+    };
+    for (const Row& row : rows) {
+        auto stat = htParseProcStat(row.line);
+        ASSERT_TRUE(stat) << row.line;
+        EXPECT_EQ(stat->comm, row.comm);
+        EXPECT_EQ(stat->state, row.state);
+        EXPECT_EQ(stat->ppid, row.ppid);
+        EXPECT_EQ(stat->nice, row.nice);
+        EXPECT_EQ(stat->starttime, row.starttime);
+        EXPECT_EQ(stat->startstack, 0u);
+    }
 }
 
-TEST(HTProcStatParser, RejectsEmptyTruncatedAndMalformedInput)
+TEST(HTProcStatParser, RejectsTruncatedAndMalformedInput)
 {
-    EXPECT_FALSE(htParseProcStat(""));
-    EXPECT_FALSE(htParseProcStat("\n"));
-    // Cut inside the name, after the state, after the flags, before the
-    // start time.
-    EXPECT_FALSE(htParseProcStat("3892 (ca"));
-    EXPECT_FALSE(htParseProcStat("3892 (cat) R"));
-    EXPECT_FALSE(htParseProcStat("3892 (cat) R 3889 3889 2229 34816 3892 4194304"));
-    EXPECT_FALSE(htParseProcStat(kCatStat.substr(0, kCatStat.find(" 36232"))));
-    // Garbage where numbers belong, and no pid.
-    EXPECT_FALSE(htParseProcStat("3892 (cat) R x 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0"));
-    EXPECT_FALSE(htParseProcStat("(cat) R 1 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0"));
-    EXPECT_FALSE(htParseProcStat("3892 cat) R 1 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0"));
     // A capture cut anywhere before the start time is refused, never misread.
     size_t startTime = kCatStat.find(" 36232") + 1;
     for (size_t length = 0; length <= startTime; ++length)
         EXPECT_FALSE(htParseProcStat(kCatStat.substr(0, length))) << "length " << length;
+    // Garbage where numbers belong, no pid, no opening parenthesis.
+    for (const char* line : {"\n", "3892 (cat) R x 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0",
+                             "(cat) R 1 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0",
+                             "3892 cat) R 1 3889 2229 34816 3892 4194304 0 0 0 0 0 0 0 0 20 0 1 0 1 0 0"})
+        EXPECT_FALSE(htParseProcStat(line)) << line;
 }
 
 TEST(HTProcStatParser, StateLettersMapToRecordStatus)
 {
-    EXPECT_EQ(htProcStatusForState('R'), SRUN);
-    for (char state : {'S', 'D', 'I'}) EXPECT_EQ(htProcStatusForState(state), SSLEEP) << state;
-    for (char state : {'T', 't'}) EXPECT_EQ(htProcStatusForState(state), SSTOP) << state;
-    EXPECT_EQ(htProcStatusForState('Z'), SZOMB);
+    const std::pair<char, uint32_t> rows[] = {{'R', SRUN},  {'S', SSLEEP}, {'D', SSLEEP}, {'I', SSLEEP},
+                                              {'T', SSTOP}, {'t', SSTOP},  {'Z', SZOMB},  {'X', SZOMB}};
+    for (auto [state, status] : rows) EXPECT_EQ(htProcStatusForState(state), status) << state;
 }

@@ -10,6 +10,7 @@
 #include <fcntl.h>
 #include <filesystem>
 #include <functional>
+#include <spawn.h>
 #include <string>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -52,38 +53,17 @@ public:
         return ::waitid(P_PID, static_cast<id_t>(pid_), &info, WEXITED | WNOWAIT) == 0;
     }
 
-    // Starts the program at `path`; returns once exec has succeeded, so the
-    // child already shows the new program in /proc. Invalid on failure.
+    // Starts the program at `path`; returns once exec has succeeded (the C
+    // library's posix_spawn resumes the caller only after the child's exec),
+    // so the child already shows the new program in /proc. Invalid on failure.
     static HTTestChild exec(const std::string& path, const std::vector<std::string>& arguments)
     {
-        int status[2];
-        if (::pipe2(status, O_CLOEXEC) != 0) return HTTestChild();
-        pid_t pid = ::fork();
-        if (pid < 0) {
-            ::close(status[0]);
-            ::close(status[1]);
-            return HTTestChild();
-        }
-        if (pid == 0) {
-            ::close(status[0]);
-            std::vector<char*> argv;
-            for (const auto& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
-            argv.push_back(nullptr);
-            ::execv(path.c_str(), argv.data());
-            int error = errno;
-            (void)!::write(status[1], &error, sizeof(error));
-            ::_exit(127);
-        }
-        ::close(status[1]);
-        // The pipe closes on exec (no bytes) or carries exec's errno.
-        int error = 0;
-        ssize_t count;
-        while ((count = ::read(status[0], &error, sizeof(error))) < 0 && errno == EINTR) {
-        }
-        ::close(status[0]);
-        HTTestChild child(pid);
-        if (count != 0) child.reap();
-        return child;
+        std::vector<char*> argv;
+        for (const auto& argument : arguments) argv.push_back(const_cast<char*>(argument.c_str()));
+        argv.push_back(nullptr);
+        pid_t pid = -1;
+        if (::posix_spawn(&pid, path.c_str(), nullptr, nullptr, argv.data(), environ) != 0) return HTTestChild();
+        return HTTestChild(pid);
     }
 
     // Forks a child that runs `body` and exits with its result.
