@@ -56,14 +56,20 @@ protected:
         return selection;
     }
 
-    static HTHeftArgs argsWithTargets(std::initializer_list<std::string> operands,
-                                      std::initializer_list<int32_t> pids = {})
+    static HTHeftArgs argsWithTargets(std::vector<std::string> operands, std::vector<int32_t> pids = {},
+                                      std::vector<std::string> excluded = {})
     {
+        auto set = [](const std::vector<std::string>& values) {
+            HTOrderedStringSet made;
+            for (const auto& value : values) made.add(value);
+            return made;
+        };
         HTHeftArgs args;
-        args.setPotentialTargetProcesses(HTOrderedStringSet(operands));
+        args.setPotentialTargetProcesses(set(operands));
         HTHeftArgs::PidMap pidMap;
         for (int32_t pid : pids) pidMap.set(pid, std::nullopt);
         args.setTargetPids(pidMap);
+        args.setExcludedPidsOrProcesses(set(excluded));
         return args;
     }
 
@@ -81,118 +87,69 @@ TEST_F(HTTargetSelectionTest, NothingToAnalyseIsAnError)
     EXPECT_EQ(selection.standardError, "");
 }
 
-TEST_F(HTTargetSelectionTest, NamesSelectEveryProcessOfThatName)
+TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
 {
-    // "100" and "worker" both reach pid 100: one process for it.
-    HTHeftArgs args = argsWithTargets({"worker", "100", "init"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{100, 201, 203, 1}));
-    EXPECT_EQ(selection.standardError, "");
-    EXPECT_EQ(args.targetPids().find(201)->value_or(""), "worker");
-    EXPECT_FALSE(*args.targetPids().find(100)) << "given by pid after being found by name";
-}
-
-TEST_F(HTTargetSelectionTest, UnknownOperandsAreReportedAndTheOthersKept)
-{
-    HTHeftArgs args = argsWithTargets({"nosuchthing", "shell", "99999"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{200}));
-    EXPECT_EQ(selection.standardError,
-              "Unable to find pid for process matching 'nosuchthing'\n"
-              "Unable to find pid for process matching '99999'\n");
-}
-
-TEST_F(HTTargetSelectionTest, ExcludesItselfAndTheExcludedProcesses)
-{
-    HTHeftArgs args = argsWithTargets({"heft", "worker"}, {kOwnPid});
-    args.setExcludedPidsOrProcesses(HTOrderedStringSet{"201", "helper", "nosuchthing"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{501, 100, 203}));
-    // Exclusions that match nothing stay silent; excluded pids are not
-    // "unable to analyze".
-    EXPECT_EQ(selection.standardError, "");
-
-    HTHeftArgs onlySelf = argsWithTargets({}, {kOwnPid});
-    selection = select(onlySelf);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_TRUE(selection.processes->empty());
-}
-
-TEST_F(HTTargetSelectionTest, DescendantsAreAddedAfterTheExclusions)
-{
-    HTHeftArgs args = argsWithTargets({"shell"});
-    args.setTargetChildren(true);
-    args.setExcludedPidsOrProcesses(HTOrderedStringSet{"202"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    // heft's own pid is a child of the shell too: -t reaches it as well.
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{200, 201, 202, 500, 501, 203}));
-    for (const auto& [pid, name] : args.targetPids()) EXPECT_FALSE(name) << pid;
-
-    // An excluded target has no descendants to add.
-    HTHeftArgs excludedRoot = argsWithTargets({}, {202});
-    excludedRoot.setTargetChildren(true);
-    excludedRoot.setExcludedPidsOrProcesses(HTOrderedStringSet{"helper"});
-    selection = select(excludedRoot);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_TRUE(selection.processes->empty());
-}
-
-TEST_F(HTTargetSelectionTest, AllProcessesButItselfAndTheExcluded)
-{
-    HTHeftArgs args = argsWithTargets({"nosuchthing"}, {1});
-    args.setTargetAll(true);
-    args.setExcludedPidsOrProcesses(HTOrderedStringSet{"worker"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{0, 1, 200, 202, 501}));
-    // The operands are not looked at under -a.
-    EXPECT_EQ(selection.standardError, "");
-
-    HTHeftArgs allAlone;
-    allAlone.setTargetAll(true);
-    selection = select(allAlone);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.processes->size(), 8u);
-}
-
-TEST_F(HTTargetSelectionTest, UnmappedSearchHidesEveryOtherProcessButTheKernel)
-{
-    HTHeftArgs args = argsWithTargets({}, {201});
-    args.setSearchForUnmapped(true);
-    args.setExcludedPidsOrProcesses(HTOrderedStringSet{"init"});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{100, 200, 202, 203, 501, 201}));
-    for (const auto& process : *selection.processes)
-        EXPECT_EQ(process->hiddenFromDisplay(), process->pid() != 201) << process->pid();
-}
-
-TEST_F(HTTargetSelectionTest, SkipDropsIdleExitCleanProcesses)
-{
-    for (int32_t pid : {100, 201}) {
-        HTFakePlatform::Process* process = platform_->process(pid);
-        process->dirtyErrno = 0;
-        process->dirtyFlags = PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT;
+    enum Option { kNone = 0, kAll = 1, kChildren = 2, kUnmapped = 4, kSkipClean = 8 };
+    // 100 and 201 may exit when idle and are clean; 203 may too but is dirty.
+    for (int32_t pid : {100, 201, 203}) {
+        platform_->process(pid)->dirtyErrno = 0;
+        platform_->process(pid)->dirtyFlags =
+            PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT | (pid == 203 ? PROC_DIRTY_IS_DIRTY : 0);
     }
-    // Idle-exit capable but dirty: kept.
-    platform_->process(203)->dirtyErrno = 0;
-    platform_->process(203)->dirtyFlags = PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT | PROC_DIRTY_IS_DIRTY;
+    struct Row {
+        const char* what;
+        std::vector<std::string> operands;
+        std::vector<int32_t> pids;
+        std::vector<std::string> excluded;
+        int options;
+        std::vector<int32_t> selected;
+        std::string standardError;
+    } rows[] = {
+        {"a name selects every process of that name; pid 100 is reached twice, selected once",
+         {"worker", "100", "init"}, {}, {}, kNone, {100, 201, 203, 1}, ""},
+        {"unknown operands are reported and the others kept",
+         {"nosuchthing", "shell", "99999"}, {}, {}, kNone, {200},
+         "Unable to find pid for process matching 'nosuchthing'\n"
+         "Unable to find pid for process matching '99999'\n"},
+        {"heft leaves itself out; exclusions that match nothing stay silent",
+         {"heft", "worker"}, {kOwnPid}, {"201", "helper", "nosuchthing"}, kNone, {501, 100, 203}, ""},
+        {"heft alone", {}, {kOwnPid}, {}, kNone, {}, ""},
+        {"descendants come after the exclusions, heft's own pid among them",
+         {"shell"}, {}, {"202"}, kChildren, {200, 201, 202, 500, 501, 203}, ""},
+        {"an excluded target has no descendants to add", {}, {202}, {"helper"}, kChildren, {}, ""},
+        {"all but heft and the excluded; operands not looked at",
+         {"nosuchthing"}, {1}, {"worker"}, kAll, {0, 1, 200, 202, 501}, ""},
+        {"all", {}, {}, {}, kAll, {0, 1, 100, 200, 201, 202, 203, 501}, ""},
+        {"the unmapped search adds every other process but the kernel and the excluded",
+         {}, {201}, {"init"}, kUnmapped, {100, 200, 202, 203, 501, 201}, ""},
+        {"idle-exit clean processes skipped", {"worker", "shell"}, {}, {}, kSkipClean, {203, 200}, ""},
+        {"only idle-exit clean processes", {}, {100, 201}, {}, kSkipClean, {}, ""},
+    };
+    for (const Row& row : rows) {
+        HTHeftArgs args = argsWithTargets(row.operands, row.pids, row.excluded);
+        args.setTargetAll(row.options & kAll);
+        args.setTargetChildren(row.options & kChildren);
+        args.setSearchForUnmapped(row.options & kUnmapped);
+        args.setSkipIdleExitClean(row.options & kSkipClean);
+        Selection selection = select(args);
+        ASSERT_TRUE(selection.processes) << row.what;
+        EXPECT_EQ(selection.pids(), row.selected) << row.what;
+        EXPECT_EQ(selection.standardError, row.standardError) << row.what;
+        // Only the unmapped search hides processes: all but the ones asked for.
+        for (const auto& process : *selection.processes)
+            EXPECT_EQ(process->hiddenFromDisplay(), (row.options & kUnmapped) && process->pid() != 201) << row.what;
+    }
 
-    HTHeftArgs args = argsWithTargets({"worker", "shell"});
-    args.setSkipIdleExitClean(true);
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{203, 200}));
-
-    HTHeftArgs onlyClean = argsWithTargets({}, {100, 201});
-    onlyClean.setSkipIdleExitClean(true);
-    selection = select(onlyClean);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_TRUE(selection.processes->empty());
+    // Names found stay with their pids, unless the pid was given too; -t
+    // finds descendants by pid.
+    HTHeftArgs named = argsWithTargets({"worker", "100"});
+    select(named);
+    EXPECT_EQ(named.targetPids().find(201)->value_or(""), "worker");
+    EXPECT_FALSE(*named.targetPids().find(100));
+    HTHeftArgs children = argsWithTargets({"shell"});
+    children.setTargetChildren(true);
+    select(children);
+    for (const auto& [pid, name] : children.targetPids()) EXPECT_FALSE(name) << pid;
 }
 
 TEST_F(HTTargetSelectionTest, UnreadableProcessesAreNamedAsTheyWereGiven)

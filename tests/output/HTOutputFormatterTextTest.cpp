@@ -1,10 +1,13 @@
-// The text report's size rendering and its category tables: the private and
-// shared tables and the summary across processes. Expected texts are written
-// out in full, spaces counted by hand from the column widths.
+// The text report's pieces that whole reports (analysis/HTReportGoldenTest)
+// do not reach: size rendering, path shortening and row order as values, and
+// the tables, titles, headers, listings, diagnostics and auxiliary data of
+// other formats and options, written to one expected report.
 
 #include "output/HTOutputFormatterText.h"
 
 #include "analysis/HTProcessGroup.h"
+#include "model/HTAuxData.h"
+#include "model/HTAuxDataMap.h"
 #include "model/HTCategoryMap.h"
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
@@ -12,12 +15,12 @@
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
+#include "output/HTExpectedReport.h"
 #include "output/HTOutputCapture.h"
 
 #include <gtest/gtest.h>
 
 #include <cstdio>
-#include <cstdlib>
 #include <memory>
 #include <optional>
 #include <string>
@@ -27,8 +30,6 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
-using Capture = HTOutputCapture;
-
 // Exposes the protected helpers.
 class TextFormatter : public HTOutputFormatterText {
 public:
@@ -37,12 +38,19 @@ public:
     using HTOutputFormatterText::_truncatedNameForString;
 };
 
-std::shared_ptr<HTProcess> process(int32_t pid, const std::string& displayString, uint64_t pageSize = kPage)
+// A process source that failed: errors can only be added from inside.
+class TestProcess : public HTProcess {
+public:
+    using HTProcess::HTProcess;
+    void fail(std::string error) { addError(std::move(error)); }
+};
+
+std::shared_ptr<TestProcess> process(int32_t pid, const std::string& name, uint64_t pageSize = kPage)
 {
-    auto made = std::make_shared<HTProcess>(std::make_shared<HTFakePlatform>());
+    auto made = std::make_shared<TestProcess>(std::make_shared<HTFakePlatform>());
     made->setPid(pid);
-    made->setName(displayString.substr(0, displayString.find(' ')));
-    made->setDisplayString(displayString);
+    made->setName(name);
+    made->setDisplayString(name + " [" + std::to_string(pid) + "]");
     made->setIs64bit(true);
     made->setPageSize(pageSize);
     return made;
@@ -97,7 +105,7 @@ HTCategoryMap sampleCategories()
 const HTMemoryTotals kTotal{10 * 1024 * 1024, 2 * 1024 * 1024, 1536, 0, 16384, 12};
 
 // A frozen group of the given members, in that order.
-std::shared_ptr<HTProcessGroup> group(const std::vector<std::shared_ptr<HTProcess>>& members)
+std::shared_ptr<HTProcessGroup> group(const std::vector<std::shared_ptr<TestProcess>>& members)
 {
     auto made = std::make_shared<HTProcessGroup>();
     for (const auto& member : members) made->addProcess(member);
@@ -105,122 +113,74 @@ std::shared_ptr<HTProcessGroup> group(const std::vector<std::shared_ptr<HTProces
     return made;
 }
 
-const std::string kRule70(70, '=');
-const std::string kRule80(80, '=');
+std::shared_ptr<HTMemoryRegion> region(uint64_t start, uint64_t size, uint64_t objectId, const char* name,
+                                       std::optional<std::string> detail = std::nullopt)
+{
+    auto made = std::make_shared<HTMemoryRegion>();
+    made->setStart(start);
+    made->setSize(size);
+    made->setObject_id(objectId);
+    made->setName(name);
+    made->setDetailedName(std::move(detail));
+    return made;
+}
+
+std::shared_ptr<HTAuxDataMap> auxMap(std::initializer_list<std::pair<std::string, HTAuxDataMap::Value>> entries)
+{
+    auto made = std::make_shared<HTAuxDataMap>();
+    for (const auto& [key, value] : entries) made->set(key, value);
+    return made;
+}
+
+HTAuxDataMap::Value datum(int64_t value) { return std::make_shared<HTAuxData>(value, true); }
 
 }  // namespace
 
 TEST(HTOutputFormatterText, RendersSizesInEachFormat)
 {
-    Capture out;
-    HTOutputFormatterText bytes(HTTextFormatBytes, 0, "Dirty", true, out.file());
-    EXPECT_EQ(bytes.formattedStringForSize(0), "0 B");
-    EXPECT_EQ(bytes.formattedStringForSize(16384), "16384 B");
-
-    HTOutputFormatterText pages(HTTextFormatPages, 0, "Dirty", true, out.file());
-    EXPECT_EQ(pages.formattedStringForSize(12345), "0 pages");  // no page size yet
-    pages.setPageSize(16384);
-    EXPECT_EQ(pages.formattedStringForSize(0), "0 pages");
-    EXPECT_EQ(pages.formattedStringForSize(1), "1 pages");
-    EXPECT_EQ(pages.formattedStringForSize(16384), "1 pages");
-    EXPECT_EQ(pages.formattedStringForSize(16385), "2 pages");
-    EXPECT_EQ(pages.formattedStringForSize(UINT64_MAX), "1125899906842624 pages");
-
-    // Powers of 1024, no decimals, at most four digits before the unit.
-    HTOutputFormatterText formatted(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-    EXPECT_EQ(formatted.formattedStringForSize(0), "0 B");
-    EXPECT_EQ(formatted.formattedStringForSize(1023), "1023 B");
-    EXPECT_EQ(formatted.formattedStringForSize(1024), "1024 B");
-    EXPECT_EQ(formatted.formattedStringForSize(1536), "1536 B");
-    EXPECT_EQ(formatted.formattedStringForSize(16384), "16 KB");
-    EXPECT_EQ(formatted.formattedStringForSize(10 * 1024 * 1024), "10 MB");
-    EXPECT_EQ(formatted.formattedStringForSize(1023 * 1024), "1023 KB");
-    EXPECT_EQ(formatted.formattedStringForSize(2 * 1024 * 1024), "2048 KB");
+    // Formatted: powers of 1024, no decimals, at most four digits before the unit.
+    struct Row {
+        int64_t format;
+        uint64_t pageSize, size;
+        const char* expected;
+    } rows[] = {
+        {HTTextFormatBytes, 0, 0, "0 B"},
+        {HTTextFormatBytes, 0, 16384, "16384 B"},
+        {HTTextFormatPages, 0, 12345, "0 pages"},  // no page size yet
+        {HTTextFormatPages, 16384, 0, "0 pages"},
+        {HTTextFormatPages, 16384, 1, "1 pages"},
+        {HTTextFormatPages, 16384, 16384, "1 pages"},
+        {HTTextFormatPages, 16384, 16385, "2 pages"},
+        {HTTextFormatPages, 16384, UINT64_MAX, "1125899906842624 pages"},
+        {HTTextFormatFormatted, 0, 0, "0 B"},
+        {HTTextFormatFormatted, 0, 1023, "1023 B"},
+        {HTTextFormatFormatted, 0, 1024, "1024 B"},
+        {HTTextFormatFormatted, 0, 1536, "1536 B"},
+        {HTTextFormatFormatted, 0, 16384, "16 KB"},
+        {HTTextFormatFormatted, 0, 10 * 1024 * 1024, "10 MB"},
+        {HTTextFormatFormatted, 0, 1023 * 1024, "1023 KB"},
+        {HTTextFormatFormatted, 0, 2 * 1024 * 1024, "2048 KB"},
+    };
+    HTOutputCapture out;
+    for (const Row& row : rows) {
+        HTOutputFormatterText formatter(row.format, 0, "Dirty", true, out.file());
+        if (row.pageSize) formatter.setPageSize(row.pageSize);
+        EXPECT_EQ(formatter.formattedStringForSize(row.size), row.expected) << row.format << " " << row.size;
+    }
     EXPECT_EQ(out.take(), "");
 }
 
 TEST(HTOutputFormatterText, ShortensPathsUnlessWide)
 {
-    Capture out;
-    TextFormatter narrow(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-    EXPECT_EQ(narrow._truncatedNameForString("/usr/lib/libexample"), ".../libexample");
-    EXPECT_EQ(narrow._truncatedNameForString("libexample"), "libexample");
-    EXPECT_EQ(narrow._truncatedNameForString("/usr/lib/"), ".../lib");
-    EXPECT_EQ(narrow._truncatedNameForString("/"), "/");
-    EXPECT_EQ(narrow._truncatedNameForString(""), "");
+    TextFormatter narrow(HTTextFormatFormatted, 0, "Dirty", true, stdout);
+    for (const auto& [path, shown] : std::vector<std::pair<std::string, std::string>>{
+             {"/usr/lib/libexample", ".../libexample"}, {"libexample", "libexample"}, {"/usr/lib/", ".../lib"},
+             {"/", "/"}, {"", ""}})
+        EXPECT_EQ(narrow._truncatedNameForString(path), shown) << path;
     EXPECT_EQ(narrow._truncatedNameForString(std::nullopt), std::nullopt);
 
-    TextFormatter wide(HTTextFormatFormatted, 7, "Dirty", true, out.file());
+    TextFormatter wide(HTTextFormatFormatted, 7, "Dirty", true, stdout);
     EXPECT_EQ(wide._truncatedNameForString("/usr/lib/libexample"), "/usr/lib/libexample");
-}
-
-TEST(HTOutputFormatterText, EmptyTableColumnsFollowFormatAndOptions)
-{
-    HTCategoryMap none;
-    {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-        formatter.printProcessCategories(none, kTotal);
-        EXPECT_EQ(out.take(),
-                  "  Dirty      Clean  Reclaimable    Regions    Category\n"
-                  "    ---        ---          ---        ---    ---\n"
-                  "    ---        ---          ---        ---    ---\n"
-                  "  12 MB     1536 B          0 B         12    TOTAL\n"
-                  "\n");
-    }
-    {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatFormatted, 7, "Dirty", true, out.file());
-        formatter.printProcessCategories(none, kTotal);
-        EXPECT_EQ(out.take(),
-                  "  Dirty  (Swapped)      Clean  Reclaimable    (Wired)    Regions    Category\n"
-                  "    ---        ---        ---          ---        ---        ---    ---\n"
-                  "    ---        ---        ---          ---        ---        ---    ---\n"
-                  "  12 MB    2048 KB     1536 B          0 B      16 KB         12    TOTAL\n"
-                  "\n");
-    }
-    {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatBytes, HTTextOptionSwapped, "Dirty", true, out.file());
-        formatter.printProcessCategories(none, kTotal);
-        EXPECT_EQ(out.take(),
-                  "      Dirty     (Swapped)         Clean   Reclaimable    Regions    Category\n"
-                  "        ---           ---           ---           ---        ---    ---\n"
-                  "        ---           ---           ---           ---        ---    ---\n"
-                  " 12582912 B     2097152 B        1536 B           0 B         12    TOTAL\n"
-                  "\n");
-    }
-    {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatPages, HTTextOptionWired, "Dirty", true, out.file());
-        formatter.setPageSize(16384);
-        formatter.printProcessCategories(none, kTotal);
-        EXPECT_EQ(out.take(),
-                  "      Dirty         Clean   Reclaimable       (Wired)    Regions    Category\n"
-                  "        ---           ---           ---           ---        ---    ---\n"
-                  "        ---           ---           ---           ---        ---    ---\n"
-                  "  768 pages       1 pages       0 pages       1 pages         12    TOTAL\n"
-                  "\n");
-    }
-}
-
-TEST(HTOutputFormatterText, PrivateTableRowsSortedByDirty)
-{
-    Capture out;
-    HTOutputFormatterText formatter(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-    const HTMemoryTotals total{20480, 4096, 24576, 4096, 8192, 7};
-    formatter.printProcessCategories(sampleCategories(), total);
-    EXPECT_EQ(out.take(),
-              "  Dirty      Clean  Reclaimable    Regions    Category\n"
-              "    ---        ---          ---        ---    ---\n"
-              "  12 KB        0 B          0 B          1    MALLOC_SMALL\n"
-              " 4096 B        0 B       4096 B          3    stack\n"
-              " 4096 B      16 KB          0 B          2    __TEXT .../libexample\n"
-              " 4096 B     8192 B          0 B          1    __DATA libplain\n"
-              "    0 B        0 B          0 B          0    unnamed\n"
-              "    ---        ---          ---        ---    ---\n"
-              "  24 KB      24 KB       4096 B          7    TOTAL\n"
-              "\n");
 }
 
 TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
@@ -232,6 +192,8 @@ TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
         return formatter._sortedKeysForCategories(categories);
     };
     // Equal rows keep the map's order.
+    EXPECT_EQ(keysSortedBy("Dirty"),
+              (Keys{"MALLOC_SMALL", "stack", "__TEXT /usr/lib/libexample", "__DATA libplain", "unnamed"}));
     EXPECT_EQ(keysSortedBy("Swapped"),
               (Keys{"MALLOC_SMALL", "__DATA libplain", "__TEXT /usr/lib/libexample", "stack", "unnamed"}));
     EXPECT_EQ(keysSortedBy("Clean"),
@@ -249,106 +211,128 @@ TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
     EXPECT_DEATH(keysSortedBy("dirty"), "HTOutputFormatterText.*Unhandled text sort column");
 }
 
-TEST(HTOutputFormatterText, SharedTableTitles)
+// Each piece is written after a line naming it, all into text-pieces.txt.
+TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
 {
-    std::vector<std::shared_ptr<HTProcess>> members;
-    for (int32_t pid = 101; pid <= 121; ++pid)
-        members.push_back(process(pid, "p" + std::to_string(pid) + " [" + std::to_string(pid) + "]"));
+    HTOutputCapture out;
+    std::string report;
+    auto piece = [&](const char* what) { report += out.take() + "--- " + what + "\n"; };
+    // Headers that only set up the counts are left out of the report.
+    auto quietly = [&](auto print) { report += out.take(); print(); out.take(); };
+    using Text = HTOutputFormatterText;
+
+    piece("empty tables: formatted wide, bytes swapped, pages wired");
+    Text(HTTextFormatFormatted, 7, "Dirty", true, out.file()).printProcessCategories({}, kTotal);
+    Text(HTTextFormatBytes, HTTextOptionSwapped, "Dirty", true, out.file()).printProcessCategories({}, kTotal);
+    Text pages(HTTextFormatPages, HTTextOptionWired, "Dirty", true, out.file());
+    pages.setPageSize(16384);
+    pages.printProcessCategories({}, kTotal);
+
+    piece("private table sorted by dirty, an unnamed category under its key");
+    Text formatted(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    formatted.printProcessCategories(sampleCategories(), HTMemoryTotals{20480, 4096, 24576, 4096, 8192, 7});
+
+    piece("shared tables: sizes wider than their column; 19 others named; 20 others counted");
+    std::vector<std::shared_ptr<TestProcess>> members;
+    for (int32_t pid = 101; pid <= 121; ++pid) members.push_back(process(pid, "p" + std::to_string(pid)));
     const auto& self = *members[1];
+    HTCategoryMap big;
+    addCategory(big, "big", "big", std::nullopt, {1000000000, 0, 0, 0, 0, 1});
+    Text(HTTextFormatBytes, 0, "Dirty", true, out.file())
+        .printSharedCategories(big, *group({members[0], members[1]}), self, false, {1000000000, 0, 0, 0, 0, 1});
+    formatted.printSharedCategories({}, *group({members.begin(), members.begin() + 20}), self, true, {});
+    formatted.printSharedCategories({}, *group(members), self, false, {});
 
-    HTCategoryMap one;
-    addCategory(one, "big", "big", std::nullopt, {1000000000, 0, 0, 0, 0, 1});
-    const HTMemoryTotals total{1000000000, 0, 0, 0, 0, 1};
-
-    {
-        // Sizes wider than their column widen the row. The member's own
-        // name is left out of the title.
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatBytes, 0, "Dirty", true, out.file());
-        formatter.printSharedCategories(one, *group({members[0], members[1]}), self, false, total);
-        EXPECT_EQ(out.take(),
-                  "Shared with p101 [101]:\n"
-                  "      Dirty         Clean   Reclaimable    Regions    Category\n"
-                  "        ---           ---           ---        ---    ---\n"
-                  "1000000000 B           0 B           0 B          1    big\n"
-                  "        ---           ---           ---        ---    ---\n"
-                  "1000000000 B           0 B           0 B          1    TOTAL\n"
-                  "\n");
-    }
-
-    Capture out;
-    HTOutputFormatterText formatter(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-    HTCategoryMap none;
-    const std::string emptyTable =
-        "  Dirty      Clean  Reclaimable    Regions    Category\n"
-        "    ---        ---          ---        ---    ---\n"
-        "    ---        ---          ---        ---    ---\n"
-        "    0 B        0 B          0 B          0    TOTAL\n"
-        "\n";
-
-    auto twenty = group(std::vector<std::shared_ptr<HTProcess>>(members.begin(), members.begin() + 20));
-    formatter.printSharedCategories(none, *twenty, self, true, HTMemoryTotals{});
-    std::string names;
-    for (int32_t pid = 101; pid <= 120; ++pid) {
-        if (pid == 102) continue;
-        names += " p" + std::to_string(pid) + " [" + std::to_string(pid) + "]" + (pid == 120 ? ":" : ",");
-    }
-    EXPECT_EQ(out.take(), "Shared with" + names + "\n" + emptyTable);
-
-    formatter.printSharedCategories(none, *group(members), self, false, HTMemoryTotals{});
-    EXPECT_EQ(out.take(), "Shared with 21 processes:\n" + emptyTable);
-}
-
-TEST(HTOutputFormatterText, SummaryOfOneProcessIsTheModeLineAtMost)
-{
-    HTCategoryMap none;
+    piece("summaries: one process with and without the breakdown; two; pages of the last process, swapped");
     for (bool breakDown : {true, false}) {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatFormatted, 0, "Dirty", breakDown, out.file());
-        formatter.printProcessHeader(*process(812, "cat [812]"));
-        out.take();
-        formatter.printSummaryCategories(none, kTotal, true);
-        EXPECT_EQ(out.take(), breakDown ? "" : "VM Object Dirty Analysis: Enabled\n");
+        Text one(HTTextFormatFormatted, 0, "Dirty", breakDown, out.file());
+        quietly([&] { one.printProcessHeader(*process(812, "cat")); });
+        one.printSummaryCategories({}, kTotal, true);
     }
-}
+    Text two(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    quietly([&] {
+        two.printProcessHeader(*process(1, "a"));
+        two.printProcessHeader(*process(2, "b"));
+    });
+    HTCategoryMap stack;
+    addCategory(stack, "stack", "stack", std::nullopt, {4096, 0, 0, 4096, 0, 3});
+    two.printSummaryCategories(stack, {20480, 4096, 24576, 4096, 8192, 7}, false);
+    Text three(HTTextFormatPages, HTTextOptionSwapped, "Dirty", false, out.file());
+    quietly([&] {
+        for (int32_t pid : {1, 2, 3}) three.printProcessHeader(*process(pid, "p", pid == 1 ? 4096 : 16384));
+    });
+    EXPECT_EQ(three.processCount(), 2);
+    three.printSummaryCategories({}, {16384, 16385, 1, 0, 0, 2}, true);
 
-TEST(HTOutputFormatterText, SummaryOfSeveralProcesses)
-{
-    {
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatFormatted, 0, "Dirty", true, out.file());
-        formatter.printProcessHeader(*process(1, "a [1]"));
-        formatter.printProcessHeader(*process(2, "b [2]"));
-        out.take();
-        HTCategoryMap categories;
-        addCategory(categories, "stack", "stack", std::nullopt, {4096, 0, 0, 4096, 0, 3});
-        const HTMemoryTotals total{20480, 4096, 24576, 4096, 8192, 7};
-        formatter.printSummaryCategories(categories, total, false);
-        EXPECT_EQ(out.take(), kRule70 + "\n" +
-                                  "Summary Heft: 24 KB\n" + kRule70 + "\n\n" +
-                                  "  Dirty      Clean  Reclaimable    Regions    Category\n"
-                                  "    ---        ---          ---        ---    ---\n"
-                                  " 4096 B        0 B       4096 B          3    stack\n"
-                                  "    ---        ---          ---        ---    ---\n"
-                                  "  24 KB      24 KB       4096 B          7    TOTAL\n");
-    }
-    {
-        // Pages are counted with the page size of the last process printed,
-        // and the rule grows with the swapped column.
-        Capture out;
-        HTOutputFormatterText formatter(HTTextFormatPages, HTTextOptionSwapped, "Dirty", false, out.file());
-        formatter.printProcessHeader(*process(1, "a [1]", 4096));
-        formatter.printProcessHeader(*process(2, "b [2]", 16384));
-        formatter.printProcessHeader(*process(3, "c [3]", 16384));
-        EXPECT_EQ(formatter.processCount(), 2);
-        out.take();
-        const HTMemoryTotals total{16384, 16385, 1, 0, 0, 2};
-        formatter.printSummaryCategories(HTCategoryMap{}, total, true);
-        EXPECT_EQ(out.take(), "VM Object Dirty Analysis: Enabled\n" + kRule80 + "\n" +
-                                  "Summary Heft: 3 pages (may be invalid due to errors)\n" + kRule80 + "\n\n" +
-                                  "      Dirty     (Swapped)         Clean   Reclaimable    Regions    Category\n"
-                                  "        ---           ---           ---           ---        ---    ---\n"
-                                  "        ---           ---           ---           ---        ---    ---\n"
-                                  "    3 pages       2 pages       1 pages       0 pages          2    TOTAL\n");
-    }
+    piece("listings: swapped and wired columns, odd sizes, an unmapped region; wide without a page size; empty");
+    auto text = region(0x100000, 2 * 4096 + 1, 0x123456789abcULL, "__TEXT", "/usr/lib/libexample");
+    text->setDirtySize(4096);
+    text->setSwappedSize(1);
+    text->setCleanNonSpecSize(4096);
+    text->setWired(true);
+    auto owned = region(HTNoAddress, 4096, 0x2a, "owned unmapped memory");
+    owned->setDirtySize(4096);
+    owned->setReclaimableSize(4095);
+    Text(HTTextFormatBytes, HTTextOptionSwapped | HTTextOptionWired, "Dirty", true, out.file())
+        .printSpanlistLikeOutputForProcess(*process(812, "cat"), {text, owned});
+    auto far = region(0x7f0000001000, 4096, 7, "__TEXT", "/usr/lib/libexample");
+    far->setDirtySize(4096);
+    Text wide(HTTextFormatFormatted, HTTextOptionWide, "Dirty", true, out.file());
+    wide.printSpanlistLikeOutputForProcess(*process(9, "odd", 0), {far});
+    wide.printSpanlistLikeOutputForProcess(*process(10, "idle"), {});
+
+    piece("headers: clean; 32-bit with warnings; failed with warnings and errors; the rule of all columns");
+    Text headers(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    auto clean = process(812, "cat", 16384);
+    headers.printProcessHeader(*clean);
+    headers.printProcessTotal(3 * 16384, *clean);
+    headers.endProcessHeader(*clean);
+    EXPECT_EQ(headers.pageSize(), 16384u);
+    auto warned = process(7, "old");
+    warned->setIs64bit(false);
+    warned->warnings() = {"process exited while being examined", "second warning"};
+    headers.printProcessHeader(*warned);
+    headers.printProcessTotal(0, *warned);
+    headers.endProcessHeader(*warned);
+    EXPECT_EQ(headers.pageSize(), 4096u);
+    auto failed = process(9, "bad");
+    failed->warnings() = {"w"};
+    failed->fail("task_for_pid failed");
+    failed->fail("second error");
+    headers.printProcessHeader(*failed);
+    headers.endProcessHeader(*failed);
+    EXPECT_EQ(headers.processCount(), 2);
+    Text all(HTTextFormatBytes, HTTextOptionWide | HTTextOptionSwapped | HTTextOptionWired, "Dirty", true, out.file());
+    all.printProcessHeader(*process(812, "cat"));
+    all.printProcessTotal(4096, *process(812, "cat"));
+    all.endProcessHeader(*process(812, "cat"));
+
+    piece("diagnostics: none; warnings alone; warnings, errors and run errors; run errors alone");
+    formatted.printProcessesWithWarnings({}, {}, {});
+    formatted.printProcessesWithWarnings({process(1, "launchd"), process(2, "cat")}, {}, {});
+    formatted.printProcessesWithWarnings({process(1, "launchd")}, {process(3, "bad")},
+                                         {"task_for_pid(4) failed", "interrupted"});
+    formatted.printProcessesWithWarnings({}, {}, {"interrupted"});
+
+    piece("auxiliary data: nested in the order set; empty; none; in pages");
+    formatted.printProcessAuxData(auxMap({
+        {"phys_heft", datum(16384)},
+        {"ledger", auxMap({{"page_table", datum(4096)}, {"purgeable", auxMap({{"volatile", datum(0)}})}})},
+        {"tail", datum(1024)},
+    }));
+    formatted.printProcessAuxData(std::make_shared<HTAuxDataMap>());
+    formatted.printProcessAuxData(nullptr);
+    pages.setPageSize(4096);
+    pages.printProcessAuxData(auxMap({{"phys_heft", datum(4097)}}));
+
+    piece("run-wide auxiliary data: one process; two; none");
+    Text global(HTTextFormatBytes, 0, "Dirty", true, out.file());
+    quietly([&] { global.printProcessHeader(*process(1, "a")); });
+    global.printGlobalAuxData(auxMap({{"phys_heft", datum(8192)}}));
+    quietly([&] { global.printProcessHeader(*process(2, "b")); });
+    global.printGlobalAuxData(auxMap({{"phys_heft", datum(8192)}}));
+    global.printGlobalAuxData(nullptr);
+    global.end();
+
+    expectReport("text-pieces.txt", report + out.take());
 }

@@ -1,0 +1,28 @@
+#pragma once
+
+// Expected reports are files under tests/data/reports/. When a change to the
+// output is meant, run the tests with HEFT_UPDATE_REPORTS=1: every report a
+// test compares is written back from what heft prints now, and the diff of
+// tests/data/ shows what changed.
+
+#include <gtest/gtest.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <sstream>
+#include <string>
+
+inline void expectReport(const std::string& name, const std::string& actual)
+{
+    const std::string path = std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name;
+    const char* update = std::getenv("HEFT_UPDATE_REPORTS");
+    if (update && *update && std::string(update) != "0") {
+        std::ofstream(path, std::ios::binary) << actual;
+        return;
+    }
+    std::ifstream in(path, std::ios::binary);
+    ASSERT_TRUE(in) << path << " is missing; HEFT_UPDATE_REPORTS=1 writes it";
+    std::stringstream expected;
+    expected << in.rdbuf();
+    EXPECT_EQ(actual, expected.str()) << "differs from " << path;
+}
