@@ -565,40 +565,35 @@ bool HTUserProcess::_addRegionsToArray(std::vector<std::shared_ptr<HTMemoryRegio
 
 // --- page dispositions -------------------------------------------------------------
 
-bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages,
+bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages, bool populatedOnly,
                                                              const DispositionChunkCallback& block)
 {
     if (pages == 0) return true;
     HT_ASSERT(kModule, task_ != nullptr, "task");
     const uint64_t page = pageSize();
-    int32_t dispositions[kDispositionChunkPages];
-    const uint64_t chunks = (pages + kDispositionChunkPages - 1) / kDispositionChunkPages;
-    uint64_t address = start;
-    uint64_t remaining = pages;
     const uint64_t end = start + pages * page;
-    // The next page known to hold something; chunks wholly before it hold
-    // nothing and are handed over without a query (as a null array).
-    uint64_t populated = 0;
-    for (uint64_t chunk = 0; chunk < chunks; ++chunk) {
-        const uint64_t wanted = std::min(remaining, kDispositionChunkPages);
-        if (populated < address) populated = platform().firstPopulatedAddress(*task_, address, end);
-        if (populated >= address + wanted * page) {
-            block(nullptr, wanted, chunk, chunks);
-            address += kDispositionChunkPages * page;
-            remaining -= wanted;
-            continue;
+    thread_local std::vector<std::pair<uint64_t, uint64_t>> runs;
+    if (populatedOnly)
+        platform().populatedRuns(*task_, start, end, runs);
+    else
+        runs.assign(1, {start, end});
+
+    int32_t dispositions[kDispositionChunkPages];
+    for (const auto& [runStart, runEnd] : runs) {
+        const uint64_t from = std::max(start, roundDown(runStart, page));
+        const uint64_t to = std::min(end, roundUp(runEnd, page));
+        for (uint64_t address = from; address < to; address += kDispositionChunkPages * page) {
+            const uint64_t wanted = std::min((to - address) / page, kDispositionChunkPages);
+            uint64_t count = wanted;
+            kern_return_t result =
+                platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
+            if (result != KERN_SUCCESS) {
+                platform().mach_error("mach_vm_page_range_query", result);
+                _processMachVMError(result, KERN_INVALID_ARGUMENT);
+                return false;
+            }
+            block(dispositions, std::min(count, wanted), (address - start) / page);
         }
-        uint64_t count = wanted;
-        kern_return_t result =
-            platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
-        if (result != KERN_SUCCESS) {
-            platform().mach_error("mach_vm_page_range_query", result);
-            _processMachVMError(result, KERN_INVALID_ARGUMENT);
-            return false;
-        }
-        block(dispositions, std::min(count, wanted), chunk, chunks);
-        address += kDispositionChunkPages * page;
-        remaining -= wanted;
     }
     return true;
 }
@@ -652,10 +647,10 @@ bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<H
     }
 
     const bool ok = _enumerateDispositionChunksWithStartAddr(
-        queryStart, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t) {
+        queryStart, pages, false, [&](const int32_t* dispositions, uint64_t filled, uint64_t firstPage) {
             for (uint64_t i = 0; i < filled; ++i) {
-                const uint64_t index = chunk * kDispositionChunkPages + i;
-                const int32_t disposition = dispositions ? dispositions[i] : 0;
+                const uint64_t index = firstPage + i;
+                const int32_t disposition = dispositions[i];
                 const bool partialFirst = index == 0 && !firstPageCached && start % page != 0;
                 const bool partialLast = index == pages - 1 && end % page != 0;
                 uint64_t amount = page;
@@ -711,10 +706,7 @@ void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageT
 
     // A failed query is recorded on the process; the runs found so far stay.
     _enumerateDispositionChunksWithStartAddr(
-        from, pages, [&](const int32_t* dispositions, uint64_t filled, uint64_t chunk, uint64_t) {
-            // A stretch with nothing in it leaves a gap in the runs.
-            if (dispositions == nullptr) return;
-            const uint64_t first = chunk * kDispositionChunkPages;
+        from, pages, true, [&](const int32_t* dispositions, uint64_t filled, uint64_t first) {
             const bool named = list && platform().sharedPageIdentities(*task_, from + first * page, filled,
                                                                        identities) == KERN_SUCCESS;
             for (uint64_t i = 0; i < filled; ++i) {

@@ -461,8 +461,11 @@ TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem
     for (uint64_t i = 4201; i < 5000; ++i) target().dispositions[start + i * kPage] = VM_PAGE_QUERY_PAGE_PRESENT;
 
     auto process = gathered();
+    // Only the populated runs are queried, a chunk of at most 4096 pages at a time.
     EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
-                                          {start, 4096 * kPage}, {start + 4096 * kPage, 904 * kPage}}));
+                                          {start + 10 * kPage, 4096 * kPage},
+                                          {start + 4106 * kPage, 94 * kPage},
+                                          {start + 4201 * kPage, 799 * kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{10 * kPage, 4190 * kPage, 4190 * kPage, 0, 0, 0, 0},
                                  {4201 * kPage, 799 * kPage, 0, 0, 799 * kPage, 0, 0}}));
@@ -470,9 +473,9 @@ TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem
 
 TEST_F(HTUserProcessSubrangeTest, EmptyStretchesOfSparseRegionsAreNotQueried)
 {
-    // A 64 GiB reservation with two dirty pages far apart: only the two
-    // chunks that hold them are queried, and the runs land where a query of
-    // every page would have put them.
+    // A 64 GiB reservation with two dirty pages far apart: only those two
+    // pages are queried, and the runs land where a query of every page
+    // would have put them.
     const uint64_t start = 0x100000000;
     const uint64_t pages = 16 * 1024 * 1024;
     addShared(start, pages, 0x1000);
@@ -481,10 +484,8 @@ TEST_F(HTUserProcessSubrangeTest, EmptyStretchesOfSparseRegionsAreNotQueried)
     target().dispositions[start + far * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
 
     auto process = gathered();
-    const uint64_t farChunk = far / 4096 * 4096;
-    EXPECT_EQ(platform_->pageQueries,
-              (std::vector<std::pair<uint64_t, uint64_t>>{{start, 4096 * kPage},
-                                                          {start + farChunk * kPage, 4096 * kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
+                                          {start + 7 * kPage, kPage}, {start + far * kPage, kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{0x1000 + 7 * kPage, kPage, kPage, 0, 0, 0, 0},
                                  {0x1000 + far * kPage, kPage, kPage, 0, 0, 0, 0}}));

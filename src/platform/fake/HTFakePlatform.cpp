@@ -292,17 +292,25 @@ kern_return_t HTFakePlatform::sharedPageIdentities(HTTaskPort& task, uint64_t ad
     return KERN_SUCCESS;
 }
 
-uint64_t HTFakePlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end)
+void HTFakePlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
+                                   std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
     Process* found = process(task.pid());
     // A process that is gone, or whose page queries are to fail, cannot be
     // scanned either: nothing is skipped and the query meets the failure.
-    if (found == nullptr || found->pageQueryFailureAddress) return start;
+    if (found == nullptr || found->pageQueryFailureAddress) {
+        runs.assign(1, {start, end});
+        return;
+    }
+    runs.clear();
     for (auto page = found->dispositions.lower_bound(start); page != found->dispositions.end() && page->first < end;
          ++page) {
-        if (page->second != 0) return page->first;
+        if (page->second == 0) continue;
+        if (!runs.empty() && runs.back().second == page->first)
+            runs.back().second += pageSize;
+        else
+            runs.emplace_back(page->first, page->first + pageSize);
     }
-    return end;
 }
 
 int HTFakePlatform::proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize)

@@ -134,7 +134,8 @@ public:
     kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
                                  uint32_t* count) override;
     kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
-    uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) override;
+    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
+                       std::vector<std::pair<uint64_t, uint64_t>>& runs) override;
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
     bool canIdentifySharedPages() override { return sharedPagesIdentifiable; }

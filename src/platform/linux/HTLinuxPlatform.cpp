@@ -824,13 +824,13 @@ bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
     return imageReader_.forEachTaskImage(static_cast<HTLinuxTaskPort&>(task), callback);
 }
 
-uint64_t HTLinuxPlatform::firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end)
+void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
+                                    std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
-    if (linuxTask == nullptr) return start;
-    int pagemap = linuxTask->pagemapFd();
-    if (pagemap < 0) return start;
-    return htPagemapFirstPopulated(pagemap, start, end).value_or(start);
+    int pagemap = linuxTask ? linuxTask->pagemapFd() : -1;
+    // A failed scan leaves the page queries to meet the failure themselves.
+    if (pagemap < 0 || !htPagemapPopulatedRuns(pagemap, start, end, runs)) runs.assign(1, {start, end});
 }
 
 bool HTLinuxPlatform::canIdentifySharedPages()

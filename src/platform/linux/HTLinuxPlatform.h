@@ -80,8 +80,10 @@ public:
     int ledger_template(ledger_template_info* entries, int* count) override;
     int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
     std::optional<std::string> realpath(const std::string& path) override;
-    // From the kernel's pagemap scan; `start` where the kernel lacks it.
-    uint64_t firstPopulatedAddress(HTTaskPort& task, uint64_t start, uint64_t end) override;
+    // From the kernel's pagemap scan; the whole range where the kernel
+    // lacks it.
+    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
+                       std::vector<std::pair<uint64_t, uint64_t>>& runs) override;
     // The ELF objects mapped by the task, with their segments.
     bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
                           const std::function<void(const HTPlatformImage&)>& callback) override;

@@ -56,12 +56,42 @@ std::optional<uint64_t> firstPageWithAny(int pagemapFd, uint64_t start, uint64_t
     return found == 0 ? end : region.start;
 }
 
-}  // namespace
-
-std::optional<uint64_t> htPagemapFirstPopulated(int pagemapFd, uint64_t start, uint64_t end)
+// The runs of pages in [start, end) that have all of `required` and any of
+// `anyOf`, in address order, adjacent runs joined. False when the kernel
+// does not offer the scan or it fails.
+bool collectRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf,
+                 std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
-    return firstPageWithAny(pagemapFd, start, end, kPageIsPresent | kPageIsSwapped);
+    runs.clear();
+    PageRegion found[256];
+    while (start < end) {
+        PagemapScanArg arg{};
+        arg.size = sizeof(arg);
+        arg.start = start;
+        arg.end = end;
+        arg.vec = reinterpret_cast<uint64_t>(found);
+        arg.vec_len = sizeof(found) / sizeof(found[0]);
+        arg.category_mask = required;
+        arg.category_anyof_mask = anyOf;
+        arg.return_mask = required | anyOf;
+        long count = ::ioctl(pagemapFd, kPagemapScan, &arg);
+        if (count < 0) return false;
+        for (long i = 0; i < count; ++i) {
+            // Runs of different categories may touch.
+            if (!runs.empty() && runs.back().second == found[i].start)
+                runs.back().second = found[i].end;
+            else
+                runs.emplace_back(found[i].start, found[i].end);
+        }
+        // The kernel says where its walk stopped: at `end`, or where the
+        // vector filled up.
+        if (arg.walk_end <= start) return false;
+        start = arg.walk_end;
+    }
+    return true;
 }
+
+}  // namespace
 
 std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint64_t end)
 {
@@ -73,24 +103,11 @@ std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint6
 bool htPagemapZeroPageRuns(int pagemapFd, uint64_t start, uint64_t end,
                            std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
-    runs.clear();
-    PageRegion found[64];
-    while (start < end) {
-        PagemapScanArg arg{};
-        arg.size = sizeof(arg);
-        arg.start = start;
-        arg.end = end;
-        arg.vec = reinterpret_cast<uint64_t>(found);
-        arg.vec_len = sizeof(found) / sizeof(found[0]);
-        arg.category_mask = kPageIsZeroFrame;
-        arg.return_mask = kPageIsZeroFrame;
-        long count = ::ioctl(pagemapFd, kPagemapScan, &arg);
-        if (count < 0) return false;
-        for (long i = 0; i < count; ++i) runs.emplace_back(found[i].start, found[i].end);
-        // The kernel says where its walk stopped: at `end`, or where the
-        // vector filled up.
-        if (arg.walk_end <= start) return false;
-        start = arg.walk_end;
-    }
-    return true;
+    return collectRuns(pagemapFd, start, end, kPageIsZeroFrame, 0, runs);
+}
+
+bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end,
+                            std::vector<std::pair<uint64_t, uint64_t>>& runs)
+{
+    return collectRuns(pagemapFd, start, end, 0, kPageIsPresent | kPageIsSwapped, runs);
 }
