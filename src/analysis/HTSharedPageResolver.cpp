@@ -8,6 +8,8 @@
 #include "process/HTProcess.h"
 
 #include <algorithm>
+#include <array>
+#include <utility>
 #include <unordered_map>
 
 namespace {
@@ -40,97 +42,43 @@ struct HTSharedPageResolver::Candidate {
     uint32_t firstOrdinal = 0;
 };
 
-// Every identity met, with the set of processes mapping it and where the
-// first of them maps it. Open addressing over a power-of-two table; the
-// identity 0 marks a free slot (the platform never names a page 0).
-class HTSharedPageResolver::IdentityTable {
-public:
-    struct Entry {
-        uint64_t identity;
-        uint32_t set;
-        // The page's number in the order pages were first met: consecutive
-        // pages of the first region that met them have consecutive numbers.
-        uint32_t ordinal;
-    };
-
-    // The entry of the identity, or a fresh one holding it with the other
-    // fields zero; `fresh` says which.
-    Entry& entryFor(uint64_t identity, bool& fresh)
-    {
-        if ((count_ + 1) * 4 > slots_.size() * 3) grow();
-        Entry& entry = slots_[slotFor(identity)];
-        fresh = entry.identity == 0;
-        if (fresh) {
-            entry = Entry{identity, 0, 0};
-            ++count_;
-        }
-        return entry;
-    }
-    const Entry& find(uint64_t identity) const
-    {
-        const Entry& entry = slots_[slotFor(identity)];
-        HT_ASSERT(kModule, entry.identity == identity, "identity registered");
-        return entry;
-    }
-
-private:
-    size_t slotFor(uint64_t identity) const
-    {
-        const size_t mask = slots_.size() - 1;
-        size_t slot = static_cast<size_t>(htMix(identity)) & mask;
-        while (slots_[slot].identity != 0 && slots_[slot].identity != identity) slot = (slot + 1) & mask;
-        return slot;
-    }
-    void grow()
-    {
-        std::vector<Entry> old(std::max<size_t>(1024, slots_.size() * 2));
-        old.swap(slots_);
-        for (const Entry& entry : old)
-            if (entry.identity != 0) slots_[slotFor(entry.identity)] = entry;
-    }
-
-    std::vector<Entry> slots_;
-    size_t count_ = 0;
-};
-
 // Sets of processes, each a sorted list of places in the process list,
-// under small numbers; set 0 is empty. A set grows one process at a time,
-// and the step from a set by a process is remembered, so that the pages of
-// one fork family, met process after process, find their set at once.
+// under small numbers; set 0 is the empty set. Pages are met sorted by
+// identity, and neighbouring identities mostly belong to one fork family,
+// so the set last asked for is tried first.
 class HTSharedPageResolver::ProcessSets {
 public:
     ProcessSets() : members_(1) {}
 
-    uint32_t adding(uint32_t set, uint32_t process)
+    uint32_t setOf(const std::vector<uint32_t>& members)
     {
-        const std::vector<uint32_t>& members = members_[set];
-        // Processes come in ascending order: one already in the set is last.
-        if (!members.empty() && members.back() == process) return set;
-        const uint64_t step = uint64_t{set} << 32 | process;
-        // Neighbouring pages mostly take the same step.
-        if (step == lastStep_) return lastResult_;
-        auto found = steps_.find(step);
-        if (found == steps_.end()) {
-            std::vector<uint32_t> grown = members;
-            grown.push_back(process);
-            found = steps_.emplace(step, static_cast<uint32_t>(members_.size())).first;
-            members_.push_back(std::move(grown));
+        if (members == members_[last_]) return last_;
+        auto found = numbers_.find(members);
+        if (found == numbers_.end()) {
+            found = numbers_.emplace(members, static_cast<uint32_t>(members_.size())).first;
+            members_.push_back(members);
         }
-        lastStep_ = step;
-        lastResult_ = found->second;
-        return lastResult_;
+        last_ = found->second;
+        return last_;
     }
     size_t size(uint32_t set) const { return members_[set].size(); }
 
 private:
+    struct Hash {
+        size_t operator()(const std::vector<uint32_t>& members) const
+        {
+            uint64_t hash = members.size();
+            for (uint32_t member : members) hash = htMix(hash ^ member);
+            return static_cast<size_t>(hash);
+        }
+    };
     std::vector<std::vector<uint32_t>> members_;
-    std::unordered_map<uint64_t, uint32_t> steps_;
-    uint64_t lastStep_ = UINT64_MAX;
-    uint32_t lastResult_ = 0;
+    std::unordered_map<std::vector<uint32_t>, uint32_t, Hash> numbers_;
+    uint32_t last_ = 0;
 };
 
 HTSharedPageResolver::HTSharedPageResolver(const ProcessList& processes)
-    : processes_(processes), identities_(std::make_unique<IdentityTable>()), sets_(std::make_unique<ProcessSets>())
+    : processes_(processes), sets_(std::make_unique<ProcessSets>())
 {
 }
 
@@ -147,25 +95,71 @@ void HTSharedPageResolver::resolve()
     registerPages();
     cutRegions();
     candidates_.clear();
-    identities_.reset();
+    pages_.clear();
+    pages_.shrink_to_fit();
     sets_.reset();
 }
 
 void HTSharedPageResolver::registerPages()
 {
+    // Every identified page gets a number, in the order of the candidates
+    // and of their pages: consecutive pages of one region have consecutive
+    // numbers.
+    std::vector<IdentifiedPage> identified;
+    size_t total = 0;
+    for (const Candidate& candidate : candidates_) total += candidate.region->sharedPageList()->identifiedPages();
+    identified.reserve(total);
     uint32_t ordinal = 0;
     for (Candidate& candidate : candidates_) {
         candidate.firstOrdinal = ordinal;
         const HTSharedPageList& list = *candidate.region->sharedPageList();
         for (const HTSharedPageList::Run& run : list.runs()) {
             if (run.firstIdentity == HTSharedPageList::kNoIdentity) continue;
-            for (uint32_t i = 0; i < run.count; ++i, ++ordinal) {
-                bool fresh = false;
-                IdentityTable::Entry& entry = identities_->entryFor(list.identity(run, i), fresh);
-                if (fresh) entry.ordinal = ordinal;
-                entry.set = sets_->adding(entry.set, candidate.process);
-            }
+            for (uint32_t i = 0; i < run.count; ++i)
+                identified.push_back(IdentifiedPage{list.identity(run, i), ordinal++, candidate.process});
         }
+    }
+
+    // Sorted by identity, the pages of one identity lie together, in the
+    // order they were numbered, so with their processes in ascending order.
+    sortByIdentity(identified);
+    pages_.assign(identified.size(), PageSet{});
+    std::vector<uint32_t> members;
+    for (size_t first = 0, next; first < identified.size(); first = next) {
+        members.clear();
+        for (next = first; next < identified.size() && identified[next].identity == identified[first].identity;
+             ++next) {
+            if (members.empty() || members.back() != identified[next].process)
+                members.push_back(identified[next].process);
+        }
+        // A page that one process alone maps stays its own (set 0).
+        const uint32_t set = members.size() > 1 ? sets_->setOf(members) : 0;
+        for (size_t at = first; at < next; ++at)
+            pages_[identified[at].ordinal] = PageSet{set, identified[first].ordinal};
+    }
+}
+
+void HTSharedPageResolver::sortByIdentity(std::vector<IdentifiedPage>& pages)
+{
+    // A radix sort a byte at a time from the lowest: stable, and a few
+    // passes over the pages where a comparison sort takes twenty. Bytes
+    // that are the same in every identity are skipped; frame and swap slot
+    // numbers are small, so most high bytes are.
+    constexpr unsigned kBytes = sizeof(uint64_t);
+    std::vector<std::array<uint32_t, 256>> counts(kBytes);
+    for (const IdentifiedPage& page : pages)
+        for (unsigned byte = 0; byte < kBytes; ++byte) ++counts[byte][(page.identity >> (8 * byte)) & 0xFF];
+
+    std::vector<IdentifiedPage> sorted;
+    for (unsigned byte = 0; byte < kBytes; ++byte) {
+        const unsigned shift = 8 * byte;
+        std::array<uint32_t, 256>& count = counts[byte];
+        if (pages.empty() || count[(pages[0].identity >> shift) & 0xFF] == pages.size()) continue;
+        uint32_t offset = 0;
+        for (uint32_t& slot : count) offset += std::exchange(slot, offset);
+        sorted.resize(pages.size());
+        for (const IdentifiedPage& page : pages) sorted[count[(page.identity >> shift) & 0xFF]++] = page;
+        pages.swap(sorted);
     }
 }
 
@@ -268,16 +262,17 @@ void HTSharedPageResolver::cutRegion(const Candidate& candidate, std::vector<std
     };
 
     uint32_t firstMapping = 0;
+    uint32_t ordinal = candidate.firstOrdinal;
     for (const HTSharedPageList::Run& run : list->runs()) {
         for (uint32_t i = 0; i < run.count; ++i) {
             const uint64_t index = uint64_t{run.firstPage} + i;
             if (run.firstIdentity != HTSharedPageList::kNoIdentity) {
-                const IdentityTable::Entry& entry = identities_->find(list->identity(run, i));
-                if (sets_->size(entry.set) > 1) {
+                const PageSet& entry = pages_[ordinal++];
+                if (entry.set != 0) {
                     // The object's pages lie in the order the first process
                     // maps them: the same place in every process's piece.
-                    firstMapping = candidateOfOrdinal(entry.ordinal, firstMapping);
-                    const uint64_t offset = uint64_t{entry.ordinal} * page;
+                    firstMapping = candidateOfOrdinal(entry.firstOrdinal, firstMapping);
+                    const uint64_t offset = uint64_t{entry.firstOrdinal} * page;
                     const uint64_t address = region.start() + index * page;
                     Piece& piece = pieceFor(sharedObjectId(entry.set, firstMapping), address, offset);
                     piece.runs->add(offset, run.kind);

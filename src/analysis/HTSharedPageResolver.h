@@ -40,8 +40,25 @@ public:
 
 private:
     struct Candidate;
-    class IdentityTable;
     class ProcessSets;
+    // A page with the identity the kernel gave it, its number, and the
+    // place of its process in the process list.
+    struct IdentifiedPage {
+        uint64_t identity;
+        uint32_t ordinal;
+        uint32_t process;
+    };
+    // What the resolver found of a page, by its number: the set of
+    // processes that map it (0 when one process alone does), and the
+    // number the page got in the first region that met it.
+    struct PageSet {
+        uint32_t set = 0;
+        uint32_t firstOrdinal = 0;
+    };
+
+    // Sorts the pages by identity, keeping the order of pages of one
+    // identity.
+    static void sortByIdentity(std::vector<IdentifiedPage>& pages);
 
     void registerPages();
     void cutRegions();
@@ -51,6 +68,6 @@ private:
 
     const ProcessList& processes_;
     std::vector<Candidate> candidates_;
-    std::unique_ptr<IdentityTable> identities_;
+    std::vector<PageSet> pages_;
     std::unique_ptr<ProcessSets> sets_;
 };

@@ -59,21 +59,24 @@ unsigned HTWorkQueue::defaultThreadCount() { return std::max(1u, std::thread::ha
 void HTWorkQueue::parallelFor(size_t count, const std::function<void(size_t)>& body)
 {
     if (count == 0) return;
+    if (workers_.empty()) {
+        for (size_t index = 0; index < count; ++index) body(index);
+        return;
+    }
     {
         std::lock_guard<std::mutex> lock(mutex_);
         body_ = &body;
         count_ = count;
+        completed_ = 0;
         nextIndex_.store(0, std::memory_order_relaxed);
         ++generation_;
     }
     jobPosted_.notify_all();
 
-    runIterations(body, count);
-
-    // Every index has been handed out; the workers still inside the loop are
-    // finishing theirs. `body` must outlive them all.
+    // Every iteration has ended once all are counted; `body` must outlive
+    // the workers still leaving the loop as well.
     std::unique_lock<std::mutex> lock(mutex_);
-    jobDone_.wait(lock, [this] { return activeWorkers_ == 0; });
+    jobDone_.wait(lock, [this, count] { return completed_ == count && activeWorkers_ == 0; });
     // A worker that wakes only now finds no loop to join.
     body_ = nullptr;
     count_ = 0;
@@ -85,6 +88,8 @@ void HTWorkQueue::runIterations(const std::function<void(size_t)>& body, size_t 
         size_t index = nextIndex_.fetch_add(1, std::memory_order_relaxed);
         if (index >= count) return;
         body(index);
+        std::lock_guard<std::mutex> lock(mutex_);
+        ++completed_;
     }
 }
 

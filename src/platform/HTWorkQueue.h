@@ -27,9 +27,10 @@ public:
     HTWorkQueue(const HTWorkQueue&) = delete;
     HTWorkQueue& operator=(const HTWorkQueue&) = delete;
 
-    // Runs body(i) once for every i in [0, count), spread over the workers
-    // and the calling thread, and returns when every iteration has ended.
-    // The body must not throw.
+    // Runs body(i) once for every i in [0, count), spread over the workers,
+    // and returns when every iteration has ended. The calling thread only
+    // waits, so that the whole loop runs at the workers' priority; without
+    // workers it runs the loop itself. The body must not throw.
     void parallelFor(size_t count, const std::function<void(size_t)>& body);
 
     const std::string& label() const { return label_; }
@@ -58,6 +59,7 @@ private:
     size_t count_ = 0;
     uint64_t generation_ = 0;
     size_t activeWorkers_ = 0;
+    size_t completed_ = 0;
     bool stopping_ = false;
 
     // The next index of the current loop to hand out.
