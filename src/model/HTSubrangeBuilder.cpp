@@ -2,17 +2,17 @@
 
 #include "model/HTMemoryRegion.h"
 
-void HTSubrangeBuilder::add(uint64_t location, HTPageKind kind)
+void HTSubrangeBuilder::addRun(uint64_t location, uint64_t length, HTPageKind kind)
 {
     if (region_ == nullptr || kind == HTPageKind::None) return;
     if (kind == kind_ && location == location_ + length_) {
-        length_ += pageSize_;
+        length_ += length;
         return;
     }
     flush();
     kind_ = kind;
     location_ = location;
-    length_ = pageSize_;
+    length_ = length;
 }
 
 void HTSubrangeBuilder::flush()

@@ -18,7 +18,9 @@ public:
     HTSubrangeBuilder& operator=(const HTSubrangeBuilder&) = delete;
 
     // One page at `location` in the object.
-    void add(uint64_t location, HTPageKind kind);
+    void add(uint64_t location, HTPageKind kind) { addRun(location, pageSize_, kind); }
+    // `length` bytes of pages of one kind from `location`.
+    void addRun(uint64_t location, uint64_t length, HTPageKind kind);
     // Adds the run in hand.
     void flush();
 

@@ -89,15 +89,15 @@ public:
     // process has gone away.
     virtual kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
                                                    int32_t* dispositions, uint64_t* count) { return KERN_FAILURE; }
-    // The runs [start, end) of pages in [start, end) that may be resident or
-    // swapped out, in address order, into `runs`; page-aligned bounds. A
-    // backend that cannot tell answers the whole range. Page walks use it to
-    // step over the unpopulated stretches of sparse mappings, whose pages
-    // would all answer no disposition.
-    virtual void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
-                               std::vector<std::pair<uint64_t, uint64_t>>& runs)
+    // The runs of pages in [start, end) that may be resident or swapped out,
+    // in address order, into `runs`; page-aligned bounds. A backend that
+    // cannot tell answers the whole range. Page walks use it to step over
+    // the unpopulated stretches of sparse mappings, whose pages would all
+    // answer no disposition, and to take whole runs whose disposition the
+    // backend knows without a page query.
+    virtual void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)
     {
-        runs.assign(1, {start, end});
+        runs.assign(1, HTPageRun{start, end, 0});
     }
     // Whether sharedPageIdentities can tell pages apart. It needs the
     // physical page numbers, which a kernel may show only to a privileged

@@ -88,6 +88,16 @@ inline constexpr uint64_t HTMaxPageIdentity = uint64_t{1} << 58;
 // empty.
 inline constexpr int HTPlatformLinux = 5;
 
+// A run [start, end) of pages that may hold something. `disposition` is
+// the page-query disposition of every page of the run when the backend
+// knows it without asking page by page, and 0 when the pages must be
+// queried.
+struct HTPageRun {
+    uint64_t start;
+    uint64_t end;
+    int32_t disposition;
+};
+
 // A region as the address-space walk reports it. The count of a reply is
 // in 32-bit words: a kernel that answers with fewer than the full count
 // leaves out object_id_full.

@@ -572,16 +572,20 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
     HT_ASSERT(kModule, task_ != nullptr, "task");
     const uint64_t page = pageSize();
     const uint64_t end = start + pages * page;
-    thread_local std::vector<std::pair<uint64_t, uint64_t>> runs;
+    thread_local std::vector<HTPageRun> runs;
     if (populatedOnly)
         platform().populatedRuns(*task_, start, end, runs);
     else
-        runs.assign(1, {start, end});
+        runs.assign(1, HTPageRun{start, end, 0});
 
     int32_t dispositions[kDispositionChunkPages];
-    for (const auto& [runStart, runEnd] : runs) {
-        const uint64_t from = std::max(start, roundDown(runStart, page));
-        const uint64_t to = std::min(end, roundUp(runEnd, page));
+    for (const HTPageRun& run : runs) {
+        const uint64_t from = std::max(start, roundDown(run.start, page));
+        const uint64_t to = std::min(end, roundUp(run.end, page));
+        if (run.disposition != 0 && from < to) {
+            block(nullptr, run.disposition, (to - from) / page, (from - start) / page);
+            continue;
+        }
         for (uint64_t address = from; address < to; address += kDispositionChunkPages * page) {
             const uint64_t wanted = std::min((to - address) / page, kDispositionChunkPages);
             uint64_t count = wanted;
@@ -592,7 +596,7 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
                 _processMachVMError(result, KERN_INVALID_ARGUMENT);
                 return false;
             }
-            block(dispositions, std::min(count, wanted), (address - start) / page);
+            block(dispositions, 0, std::min(count, wanted), (address - start) / page);
         }
     }
     return true;
@@ -647,7 +651,7 @@ bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<H
     }
 
     const bool ok = _enumerateDispositionChunksWithStartAddr(
-        queryStart, pages, false, [&](const int32_t* dispositions, uint64_t filled, uint64_t firstPage) {
+        queryStart, pages, false, [&](const int32_t* dispositions, int32_t, uint64_t filled, uint64_t firstPage) {
             for (uint64_t i = 0; i < filled; ++i) {
                 const uint64_t index = firstPage + i;
                 const int32_t disposition = dispositions[i];
@@ -703,10 +707,28 @@ void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageT
     HTSubrangeBuilder fileRuns(targets.filePages, page);
     const bool separateCopies = targets.filePages != nullptr || targets.copiesOnly;
     uint64_t identities[kDispositionChunkPages];
+    // A run of pages of one disposition, which the kernel knows to hold no
+    // page another process maps privately.
+    auto addUniformRun = [&](uint64_t first, uint64_t count, int32_t disposition) {
+        const HTPageKind kind = pageKind(disposition, purgeState);
+        if (kind == HTPageKind::None) return;
+        if (separateCopies && (disposition & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
+            fileRuns.addRun(targets.filePages ? targets.filePages->offset() + first * page : 0, count * page, kind);
+        } else if (list) {
+            for (uint64_t index = first; index < first + count; ++index)
+                list->addPage(static_cast<uint32_t>(index), kind, 0);
+        } else {
+            runs.addRun(targets.pages->offset() + first * page, count * page, kind);
+        }
+    };
 
     // A failed query is recorded on the process; the runs found so far stay.
     _enumerateDispositionChunksWithStartAddr(
-        from, pages, true, [&](const int32_t* dispositions, uint64_t filled, uint64_t first) {
+        from, pages, true, [&](const int32_t* dispositions, int32_t uniform, uint64_t filled, uint64_t first) {
+            if (dispositions == nullptr) {
+                addUniformRun(first, filled, uniform);
+                return;
+            }
             const bool named = list && platform().sharedPageIdentities(*task_, from + first * page, filled,
                                                                        identities) == KERN_SUCCESS;
             for (uint64_t i = 0; i < filled; ++i) {

@@ -57,10 +57,11 @@ public:
     // the purgeable state and the mapped file's path. Returns true to stop.
     using RegionCallback = std::function<bool(uint64_t start, uint64_t size, const vm_region_submap_info_64& info,
                                               int32_t purgeState, const std::optional<std::string>& path)>;
-    // Receives one chunk of page dispositions: the entries, how many there
-    // are, and the index of the chunk's first page in the pages queried.
-    using DispositionChunkCallback =
-        std::function<void(const int32_t* dispositions, uint64_t count, uint64_t firstPage)>;
+    // Receives the dispositions of one stretch of pages: one per page, or
+    // null when every page has the disposition `uniform`; how many pages
+    // there are, and the index of the first in the pages asked for.
+    using DispositionChunkCallback = std::function<void(const int32_t* dispositions, int32_t uniform, uint64_t count,
+                                                        uint64_t firstPage)>;
 
     // Page dispositions are queried in chunks of at most this many pages.
     static constexpr uint64_t kDispositionChunkPages = 4096;
@@ -124,7 +125,8 @@ protected:
     // Queries the dispositions of `pages` pages from `start`, in chunks;
     // false (with the error recorded) when a query failed. With
     // `populatedOnly`, stretches the kernel knows to hold nothing are
-    // stepped over: their pages, all of disposition 0, are in no chunk.
+    // stepped over (their pages, all of disposition 0, are in no chunk), and
+    // runs whose disposition the kernel knows come whole, as uniform.
     bool _enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages, bool populatedOnly,
                                                   const DispositionChunkCallback& block);
     // Measures a shared-cache piece page by page; false when a query failed.

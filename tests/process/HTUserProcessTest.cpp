@@ -440,17 +440,25 @@ TEST_F(HTUserProcessSubrangeTest, RunsOfOneKindBecomeSubranges)
     target().dispositions[0x300000] = present;
     target().dispositions[0x302000] = dirty;
 
-    auto process = gathered();
-    EXPECT_EQ(spans(regionAt(*process, 0x100000)),
-              (std::vector<Span>{{0x40000, 2 * kPage, 2 * kPage, 0, 0, 0, 0},
-                                 {0x40000 + 3 * kPage, 2 * kPage, 0, 0, 2 * kPage, 0, 0}}));
-    // Adjacent runs of different kinds stay apart, so that each page keeps its kind.
-    EXPECT_EQ(spans(regionAt(*process, 0x200000)),
-              (std::vector<Span>{{0, kPage, 0, kPage, 0, 0, kPage},
-                                 {kPage, kPage, 0, 0, 0, kPage, kPage},
-                                 {3 * kPage, kPage, 0, 0, kPage, 0, kPage}}));
-    EXPECT_EQ(spans(regionAt(*process, 0x300000)),
-              (std::vector<Span>{{0, kPage, 0, 0, 0, kPage, 0}, {2 * kPage, kPage, kPage, 0, 0, 0, 0}}));
+    // Runs whose disposition the backend knows whole give the same runs as
+    // pages queried one by one, without a query.
+    for (bool uniformRuns : {false, true}) {
+        SCOPED_TRACE(uniformRuns ? "uniform runs" : "pages queried");
+        platform_->uniformRuns = uniformRuns;
+        platform_->pageQueries.clear();
+        auto process = gathered();
+        EXPECT_EQ(spans(regionAt(*process, 0x100000)),
+                  (std::vector<Span>{{0x40000, 2 * kPage, 2 * kPage, 0, 0, 0, 0},
+                                     {0x40000 + 3 * kPage, 2 * kPage, 0, 0, 2 * kPage, 0, 0}}));
+        // Adjacent runs of different kinds stay apart, so that each page keeps its kind.
+        EXPECT_EQ(spans(regionAt(*process, 0x200000)),
+                  (std::vector<Span>{{0, kPage, 0, kPage, 0, 0, kPage},
+                                     {kPage, kPage, 0, 0, 0, kPage, kPage},
+                                     {3 * kPage, kPage, 0, 0, kPage, 0, kPage}}));
+        EXPECT_EQ(spans(regionAt(*process, 0x300000)),
+                  (std::vector<Span>{{0, kPage, 0, 0, 0, kPage, 0}, {2 * kPage, kPage, kPage, 0, 0, 0, 0}}));
+        EXPECT_EQ(platform_->pageQueries.empty(), uniformRuns);
+    }
 }
 
 TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem)

@@ -292,24 +292,24 @@ kern_return_t HTFakePlatform::sharedPageIdentities(HTTaskPort& task, uint64_t ad
     return KERN_SUCCESS;
 }
 
-void HTFakePlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
-                                   std::vector<std::pair<uint64_t, uint64_t>>& runs)
+void HTFakePlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)
 {
     Process* found = process(task.pid());
     // A process that is gone, or whose page queries are to fail, cannot be
     // scanned either: nothing is skipped and the query meets the failure.
     if (found == nullptr || found->pageQueryFailureAddress) {
-        runs.assign(1, {start, end});
+        runs.assign(1, HTPageRun{start, end, 0});
         return;
     }
     runs.clear();
     for (auto page = found->dispositions.lower_bound(start); page != found->dispositions.end() && page->first < end;
          ++page) {
         if (page->second == 0) continue;
-        if (!runs.empty() && runs.back().second == page->first)
-            runs.back().second += pageSize;
+        const int32_t disposition = uniformRuns ? page->second : 0;
+        if (!runs.empty() && runs.back().end == page->first && runs.back().disposition == disposition)
+            runs.back().end += pageSize;
         else
-            runs.emplace_back(page->first, page->first + pageSize);
+            runs.push_back(HTPageRun{page->first, page->first + pageSize, disposition});
     }
 }
 

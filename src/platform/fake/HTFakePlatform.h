@@ -101,6 +101,9 @@ public:
     int32_t ownPid = 99999;
     // Whether shared pages can be told apart (page frames are visible).
     bool sharedPagesIdentifiable = true;
+    // Whether populatedRuns answers the disposition of runs of pages of one
+    // disposition itself, as a backend that knows them without page queries.
+    bool uniformRuns = false;
     uint32_t euid = 0;
     std::set<int> terminals;            // descriptors that are terminals
     std::set<std::string> existingFiles;
@@ -134,8 +137,7 @@ public:
     kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
                                  uint32_t* count) override;
     kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
-    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
-                       std::vector<std::pair<uint64_t, uint64_t>>& runs) override;
+    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs) override;
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
     bool canIdentifySharedPages() override { return sharedPagesIdentifiable; }

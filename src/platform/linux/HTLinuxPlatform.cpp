@@ -146,6 +146,25 @@ bool mayHoldSharedAnonymousPages(const HTSmapsEntry& vma)
     }
 }
 
+// The disposition that every resident page (or, with `swapped`, every
+// page swapped out) of the mapping has, when the mapping alone settles it;
+// 0 when each page's own entry and flags are needed. A page query of such
+// a page answers the same.
+int32_t uniformDisposition(const HTSmapsEntry& vma, bool swapped)
+{
+    if (swapped || vma.hasFlag(HTVmFlagHugetlb) || vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) ||
+        vma.hasFlag(HTVmFlagMixedMap))
+        return 0;
+    // Shared memory is all swap-backed: dirty.
+    if (vma.shared && vma.isSharedMemory()) return VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
+    // A file of a block device that smaps finds wholly clean, with no
+    // anonymous copy in the mapping: every page is the file's, clean.
+    if (vma.kind == HTSmapsKind::File && vma.devMajor != 0 && vma.sharedDirty == 0 && vma.privateDirty == 0 &&
+        vma.anonymous == 0 && vma.swap == 0)
+        return VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
+    return 0;
+}
+
 // Walks ascending page addresses through ascending [start, end) runs.
 class HTRunCursor {
 public:
@@ -824,13 +843,35 @@ bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
     return imageReader_.forEachTaskImage(static_cast<HTLinuxTaskPort&>(task), callback);
 }
 
-void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
-                                    std::vector<std::pair<uint64_t, uint64_t>>& runs)
+void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)
 {
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
     int pagemap = linuxTask ? linuxTask->pagemapFd() : -1;
+    thread_local std::vector<HTPagemapRun> scanned;
     // A failed scan leaves the page queries to meet the failure themselves.
-    if (pagemap < 0 || !htPagemapPopulatedRuns(pagemap, start, end, runs)) runs.assign(1, {start, end});
+    if (pagemap < 0 || loadVmas(*linuxTask, false) != KERN_SUCCESS ||
+        !htPagemapPopulatedRuns(pagemap, start, end, scanned)) {
+        runs.assign(1, HTPageRun{start, end, 0});
+        return;
+    }
+    runs.clear();
+    const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
+    const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(start);
+    size_t index = vma ? static_cast<size_t>(vma - vmas.data()) : vmas.size();
+    for (const HTPagemapRun& run : scanned) {
+        // A run may cross from one mapping into the next.
+        for (uint64_t at = run.start; at < run.end;) {
+            while (index < vmas.size() && vmas[index].end <= at) ++index;
+            const bool inside = index < vmas.size() && vmas[index].start <= at;
+            const uint64_t to = inside ? std::min(run.end, vmas[index].end) : run.end;
+            const int32_t disposition = inside ? uniformDisposition(vmas[index], run.swapped) : 0;
+            if (!runs.empty() && runs.back().end == at && runs.back().disposition == disposition)
+                runs.back().end = to;
+            else
+                runs.push_back(HTPageRun{at, to, disposition});
+            at = to;
+        }
+    }
 }
 
 bool HTLinuxPlatform::canIdentifySharedPages()

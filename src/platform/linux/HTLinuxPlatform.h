@@ -82,8 +82,7 @@ public:
     std::optional<std::string> realpath(const std::string& path) override;
     // From the kernel's pagemap scan; the whole range where the kernel
     // lacks it.
-    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end,
-                       std::vector<std::pair<uint64_t, uint64_t>>& runs) override;
+    void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs) override;
     // The ELF objects mapped by the task, with their segments.
     bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
                           const std::function<void(const HTPlatformImage&)>& callback) override;

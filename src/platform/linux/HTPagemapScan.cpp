@@ -56,33 +56,26 @@ std::optional<uint64_t> firstPageWithAny(int pagemapFd, uint64_t start, uint64_t
     return found == 0 ? end : region.start;
 }
 
-// The runs of pages in [start, end) that have all of `required` and any of
-// `anyOf`, in address order, adjacent runs joined. False when the kernel
-// does not offer the scan or it fails.
-bool collectRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf,
-                 std::vector<std::pair<uint64_t, uint64_t>>& runs)
+// Calls `found(start, end, categories)` for the runs of pages in
+// [start, end) that have all of `required` and any of `anyOf`, in address
+// order. False when the kernel does not offer the scan or it fails.
+template <typename Found>
+bool scanRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf, Found found)
 {
-    runs.clear();
-    PageRegion found[256];
+    PageRegion regions[256];
     while (start < end) {
         PagemapScanArg arg{};
         arg.size = sizeof(arg);
         arg.start = start;
         arg.end = end;
-        arg.vec = reinterpret_cast<uint64_t>(found);
-        arg.vec_len = sizeof(found) / sizeof(found[0]);
+        arg.vec = reinterpret_cast<uint64_t>(regions);
+        arg.vec_len = sizeof(regions) / sizeof(regions[0]);
         arg.category_mask = required;
         arg.category_anyof_mask = anyOf;
         arg.return_mask = required | anyOf;
         long count = ::ioctl(pagemapFd, kPagemapScan, &arg);
         if (count < 0) return false;
-        for (long i = 0; i < count; ++i) {
-            // Runs of different categories may touch.
-            if (!runs.empty() && runs.back().second == found[i].start)
-                runs.back().second = found[i].end;
-            else
-                runs.emplace_back(found[i].start, found[i].end);
-        }
+        for (long i = 0; i < count; ++i) found(regions[i].start, regions[i].end, regions[i].categories);
         // The kernel says where its walk stopped: at `end`, or where the
         // vector filled up.
         if (arg.walk_end <= start) return false;
@@ -103,11 +96,21 @@ std::optional<bool> htPagemapMayMapZeroPage(int pagemapFd, uint64_t start, uint6
 bool htPagemapZeroPageRuns(int pagemapFd, uint64_t start, uint64_t end,
                            std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
-    return collectRuns(pagemapFd, start, end, kPageIsZeroFrame, 0, runs);
+    runs.clear();
+    return scanRuns(pagemapFd, start, end, kPageIsZeroFrame, 0,
+                    [&](uint64_t from, uint64_t to, uint64_t) { runs.emplace_back(from, to); });
 }
 
-bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end,
-                            std::vector<std::pair<uint64_t, uint64_t>>& runs)
+bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end, std::vector<HTPagemapRun>& runs)
 {
-    return collectRuns(pagemapFd, start, end, 0, kPageIsPresent | kPageIsSwapped, runs);
+    runs.clear();
+    return scanRuns(pagemapFd, start, end, 0, kPageIsPresent | kPageIsSwapped,
+                    [&](uint64_t from, uint64_t to, uint64_t categories) {
+                        const bool swapped = (categories & kPageIsSwapped) != 0;
+                        // A walk cut short by a full vector goes on where it stopped.
+                        if (!runs.empty() && runs.back().end == from && runs.back().swapped == swapped)
+                            runs.back().end = to;
+                        else
+                            runs.push_back(HTPagemapRun{from, to, swapped});
+                    });
 }

@@ -5,14 +5,20 @@
 #include <utility>
 #include <vector>
 
+// A run [start, end) of resident pages, or of pages swapped out.
+struct HTPagemapRun {
+    uint64_t start;
+    uint64_t end;
+    bool swapped;
+};
+
 // Asks the kernel, through the pagemap's scan request, for the runs of
 // pages in [start, end) that are resident or swapped out, in address order,
 // into `runs`. The kernel walks its page tables and steps over empty
 // stretches whole, so a terabyte-sized sparse reservation costs what its
 // populated pages cost, not one entry per page. False when the kernel does
 // not offer the request (kernels before 6.7) or it fails.
-bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end,
-                            std::vector<std::pair<uint64_t, uint64_t>>& runs);
+bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end, std::vector<HTPagemapRun>& runs);
 
 // Whether any page in [start, end) may be a zero page: the shared zero
 // page, left by a read of anonymous memory never written, or a page mapped
