@@ -32,15 +32,21 @@ const HTMemoryCategory::RegionSet& HTMemoryCategory::memoryRegions() const
     return memoryRegions_;
 }
 
-std::optional<std::string> HTMemoryCategory::name() const
+namespace {
+
+const std::optional<std::string> kNoName;
+
+}  // namespace
+
+const std::optional<std::string>& HTMemoryCategory::name() const
 {
-    if (memoryObjects_.empty()) return std::nullopt;
+    if (memoryObjects_.empty()) return kNoName;
     return memoryObjects_.front()->name();
 }
 
-std::optional<std::string> HTMemoryCategory::detailedName() const
+const std::optional<std::string>& HTMemoryCategory::detailedName() const
 {
-    if (isSummary_ || memoryObjects_.empty()) return std::nullopt;
+    if (isSummary_ || memoryObjects_.empty()) return kNoName;
     return memoryObjects_.front()->detailedName();
 }
 

@@ -47,10 +47,11 @@ public:
     void addMemoryObject(const std::shared_ptr<HTMemoryObject>& object);
 
     // All members are filed under one key, so any member names the category.
-    // nullopt when there is no member.
-    std::optional<std::string> name() const;
+    // nullopt when there is no member. The references stay valid as long as
+    // the members' regions.
+    const std::optional<std::string>& name() const;
     // nullopt for a summary category, whatever its members say.
-    std::optional<std::string> detailedName() const;
+    const std::optional<std::string>& detailedName() const;
     // A summary category's full name is its name.
     std::optional<std::string> fullName() const;
 

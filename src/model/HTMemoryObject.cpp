@@ -6,6 +6,12 @@
 
 #include <algorithm>
 
+namespace {
+
+const std::optional<std::string> kNoName;
+
+}  // namespace
+
 HTMemoryObject::HTMemoryObject() : memoryRegions_(std::make_shared<RegionSet>()) {}
 HTMemoryObject::~HTMemoryObject() = default;
 
@@ -213,16 +219,16 @@ bool HTMemoryObject::containsFakeRegion() const
     return false;
 }
 
-std::optional<std::string> HTMemoryObject::name() const
+const std::optional<std::string>& HTMemoryObject::name() const
 {
     const HTMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->name() : std::nullopt;
+    return canonical ? canonical->name() : kNoName;
 }
 
-std::optional<std::string> HTMemoryObject::detailedName() const
+const std::optional<std::string>& HTMemoryObject::detailedName() const
 {
     const HTMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->detailedName() : std::nullopt;
+    return canonical ? canonical->detailedName() : kNoName;
 }
 
 std::optional<std::string> HTMemoryObject::fullName() const

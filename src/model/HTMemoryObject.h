@@ -82,8 +82,9 @@ public:
 
     bool containsFakeRegion() const;
     // The names of the representative region; nullopt when there is none.
-    std::optional<std::string> name() const;
-    std::optional<std::string> detailedName() const;
+    // The references stay valid as long as the object's regions.
+    const std::optional<std::string>& name() const;
+    const std::optional<std::string>& detailedName() const;
     std::optional<std::string> fullName() const;
 
 protected:
