@@ -87,20 +87,25 @@ constexpr size_t kSharedCache64Capacity = 512;
 // The key under which an object is filed in a category map. An object whose
 // representative region carries no name still holds memory that the table
 // and its total must show, so it is filed under one fixed key rather than
-// left out; an empty key would look like a real, blank name.
-std::string categoryKey(const HTMemoryObject& object, bool summarize)
+// left out; an empty key would look like a real, blank name. A full name is
+// built in `storage`; a short name is the region's own.
+std::string_view categoryKey(const HTMemoryObject& object, bool summarize, std::optional<std::string>& storage)
 {
-    std::optional<std::string> name = summarize ? object.name() : object.fullName();
-    return name ? *std::move(name) : std::string("unknown");
+    if (summarize) {
+        const std::optional<std::string>& name = object.name();
+        return name ? std::string_view(*name) : "unknown";
+    }
+    storage = object.fullName();
+    return storage ? std::string_view(*storage) : "unknown";
 }
 
 // The category of the key, created with `segment` when absent.
-HTMemoryCategory& categoryFor(HTCategoryMap& categories, const std::string& key, uint8_t segment, bool summarize)
+HTMemoryCategory& categoryFor(HTCategoryMap& categories, std::string_view key, uint8_t segment, bool summarize)
 {
     if (HTMemoryCategory* found = categories.find(key)) return *found;
     auto made = std::make_shared<HTMemoryCategory>(segment, summarize);
     HTMemoryCategory& category = *made;
-    categories.add(key, std::move(made));
+    categories.add(std::string(key), std::move(made));
     return category;
 }
 
@@ -326,10 +331,12 @@ HTCategoryMap HTHeft::_categoriesForObjects(const ObjectSet& objects, HTProcess&
     const bool breakDown = breakDownPhysHeft(*platform_);
     HTCategoryMap categories;
     bool ownView = false;
+    std::optional<std::string> keyStorage;
     for (const auto& object : objects) {
         const uint8_t segment =
             object->memoryRegions().empty() ? HTSegmentNotSet : object->memoryRegions().front()->segment();
-        HTMemoryCategory& category = categoryFor(categories, categoryKey(*object, summarize), segment, summarize);
+        HTMemoryCategory& category =
+            categoryFor(categories, categoryKey(*object, summarize, keyStorage), segment, summarize);
         std::shared_ptr<HTMemoryObject> view = object->viewForProcess(process, breakDown);
         if (view != object) ownView = true;
         category.addMemoryObject(view);
@@ -342,11 +349,12 @@ HTCategoryMap HTHeft::_categoriesForAllProcessesShouldSummarize(bool summarize)
 {
     HTCategoryMap categories;
     std::unordered_set<const HTMemoryObject*> seen;
+    std::optional<std::string> keyStorage;
     for (const auto& process : _notHiddenProcesses()) {
         for (const auto& region : process->memoryRegions()) {
             std::shared_ptr<HTMemoryObject> object = region->memoryObject();
             if (!object || !seen.insert(object.get()).second) continue;
-            categoryFor(categories, categoryKey(*object, summarize), region->segment(), summarize)
+            categoryFor(categories, categoryKey(*object, summarize, keyStorage), region->segment(), summarize)
                 .addMemoryObject(object);
         }
     }
@@ -439,6 +447,25 @@ std::unique_ptr<HTHeftSharingData> HTHeft::_sharingData()
 
 // --- the report --------------------------------------------------------------
 
+const HTHeft::GroupTable& HTHeft::tableForGroup(const HTProcessGroup& group, const ObjectSet& objects,
+                                                HTProcess& process, bool summarize, CommonTables& common,
+                                                GroupTable& scratch)
+{
+    GroupTable* table = &scratch;
+    if (group.count() > 1) {
+        // Every member of a shared group prints its table: where they all
+        // see the same, it is made once.
+        auto found = common.find(&group);
+        if (found != common.end()) return found->second;
+        if (std::all_of(objects.begin(), objects.end(),
+                        [](const auto& object) { return object->looksTheSameToEveryProcess(); }))
+            table = &common[&group];
+    }
+    table->categories = _categoriesForObjects(objects, process, &table->hasProcessView, summarize);
+    _totalForCategories(table->categories, &table->total);
+    return *table;
+}
+
 void HTHeft::printSpanlistLikeOutputForProcesses(const ProcessList& processes)
 {
     FormatterList listing;
@@ -463,6 +490,8 @@ void HTHeft::printOutputVerbose(bool verbose, bool summarize)
     ProcessList processesWithWarnings;
     ProcessList processesWithErrors;
     std::shared_ptr<HTAuxDataMap> mergedAuxData;
+    CommonTables commonTables;
+    GroupTable scratchTable;
 
     for (const auto& process : reported) {
         const bool hasErrors = !process->errors().empty();
@@ -486,16 +515,14 @@ void HTHeft::printOutputVerbose(bool verbose, bool summarize)
             for (const auto& group : *groups) {
                 static const ObjectSet kNoObjects;
                 const ObjectSet* objects = sharing->processGroupToObjects().find(*group);
-                bool hasProcessView = false;
-                const HTCategoryMap categories =
-                    _categoriesForObjects(objects ? *objects : kNoObjects, *process, &hasProcessView, summarize);
-                HTMemoryTotals total;
-                _totalForCategories(categories, &total);
+                const GroupTable& table = tableForGroup(*group, objects ? *objects : kNoObjects, *process,
+                                                        summarize, commonTables, scratchTable);
                 for (const auto& formatter : outputFormatters_) {
                     if (group->count() == 1)
-                        formatter->printProcessCategories(categories, total);
+                        formatter->printProcessCategories(table.categories, table.total);
                     else
-                        formatter->printSharedCategories(categories, *group, *process, hasProcessView, total);
+                        formatter->printSharedCategories(table.categories, *group, *process,
+                                                         table.hasProcessView, table.total);
                 }
             }
         } else {

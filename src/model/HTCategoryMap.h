@@ -1,7 +1,9 @@
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <unordered_map>
 #include <utility>
 #include <vector>
@@ -16,7 +18,7 @@ public:
     using Entry = std::pair<std::string, std::shared_ptr<HTMemoryCategory>>;
 
     // The category under the key, or null.
-    HTMemoryCategory* find(const std::string& key) const
+    HTMemoryCategory* find(std::string_view key) const
     {
         auto found = index_.find(key);
         return found == index_.end() ? nullptr : entries_[found->second].second.get();
@@ -35,6 +37,12 @@ public:
     std::vector<Entry>::const_iterator end() const { return entries_.end(); }
 
 private:
+    // Looks keys up by view, so that finding one needs no string of its own.
+    struct KeyHash {
+        using is_transparent = void;
+        size_t operator()(std::string_view key) const { return std::hash<std::string_view>{}(key); }
+    };
+
     std::vector<Entry> entries_;
-    std::unordered_map<std::string, size_t> index_;
+    std::unordered_map<std::string, size_t, KeyHash, std::equal_to<>> index_;
 };

@@ -76,6 +76,11 @@ public:
     // when another process owns it, else this object itself. (The process is
     // not const: asking it for its heft mode may read the kernel setting.)
     std::shared_ptr<HTMemoryObject> viewForProcess(HTProcess& process, bool breakDownPhysHeft);
+    // Whether viewForProcess gives every process this object itself.
+    bool looksTheSameToEveryProcess() const
+    {
+        return (!processMemoryRegions_ || processMemoryRegions_->empty()) && ownerPid_ == -1;
+    }
     // A finalised copy sharing the region set, without reclaimable total,
     // per-process map or range list. The object must be finalised.
     std::shared_ptr<HTMemoryObject> copy() const;
