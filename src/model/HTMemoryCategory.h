@@ -1,12 +1,12 @@
 #pragma once
 
+#include "base/HTPointerIndex.h"
 #include "model/HTIdentitySet.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
-#include <unordered_set>
 
 class HTMemoryObject;
 class HTMemoryRegion;
@@ -56,6 +56,11 @@ public:
     std::optional<std::string> fullName() const;
 
 private:
+    static constexpr std::ptrdiff_t kLinearSize = 16;
+
+    // Whether no earlier member holds the newest member's region set.
+    bool isNewRegionSet(const RegionSet& regions);
+
     bool isSummary_;
     ObjectSet memoryObjects_;
     uint8_t segment_;
@@ -64,8 +69,9 @@ private:
     uint64_t totalCleanSize_ = 0;
     uint64_t totalReclaimableSize_ = 0;
     uint64_t totalWiredSize_ = 0;
-    // Region sets of the members already counted, by identity.
-    std::unordered_set<const RegionSet*> memberRegionSets_;
+    // Region sets of the members already counted, by identity, once there
+    // are more than kLinearSize members.
+    HTPointerIndex memberRegionSets_;
     uint64_t regionCount_ = 0;
     mutable RegionSet memoryRegions_;
     mutable bool memoryRegionsBuilt_ = true;

@@ -30,7 +30,7 @@ void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, u
 {
     if (accurateSizes_) HT_FATAL("HTMemoryObject", "region added to a finalised object");
     HT_ASSERT("HTMemoryObject", region != nullptr, "region != nil");
-    memoryRegions_->insert(region);
+    memoryRegions_->append(region);
     // A region without an object id names and lists the object but counts
     // for nothing.
     if (region->object_id() == 0) return;

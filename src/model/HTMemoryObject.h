@@ -58,7 +58,8 @@ public:
     const HTRangeList* rangeList() const { return rangeList_.get(); }
     void setRangeList(std::unique_ptr<HTRangeList> list) { rangeList_ = std::move(list); }
 
-    // Adds a region mapped by `process`, recording it per process.
+    // Adds a region mapped by `process`, recording it per process. Each
+    // region is added once: its pages would otherwise count twice.
     void addRegion(const std::shared_ptr<HTMemoryRegion>& region, const HTProcess& process);
     // Adds a region without recording a process.
     void addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize);
