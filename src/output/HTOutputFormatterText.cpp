@@ -12,6 +12,7 @@
 
 #include <algorithm>
 #include <charconv>
+#include <cstring>
 #include <functional>
 
 namespace {
@@ -19,6 +20,23 @@ namespace {
 constexpr const char* kModule = "HTOutputFormatterText";
 constexpr const char* kEquals = "==========";
 constexpr const char* kDashes = "---";
+
+// The widest a size column gets: its width or its longest text.
+constexpr size_t kColumnCapacity = 32;
+static_assert(kColumnCapacity >= kHTSizeTextCapacity);
+
+// Writes `text` right-aligned in `width` columns, as printf's "%*s": a
+// longer text is never cut. Returns the end of what was written.
+char* putRightAligned(char* out, std::string_view text, int width)
+{
+    if (static_cast<size_t>(width) > text.size()) {
+        const size_t pad = static_cast<size_t>(width) - text.size();
+        std::memset(out, ' ', pad);
+        out += pad;
+    }
+    std::memcpy(out, text.data(), text.size());
+    return out + text.size();
+}
 
 // Whole pages holding `bytes`, rounded up; no pages without a page size.
 uint64_t pagesForSize(uint64_t bytes, uint64_t pageSize)
@@ -157,17 +175,10 @@ HTOutputFormatterText::ColumnWidths HTOutputFormatterText::columnWidths() const
     };
 }
 
-void HTOutputFormatterText::appendRightAligned(std::string_view text, int width)
-{
-    // As printf's "%*s": a longer text is never cut.
-    if (static_cast<size_t>(width) > text.size()) line_.append(static_cast<size_t>(width) - text.size(), ' ');
-    line_.append(text);
-}
-
-void HTOutputFormatterText::appendSize(uint64_t size, int width)
+char* HTOutputFormatterText::putSize(char* out, uint64_t size, int width) const
 {
     char text[kHTSizeTextCapacity];
-    appendRightAligned(std::string_view(text, formatSize(size, text)), width);
+    return putRightAligned(out, std::string_view(text, formatSize(size, text)), width);
 }
 
 void HTOutputFormatterText::writeLine()
@@ -176,49 +187,53 @@ void HTOutputFormatterText::writeLine()
     line_.clear();
 }
 
-void HTOutputFormatterText::printHeadingRow()
+void HTOutputFormatterText::printColumnsRow(const std::string_view (&columns)[5], std::string_view regions,
+                                            std::string_view category)
 {
     const ColumnWidths w = columnWidths();
-    appendRightAligned("Dirty", w.dirty);
-    appendRightAligned(swappedColumnName_ ? *swappedColumnName_ : "", w.swapped);
-    appendRightAligned("Clean", w.clean);
-    appendRightAligned("Reclaimable", w.reclaimable);
-    appendRightAligned(wiredColumnName_ ? *wiredColumnName_ : "", w.wired);
-    line_.append(" ");
-    appendRightAligned("Regions", 10);
-    line_.append("    Category\n");
+    const int widths[5] = {w.dirty, w.swapped, w.clean, w.reclaimable, w.wired};
+    char row[8 * kColumnCapacity];
+    char* end = row;
+    for (size_t i = 0; i < 5; ++i) end = putRightAligned(end, columns[i], widths[i]);
+    *end++ = ' ';
+    end = putRightAligned(end, regions, 10);
+    line_.append(row, end);
+    line_.append("    ");
+    line_.append(category);
+    line_.append("\n");
     writeLine();
+}
+
+void HTOutputFormatterText::printHeadingRow()
+{
+    printColumnsRow({"Dirty", swappedColumnName_ ? *swappedColumnName_ : "", "Clean", "Reclaimable",
+                     wiredColumnName_ ? *wiredColumnName_ : ""},
+                    "Regions", "Category");
 }
 
 void HTOutputFormatterText::printDashRow()
 {
-    const ColumnWidths w = columnWidths();
-    appendRightAligned(kDashes, w.dirty);
-    appendRightAligned(swappedColumnName_ ? kDashes : "", w.swapped);
-    appendRightAligned(kDashes, w.clean);
-    appendRightAligned(kDashes, w.reclaimable);
-    appendRightAligned(wiredColumnName_ ? kDashes : "", w.wired);
-    line_.append(" ");
-    appendRightAligned(kDashes, 10);
-    line_.append("    ");
-    line_.append(kDashes);
-    line_.append("\n");
-    writeLine();
+    printColumnsRow({kDashes, swappedColumnName_ ? kDashes : "", kDashes, kDashes, wiredColumnName_ ? kDashes : ""},
+                    kDashes, kDashes);
 }
 
 void HTOutputFormatterText::printSizeRow(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable,
                                          uint64_t wired, long long regions, std::string_view name,
                                          const std::optional<std::string>& detail)
 {
+    // The figures, of bounded width, go through a buffer on the stack.
     const ColumnWidths w = columnWidths();
-    appendSize(dirty, w.dirty);
-    if (swappedColumnName_) appendSize(swapped, w.swapped);
-    appendSize(clean, w.clean);
-    appendSize(reclaimable, w.reclaimable);
-    if (wiredColumnName_) appendSize(wired, w.wired);
-    line_.append(" ");
+    char figures[6 * kColumnCapacity];
+    char* end = putSize(figures, dirty, w.dirty);
+    if (swappedColumnName_) end = putSize(end, swapped, w.swapped);
+    end = putSize(end, clean, w.clean);
+    end = putSize(end, reclaimable, w.reclaimable);
+    if (wiredColumnName_) end = putSize(end, wired, w.wired);
+    *end++ = ' ';
     char count[24];
-    appendRightAligned(std::string_view(count, std::to_chars(count, count + sizeof(count), regions).ptr - count), 10);
+    end = putRightAligned(end, std::string_view(count, std::to_chars(count, count + sizeof(count), regions).ptr - count),
+                          10);
+    line_.append(figures, end);
     line_.append("    ");
     line_.append(name);
     if (detail) {

@@ -101,11 +101,15 @@ private:
 
     // Rows are built in line_ and written with one call each: the tables
     // make up nearly all of a report of many processes.
-    void appendRightAligned(std::string_view text, int width);
-    void appendSize(uint64_t size, int width);
+    // A size right-aligned in `width` columns at `out`, which has room for
+    // the wider of the two; returns the end of what was written.
+    char* putSize(char* out, uint64_t size, int width) const;
     void appendEqualsRule();
     void writeLine();
 
+    // A row of five column texts (empty for a column that is off), the
+    // region column and the category column, as the heading and dash rows.
+    void printColumnsRow(const std::string_view (&columns)[5], std::string_view regions, std::string_view category);
     void printHeadingRow();
     void printDashRow();
     // One row of five sizes, a region count and a name, followed by the
