@@ -5,6 +5,8 @@
 #include "analysis/HTProcessGroup.h"
 #include "analysis/HTSharedPageResolver.h"
 #include "base/HTAssert.h"
+#include "base/HTMix.h"
+#include "base/HTPointerIndex.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
@@ -20,6 +22,7 @@
 #include <cerrno>
 #include <csignal>
 #include <cstdio>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <unordered_set>
@@ -87,20 +90,25 @@ constexpr size_t kSharedCache64Capacity = 512;
 // The key under which an object is filed in a category map. An object whose
 // representative region carries no name still holds memory that the table
 // and its total must show, so it is filed under one fixed key rather than
-// left out; an empty key would look like a real, blank name.
-std::string categoryKey(const HTMemoryObject& object, bool summarize)
+// left out; an empty key would look like a real, blank name. A full name is
+// built in `storage`; a short name is the region's own.
+std::string_view categoryKey(const HTMemoryObject& object, bool summarize, std::optional<std::string>& storage)
 {
-    std::optional<std::string> name = summarize ? object.name() : object.fullName();
-    return name ? *std::move(name) : std::string("unknown");
+    if (summarize) {
+        const std::optional<std::string>& name = object.name();
+        return name ? std::string_view(*name) : "unknown";
+    }
+    storage = object.fullName();
+    return storage ? std::string_view(*storage) : "unknown";
 }
 
 // The category of the key, created with `segment` when absent.
-HTMemoryCategory& categoryFor(HTCategoryMap& categories, const std::string& key, uint8_t segment, bool summarize)
+HTMemoryCategory& categoryFor(HTCategoryMap& categories, std::string_view key, uint8_t segment, bool summarize)
 {
     if (HTMemoryCategory* found = categories.find(key)) return *found;
     auto made = std::make_shared<HTMemoryCategory>(segment, summarize);
     HTMemoryCategory& category = *made;
-    categories.add(key, std::move(made));
+    categories.add(std::string(key), std::move(made));
     return category;
 }
 
@@ -265,7 +273,7 @@ uint64_t HTHeft::_calculateHeftForProcess(HTProcess& process)
     }
     // Each object counts once and whole: memory shared with others counts
     // in full in each of their hefts.
-    std::unordered_set<const HTMemoryObject*> seen;
+    HTPointerIndex seen(process.memoryRegions().size());
     for (const auto& region : process.memoryRegions()) {
         std::shared_ptr<HTMemoryObject> object = region->memoryObject();
         if (!object || !seen.insert(object.get()).second) continue;
@@ -277,8 +285,8 @@ uint64_t HTHeft::_calculateHeftForProcess(HTProcess& process)
 void HTHeft::_buildProcessToHeftMap()
 {
     pidToHeft_.clear();
-    for (const auto& process : _notHiddenProcesses())
-        pidToHeft_.set(process->pid(), _calculateHeftForProcess(*process));
+    for (const auto& process : processes_)
+        if (!process->hiddenFromDisplay()) pidToHeft_.set(process->pid(), _calculateHeftForProcess(*process));
 }
 
 HTHeft::ProcessList HTHeft::_notHiddenProcesses() const
@@ -326,10 +334,12 @@ HTCategoryMap HTHeft::_categoriesForObjects(const ObjectSet& objects, HTProcess&
     const bool breakDown = breakDownPhysHeft(*platform_);
     HTCategoryMap categories;
     bool ownView = false;
+    std::optional<std::string> keyStorage;
     for (const auto& object : objects) {
         const uint8_t segment =
             object->memoryRegions().empty() ? HTSegmentNotSet : object->memoryRegions().front()->segment();
-        HTMemoryCategory& category = categoryFor(categories, categoryKey(*object, summarize), segment, summarize);
+        HTMemoryCategory& category =
+            categoryFor(categories, categoryKey(*object, summarize, keyStorage), segment, summarize);
         std::shared_ptr<HTMemoryObject> view = object->viewForProcess(process, breakDown);
         if (view != object) ownView = true;
         category.addMemoryObject(view);
@@ -341,12 +351,14 @@ HTCategoryMap HTHeft::_categoriesForObjects(const ObjectSet& objects, HTProcess&
 HTCategoryMap HTHeft::_categoriesForAllProcessesShouldSummarize(bool summarize)
 {
     HTCategoryMap categories;
-    std::unordered_set<const HTMemoryObject*> seen;
-    for (const auto& process : _notHiddenProcesses()) {
+    HTPointerIndex seen;
+    std::optional<std::string> keyStorage;
+    for (const auto& process : processes_) {
+        if (process->hiddenFromDisplay()) continue;
         for (const auto& region : process->memoryRegions()) {
             std::shared_ptr<HTMemoryObject> object = region->memoryObject();
             if (!object || !seen.insert(object.get()).second) continue;
-            categoryFor(categories, categoryKey(*object, summarize), region->segment(), summarize)
+            categoryFor(categories, categoryKey(*object, summarize, keyStorage), region->segment(), summarize)
                 .addMemoryObject(object);
         }
     }
@@ -369,57 +381,140 @@ void HTHeft::_totalForCategories(const HTCategoryMap& categories, HTMemoryTotals
 
 // --- sharing analysis --------------------------------------------------------
 
-std::unique_ptr<HTHeftSharingData> HTHeft::_sharingData()
+namespace {
+
+constexpr uint32_t kNoProcess = UINT32_MAX;
+
+// The objects that reported processes map, in the order first met, and the
+// processes that map each: those of objects[i] are mappers[first[i]] up to
+// mappers[first[i + 1]], as indices into the process list, in list order,
+// each once.
+struct ObjectMappers {
+    HTHeft::ObjectList objects;
+    std::vector<uint32_t> first;
+    std::vector<uint32_t> mappers;
+
+    std::span<const uint32_t> of(size_t object) const
+    {
+        return {mappers.data() + first[object], mappers.data() + first[object + 1]};
+    }
+};
+
+// The distinct sets of mappers as frozen groups, numbered in the order first
+// met, and the number of each object's set.
+struct MapperGroups {
+    std::vector<std::shared_ptr<HTProcessGroup>> groups;
+    std::vector<uint32_t> groupOf;
+};
+
+// Whether a hidden process's mapping of `object` is of interest: only where
+// it maps memory that a reported process owns and that exists beyond any
+// mapping.
+bool hiddenMappingCounts(const HTMemoryObject& object, const std::unordered_set<int32_t>& visiblePids)
+{
+    return object.ownerPid() != -1 && visiblePids.count(object.ownerPid()) != 0 && object.containsFakeRegion();
+}
+
+ObjectMappers objectMappers(const HTHeft::ProcessList& processes)
 {
     std::unordered_set<int32_t> visiblePids;
-    for (const auto& process : _notHiddenProcesses()) visiblePids.insert(process->pid());
+    size_t regionCount = 0;
+    for (const auto& process : processes) {
+        if (!process->hiddenFromDisplay()) visiblePids.insert(process->pid());
+        regionCount += process->memoryRegions().size();
+    }
 
-    // Each object with the set of processes that map it, in the order the
-    // objects are first met, so that the report is the same run after run.
-    std::vector<std::pair<std::shared_ptr<HTMemoryObject>, std::shared_ptr<HTProcessGroup>>> objectGroups;
-    std::unordered_map<const HTMemoryObject*, size_t> objectIndex;
-    for (const auto& process : processes_) {
-        const bool hidden = process->hiddenFromDisplay();
-        for (const auto& region : process->memoryRegions()) {
+    ObjectMappers result;
+    HTPointerIndex numbers(regionCount / 2);
+    std::vector<uint32_t> lastMapper;
+    std::vector<std::pair<uint32_t, uint32_t>> mappings;  // object, process
+    mappings.reserve(regionCount);
+    for (uint32_t index = 0; index < processes.size(); ++index) {
+        const HTProcess& process = *processes[index];
+        const bool hidden = process.hiddenFromDisplay();
+        for (const auto& region : process.memoryRegions()) {
             std::shared_ptr<HTMemoryObject> object = region->memoryObject();
-            if (!object) continue;
-            // A hidden process is only of interest where it maps memory that
-            // a reported process owns and that exists beyond any mapping.
-            if (hidden && !(object->ownerPid() != -1 && visiblePids.count(object->ownerPid()) != 0 &&
-                            object->containsFakeRegion()))
-                continue;
-            auto [found, inserted] = objectIndex.emplace(object.get(), objectGroups.size());
-            if (inserted) objectGroups.emplace_back(std::move(object), std::make_shared<HTProcessGroup>());
-            objectGroups[found->second].second->addProcess(process);
+            if (!object || (hidden && !hiddenMappingCounts(*object, visiblePids))) continue;
+            auto [number, isNew] = numbers.insert(object.get());
+            if (isNew) {
+                result.objects.push_back(std::move(object));
+                lastMapper.push_back(kNoProcess);
+            }
+            // A process's regions come one after another, so a process that
+            // maps an object again is the one that mapped it last.
+            if (lastMapper[number] == index) continue;
+            lastMapper[number] = index;
+            mappings.emplace_back(number, index);
         }
     }
 
-    // One frozen representative per set of processes. Every group got its
-    // members in the order of `processes`, so equal sets hash alike; the
-    // representative compares itself with the open candidate by members.
-    std::unordered_map<uint64_t, std::vector<std::shared_ptr<HTProcessGroup>>> representatives;
-    representatives.reserve(6 * visiblePids.size());
-    for (auto& entry : objectGroups) {
-        std::shared_ptr<HTProcessGroup>& group = entry.second;
-        auto& bucket = representatives[group->hash()];
-        auto equal = std::find_if(bucket.begin(), bucket.end(),
-                                  [&group](const auto& representative) { return representative->isEqual(*group); });
-        if (equal != bucket.end()) {
-            group = *equal;
-        } else {
-            group->freeze();
-            bucket.push_back(group);
-        }
-    }
+    // The mappings by object, each object's in process order: a counting sort.
+    result.first.assign(result.objects.size() + 1, 0);
+    for (const auto& mapping : mappings) ++result.first[mapping.first + 1];
+    for (size_t i = 1; i < result.first.size(); ++i) result.first[i] += result.first[i - 1];
+    result.mappers.resize(mappings.size());
+    std::vector<uint32_t> next(result.first.begin(), result.first.end() - 1);
+    for (const auto& [object, process] : mappings) result.mappers[next[object]++] = process;
+    return result;
+}
 
+uint64_t hashOfMappers(std::span<const uint32_t> mappers)
+{
+    uint64_t hash = mappers.size();
+    for (uint32_t index : mappers) hash = htMix(hash + index);
+    return hash;
+}
+
+MapperGroups mapperGroups(const ObjectMappers& mappers, const HTHeft::ProcessList& processes)
+{
+    MapperGroups result;
+    result.groupOf.resize(mappers.objects.size());
+    std::vector<uint32_t> example;  // an object of each group
+    std::unordered_map<uint64_t, std::vector<uint32_t>> groupsByHash;
+    for (uint32_t object = 0; object < mappers.objects.size(); ++object) {
+        const std::span<const uint32_t> members = mappers.of(object);
+        std::vector<uint32_t>& candidates = groupsByHash[hashOfMappers(members)];
+        auto same = std::find_if(candidates.begin(), candidates.end(), [&](uint32_t group) {
+            return std::ranges::equal(mappers.of(example[group]), members);
+        });
+        if (same != candidates.end()) {
+            result.groupOf[object] = *same;
+            continue;
+        }
+        const auto number = static_cast<uint32_t>(result.groups.size());
+        auto group = std::make_shared<HTProcessGroup>();
+        for (uint32_t index : members) group->addProcess(processes[index]);
+        group->freeze();
+        result.groups.push_back(std::move(group));
+        example.push_back(object);
+        candidates.push_back(number);
+        result.groupOf[object] = number;
+    }
+    return result;
+}
+
+}  // namespace
+
+std::unique_ptr<HTHeftSharingData> HTHeft::_sharingData()
+{
+    // Each object with the set of processes that map it, in the order the
+    // objects are first met, so that the report is the same run after run;
+    // one frozen group per distinct set.
+    ObjectMappers mappers = objectMappers(processes_);
+    const MapperGroups grouped = mapperGroups(mappers, processes_);
+    std::vector<std::vector<uint32_t>> objectsOfGroup(grouped.groups.size());
+    for (uint32_t object = 0; object < mappers.objects.size(); ++object)
+        objectsOfGroup[grouped.groupOf[object]].push_back(object);
+
+    // Groups are numbered in the order their first object was met, and are
+    // stored and announced to their members in that order.
     HTHeftSharingData::ProcessToProcessGroups processToProcessGroups;
     HTProcessGroupObjectMap processGroupToObjects;
-    // A group's members learn of it when it is first met; meeting it again
-    // would change nothing, as an ordered set keeps a group once.
-    std::unordered_set<const HTProcessGroup*> announced;
-    for (const auto& [object, group] : objectGroups) {
-        processGroupToObjects.objectsForGroup(group).insert(object);
-        if (!announced.insert(group.get()).second) continue;
+    for (size_t number = 0; number < grouped.groups.size(); ++number) {
+        const std::shared_ptr<HTProcessGroup>& group = grouped.groups[number];
+        ObjectSet& objects = processGroupToObjects.objectsForGroup(group);
+        for (uint32_t object : objectsOfGroup[number]) objects.append(std::move(mappers.objects[object]));
+
         const bool isPrivate = group->count() == 1;
         for (const auto& member : group->processes()) {
             HTProcessGroupOrderedSet* groups = processToProcessGroups.find(member->pid());
@@ -438,6 +533,25 @@ std::unique_ptr<HTHeftSharingData> HTHeft::_sharingData()
 }
 
 // --- the report --------------------------------------------------------------
+
+const HTHeft::GroupTable& HTHeft::tableForGroup(const HTProcessGroup& group, const ObjectSet& objects,
+                                                HTProcess& process, bool summarize, CommonTables& common,
+                                                GroupTable& scratch)
+{
+    GroupTable* table = &scratch;
+    if (group.count() > 1) {
+        // Every member of a shared group prints its table: where they all
+        // see the same, it is made once.
+        auto found = common.find(&group);
+        if (found != common.end()) return found->second;
+        if (std::all_of(objects.begin(), objects.end(),
+                        [](const auto& object) { return object->looksTheSameToEveryProcess(); }))
+            table = &common[&group];
+    }
+    table->categories = _categoriesForObjects(objects, process, &table->hasProcessView, summarize);
+    _totalForCategories(table->categories, &table->total);
+    return *table;
+}
 
 void HTHeft::printSpanlistLikeOutputForProcesses(const ProcessList& processes)
 {
@@ -463,6 +577,8 @@ void HTHeft::printOutputVerbose(bool verbose, bool summarize)
     ProcessList processesWithWarnings;
     ProcessList processesWithErrors;
     std::shared_ptr<HTAuxDataMap> mergedAuxData;
+    CommonTables commonTables;
+    GroupTable scratchTable;
 
     for (const auto& process : reported) {
         const bool hasErrors = !process->errors().empty();
@@ -486,16 +602,14 @@ void HTHeft::printOutputVerbose(bool verbose, bool summarize)
             for (const auto& group : *groups) {
                 static const ObjectSet kNoObjects;
                 const ObjectSet* objects = sharing->processGroupToObjects().find(*group);
-                bool hasProcessView = false;
-                const HTCategoryMap categories =
-                    _categoriesForObjects(objects ? *objects : kNoObjects, *process, &hasProcessView, summarize);
-                HTMemoryTotals total;
-                _totalForCategories(categories, &total);
+                const GroupTable& table = tableForGroup(*group, objects ? *objects : kNoObjects, *process,
+                                                        summarize, commonTables, scratchTable);
                 for (const auto& formatter : outputFormatters_) {
                     if (group->count() == 1)
-                        formatter->printProcessCategories(categories, total);
+                        formatter->printProcessCategories(table.categories, table.total);
                     else
-                        formatter->printSharedCategories(categories, *group, *process, hasProcessView, total);
+                        formatter->printSharedCategories(table.categories, *group, *process,
+                                                         table.hasProcessView, table.total);
                 }
             }
         } else {

@@ -10,6 +10,7 @@
 #include <cstdint>
 #include <functional>
 #include <memory>
+#include <unordered_map>
 #include <vector>
 
 class HTHeftSharingData;
@@ -17,6 +18,7 @@ class HTMemoryObject;
 class HTMemoryObjectMap;
 class HTOutputFormatter;
 class HTProcess;
+class HTProcessGroup;
 class HTSignalSource;
 
 // The analysis driver. It gathers every target process's regions in
@@ -133,6 +135,20 @@ protected:
     ProcessList _processesBySortingHeft(const ProcessList& processes) const;
 
 private:
+    // One table of a process's report: a group's objects as the process
+    // sees them, in categories, and their total.
+    struct GroupTable {
+        HTCategoryMap categories;
+        HTMemoryTotals total;
+        bool hasProcessView = false;
+    };
+    using CommonTables = std::unordered_map<const HTProcessGroup*, GroupTable>;
+
+    // The table of `group` for `process`. A shared group whose objects look
+    // the same to every process has one table for all its members, made on
+    // first use and kept in `common`; any other table is made in `scratch`.
+    const GroupTable& tableForGroup(const HTProcessGroup& group, const ObjectSet& objects, HTProcess& process,
+                                    bool summarize, CommonTables& common, GroupTable& scratch);
     void releaseMemoryObjectMaps();
     void reportUnidentifiedSharedPages() const;
 

@@ -1,8 +1,9 @@
 #pragma once
 
+#include "base/HTPointerIndex.h"
+
 #include <cstddef>
 #include <memory>
-#include <unordered_set>
 #include <utility>
 #include <vector>
 
@@ -10,6 +11,9 @@
 // iterates in the order the objects were first inserted so that the same
 // input always gives the same report. Used for the region sets of memory
 // objects and categories and for the member objects of categories.
+//
+// Not for concurrent use, even to read: a look-up may bring the index up to
+// date.
 template <typename T>
 class HTIdentitySet {
 public:
@@ -19,17 +23,14 @@ public:
     // true when it was added.
     bool insert(std::shared_ptr<T> item)
     {
-        if (index_.empty() && items_.size() < kLinearSize) {
-            if (contains(item.get())) return false;
-        } else {
-            if (index_.empty()) {
-                for (const auto& present : items_) index_.insert(present.get());
-            }
-            if (!index_.insert(item.get()).second) return false;
-        }
-        items_.push_back(std::move(item));
+        if (contains(item.get())) return false;
+        append(std::move(item));
         return true;
     }
+
+    // Adds an object that the caller knows is not present, without looking:
+    // routing adds tens of thousands of regions, each to one object once.
+    void append(std::shared_ptr<T> item) { items_.push_back(std::move(item)); }
 
     void unite(const HTIdentitySet& other)
     {
@@ -38,10 +39,14 @@ public:
 
     bool contains(const T* item) const
     {
-        if (!index_.empty()) return index_.count(item) != 0;
-        for (const auto& present : items_)
-            if (present.get() == item) return true;
-        return false;
+        if (items_.size() <= kLinearSize) {
+            for (const auto& present : items_)
+                if (present.get() == item) return true;
+            return false;
+        }
+        // The index learns of the objects added since it was last asked.
+        for (; indexed_ < items_.size(); ++indexed_) index_.insert(items_[indexed_].get());
+        return index_.contains(item);
     }
     size_t size() const { return items_.size(); }
     bool empty() const { return items_.empty(); }
@@ -54,6 +59,8 @@ private:
     static constexpr size_t kLinearSize = 16;
 
     std::vector<std::shared_ptr<T>> items_;
-    // Empty until the set outgrows kLinearSize.
-    std::unordered_set<const T*> index_;
+    // The first indexed_ items, once the set has outgrown kLinearSize and
+    // been searched.
+    mutable HTPointerIndex index_;
+    mutable size_t indexed_ = 0;
 };

@@ -3,6 +3,8 @@
 #include "model/HTMemoryObject.h"
 #include "model/HTMemoryRegion.h"
 
+#include <algorithm>
+
 HTMemoryCategory::HTMemoryCategory(uint8_t segment, bool summary) : isSummary_(summary), segment_(segment) {}
 
 void HTMemoryCategory::addMemoryObject(const std::shared_ptr<HTMemoryObject>& object)
@@ -18,8 +20,24 @@ void HTMemoryCategory::addMemoryObject(const std::shared_ptr<HTMemoryObject>& ob
     // distinct set once therefore counts each region once, without merging
     // thousands of regions per shared library for every process's table.
     const RegionSet& regions = object->memoryRegions();
-    if (memberRegionSets_.insert(&regions).second) regionCount_ += regions.size();
+    if (isNewRegionSet(regions)) regionCount_ += regions.size();
     memoryRegionsBuilt_ = false;
+}
+
+bool HTMemoryCategory::isNewRegionSet(const RegionSet& regions)
+{
+    // The members before the one just added. Tables have a few; only the
+    // summary's categories grow large enough to need an index.
+    const auto earlier = static_cast<std::ptrdiff_t>(memoryObjects_.size() - 1);
+    if (earlier <= kLinearSize) {
+        return std::none_of(memoryObjects_.begin(), memoryObjects_.begin() + earlier,
+                            [&regions](const auto& member) { return &member->memoryRegions() == &regions; });
+    }
+    if (memberRegionSets_.size() == 0) {
+        for (auto member = memoryObjects_.begin(); member != memoryObjects_.begin() + earlier; ++member)
+            memberRegionSets_.insert(&(*member)->memoryRegions());
+    }
+    return memberRegionSets_.insert(&regions).second;
 }
 
 const HTMemoryCategory::RegionSet& HTMemoryCategory::memoryRegions() const
@@ -32,15 +50,21 @@ const HTMemoryCategory::RegionSet& HTMemoryCategory::memoryRegions() const
     return memoryRegions_;
 }
 
-std::optional<std::string> HTMemoryCategory::name() const
+namespace {
+
+const std::optional<std::string> kNoName;
+
+}  // namespace
+
+const std::optional<std::string>& HTMemoryCategory::name() const
 {
-    if (memoryObjects_.empty()) return std::nullopt;
+    if (memoryObjects_.empty()) return kNoName;
     return memoryObjects_.front()->name();
 }
 
-std::optional<std::string> HTMemoryCategory::detailedName() const
+const std::optional<std::string>& HTMemoryCategory::detailedName() const
 {
-    if (isSummary_ || memoryObjects_.empty()) return std::nullopt;
+    if (isSummary_ || memoryObjects_.empty()) return kNoName;
     return memoryObjects_.front()->detailedName();
 }
 

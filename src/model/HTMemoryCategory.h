@@ -1,12 +1,12 @@
 #pragma once
 
+#include "base/HTPointerIndex.h"
 #include "model/HTIdentitySet.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <string>
-#include <unordered_set>
 
 class HTMemoryObject;
 class HTMemoryRegion;
@@ -47,14 +47,20 @@ public:
     void addMemoryObject(const std::shared_ptr<HTMemoryObject>& object);
 
     // All members are filed under one key, so any member names the category.
-    // nullopt when there is no member.
-    std::optional<std::string> name() const;
+    // nullopt when there is no member. The references stay valid as long as
+    // the members' regions.
+    const std::optional<std::string>& name() const;
     // nullopt for a summary category, whatever its members say.
-    std::optional<std::string> detailedName() const;
+    const std::optional<std::string>& detailedName() const;
     // A summary category's full name is its name.
     std::optional<std::string> fullName() const;
 
 private:
+    static constexpr std::ptrdiff_t kLinearSize = 16;
+
+    // Whether no earlier member holds the newest member's region set.
+    bool isNewRegionSet(const RegionSet& regions);
+
     bool isSummary_;
     ObjectSet memoryObjects_;
     uint8_t segment_;
@@ -63,8 +69,9 @@ private:
     uint64_t totalCleanSize_ = 0;
     uint64_t totalReclaimableSize_ = 0;
     uint64_t totalWiredSize_ = 0;
-    // Region sets of the members already counted, by identity.
-    std::unordered_set<const RegionSet*> memberRegionSets_;
+    // Region sets of the members already counted, by identity, once there
+    // are more than kLinearSize members.
+    HTPointerIndex memberRegionSets_;
     uint64_t regionCount_ = 0;
     mutable RegionSet memoryRegions_;
     mutable bool memoryRegionsBuilt_ = true;

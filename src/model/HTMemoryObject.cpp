@@ -6,6 +6,12 @@
 
 #include <algorithm>
 
+namespace {
+
+const std::optional<std::string> kNoName;
+
+}  // namespace
+
 HTMemoryObject::HTMemoryObject() : memoryRegions_(std::make_shared<RegionSet>()) {}
 HTMemoryObject::~HTMemoryObject() = default;
 
@@ -24,7 +30,7 @@ void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, u
 {
     if (accurateSizes_) HT_FATAL("HTMemoryObject", "region added to a finalised object");
     HT_ASSERT("HTMemoryObject", region != nullptr, "region != nil");
-    memoryRegions_->insert(region);
+    memoryRegions_->append(region);
     // A region without an object id names and lists the object but counts
     // for nothing.
     if (region->object_id() == 0) return;
@@ -213,16 +219,16 @@ bool HTMemoryObject::containsFakeRegion() const
     return false;
 }
 
-std::optional<std::string> HTMemoryObject::name() const
+const std::optional<std::string>& HTMemoryObject::name() const
 {
     const HTMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->name() : std::nullopt;
+    return canonical ? canonical->name() : kNoName;
 }
 
-std::optional<std::string> HTMemoryObject::detailedName() const
+const std::optional<std::string>& HTMemoryObject::detailedName() const
 {
     const HTMemoryRegion* canonical = _canonicalRegion();
-    return canonical ? canonical->detailedName() : std::nullopt;
+    return canonical ? canonical->detailedName() : kNoName;
 }
 
 std::optional<std::string> HTMemoryObject::fullName() const

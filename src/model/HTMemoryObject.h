@@ -58,7 +58,8 @@ public:
     const HTRangeList* rangeList() const { return rangeList_.get(); }
     void setRangeList(std::unique_ptr<HTRangeList> list) { rangeList_ = std::move(list); }
 
-    // Adds a region mapped by `process`, recording it per process.
+    // Adds a region mapped by `process`, recording it per process. Each
+    // region is added once: its pages would otherwise count twice.
     void addRegion(const std::shared_ptr<HTMemoryRegion>& region, const HTProcess& process);
     // Adds a region without recording a process.
     void addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize);
@@ -76,14 +77,20 @@ public:
     // when another process owns it, else this object itself. (The process is
     // not const: asking it for its heft mode may read the kernel setting.)
     std::shared_ptr<HTMemoryObject> viewForProcess(HTProcess& process, bool breakDownPhysHeft);
+    // Whether viewForProcess gives every process this object itself.
+    bool looksTheSameToEveryProcess() const
+    {
+        return (!processMemoryRegions_ || processMemoryRegions_->empty()) && ownerPid_ == -1;
+    }
     // A finalised copy sharing the region set, without reclaimable total,
     // per-process map or range list. The object must be finalised.
     std::shared_ptr<HTMemoryObject> copy() const;
 
     bool containsFakeRegion() const;
     // The names of the representative region; nullopt when there is none.
-    std::optional<std::string> name() const;
-    std::optional<std::string> detailedName() const;
+    // The references stay valid as long as the object's regions.
+    const std::optional<std::string>& name() const;
+    const std::optional<std::string>& detailedName() const;
     std::optional<std::string> fullName() const;
 
 protected:

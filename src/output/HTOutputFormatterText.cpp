@@ -7,11 +7,12 @@
 #include "model/HTCategoryMap.h"
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryRegion.h"
+#include "output/HTSizeText.h"
 #include "process/HTProcess.h"
 
-#include <bsd/libutil.h>
-
 #include <algorithm>
+#include <charconv>
+#include <cstring>
 #include <functional>
 
 namespace {
@@ -19,6 +20,23 @@ namespace {
 constexpr const char* kModule = "HTOutputFormatterText";
 constexpr const char* kEquals = "==========";
 constexpr const char* kDashes = "---";
+
+// The widest a size column gets: its width or its longest text.
+constexpr size_t kColumnCapacity = 32;
+static_assert(kColumnCapacity >= kHTSizeTextCapacity);
+
+// Writes `text` right-aligned in `width` columns, as printf's "%*s": a
+// longer text is never cut. Returns the end of what was written.
+char* putRightAligned(char* out, std::string_view text, int width)
+{
+    if (static_cast<size_t>(width) > text.size()) {
+        const size_t pad = static_cast<size_t>(width) - text.size();
+        std::memset(out, ' ', pad);
+        out += pad;
+    }
+    std::memcpy(out, text.data(), text.size());
+    return out + text.size();
+}
 
 // Whole pages holding `bytes`, rounded up; no pages without a page size.
 uint64_t pagesForSize(uint64_t bytes, uint64_t pageSize)
@@ -89,50 +107,58 @@ void HTOutputFormatterText::setOptions(int64_t value)
 
 std::string HTOutputFormatterText::formattedStringForSize(uint64_t size) const
 {
-    char buffer[64];
+    char text[kHTSizeTextCapacity];
+    return std::string(text, formatSize(size, text));
+}
+
+size_t HTOutputFormatterText::formatSize(uint64_t size, char* out) const
+{
     switch (summaryFormat_) {
-    case HTTextFormatBytes:
-        std::snprintf(buffer, sizeof(buffer), "%lld B", static_cast<long long>(size));
-        return buffer;
-    case HTTextFormatFormatted: {
-        // Eight bytes leave room for four digits, a space and a two-letter unit.
-        char humanized[8];
-        humanize_number(humanized, sizeof(humanized), static_cast<int64_t>(size), "B", HN_AUTOSCALE, 0);
-        return humanized;
+    case HTTextFormatBytes: return htBytesText(size, out);
+    case HTTextFormatFormatted: return htHumanizedText(size, out);
+    case HTTextFormatPages: return htPagesText(pagesForSize(size, pageSize_), out);
+    default: HT_FATAL(kModule, "Unhandled summary format");
     }
-    case HTTextFormatPages:
-        std::snprintf(buffer, sizeof(buffer), "%llu pages",
-                      static_cast<unsigned long long>(pagesForSize(size, pageSize_)));
-        return buffer;
-    default:
-        HT_FATAL(kModule, "Unhandled summary format");
-    }
+}
+
+std::optional<std::string_view> HTOutputFormatterText::shortenedComponent(std::string_view name) const
+{
+    if (options_ & HTTextOptionWide) return std::nullopt;
+    size_t end = name.find_last_not_of('/');
+    // Nothing but slashes (or nothing at all): there is no shorter form.
+    if (end == std::string_view::npos) return std::nullopt;
+    size_t slash = name.rfind('/', end);
+    size_t begin = slash == std::string_view::npos ? 0 : slash + 1;
+    std::string_view last = name.substr(begin, end + 1 - begin);
+    if (last.size() == name.size()) return std::nullopt;
+    return last;
 }
 
 std::optional<std::string> HTOutputFormatterText::_truncatedNameForString(const std::optional<std::string>& name) const
 {
-    if (!name || (options_ & HTTextOptionWide)) return name;
-    const std::string& whole = *name;
-    size_t end = whole.find_last_not_of('/');
-    // Nothing but slashes (or nothing at all): there is no shorter form.
-    if (end == std::string::npos) return name;
-    size_t slash = whole.rfind('/', end);
-    size_t begin = slash == std::string::npos ? 0 : slash + 1;
-    std::string last = whole.substr(begin, end + 1 - begin);
-    if (last.size() == whole.size()) return name;
-    return ".../" + last;
+    if (!name) return name;
+    std::optional<std::string_view> last = shortenedComponent(*name);
+    if (!last) return name;
+    return ".../" + std::string(*last);
+}
+
+std::vector<const HTCategoryMap::Entry*> HTOutputFormatterText::sortedEntries(const HTCategoryMap& categories) const
+{
+    CategoryOrder order = orderForSortColumn(sort_);
+    std::vector<const HTCategoryMap::Entry*> entries;
+    entries.reserve(categories.size());
+    for (const auto& entry : categories) entries.push_back(&entry);
+    // Stable, so that equal rows keep the map's order and the report does
+    // not change from run to run.
+    std::stable_sort(entries.begin(), entries.end(),
+                     [&order](const HTCategoryMap::Entry* a, const HTCategoryMap::Entry* b) { return order(*a, *b); });
+    return entries;
 }
 
 std::vector<std::string> HTOutputFormatterText::_sortedKeysForCategories(const HTCategoryMap& categories) const
 {
-    CategoryOrder order = orderForSortColumn(sort_);
-    std::vector<HTCategoryMap::Entry> entries(categories.begin(), categories.end());
-    // Stable, so that equal rows keep the map's order and the report does
-    // not change from run to run.
-    std::stable_sort(entries.begin(), entries.end(), order);
     std::vector<std::string> keys;
-    keys.reserve(entries.size());
-    for (auto& entry : entries) keys.push_back(std::move(entry.first));
+    for (const HTCategoryMap::Entry* entry : sortedEntries(categories)) keys.push_back(entry->first);
     return keys;
 }
 
@@ -149,44 +175,88 @@ HTOutputFormatterText::ColumnWidths HTOutputFormatterText::columnWidths() const
     };
 }
 
-void HTOutputFormatterText::printHeadingRow()
+char* HTOutputFormatterText::putSize(char* out, uint64_t size, int width) const
+{
+    char text[kHTSizeTextCapacity];
+    return putRightAligned(out, std::string_view(text, formatSize(size, text)), width);
+}
+
+void HTOutputFormatterText::writeLine()
+{
+    std::fwrite(line_.data(), 1, line_.size(), output_);
+    line_.clear();
+}
+
+void HTOutputFormatterText::printColumnsRow(const std::string_view (&columns)[5], std::string_view regions,
+                                            std::string_view category)
 {
     const ColumnWidths w = columnWidths();
-    std::fprintf(output_, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, "Dirty", w.swapped,
-                 swappedColumnName_ ? swappedColumnName_->c_str() : "", w.clean, "Clean", w.reclaimable,
-                 "Reclaimable", w.wired, wiredColumnName_ ? wiredColumnName_->c_str() : "", "Regions", "Category");
+    const int widths[5] = {w.dirty, w.swapped, w.clean, w.reclaimable, w.wired};
+    char row[8 * kColumnCapacity];
+    char* end = row;
+    for (size_t i = 0; i < 5; ++i) end = putRightAligned(end, columns[i], widths[i]);
+    *end++ = ' ';
+    end = putRightAligned(end, regions, 10);
+    line_.append(row, end);
+    line_.append("    ");
+    line_.append(category);
+    line_.append("\n");
+    writeLine();
+}
+
+void HTOutputFormatterText::printHeadingRow()
+{
+    printColumnsRow({"Dirty", swappedColumnName_ ? *swappedColumnName_ : "", "Clean", "Reclaimable",
+                     wiredColumnName_ ? *wiredColumnName_ : ""},
+                    "Regions", "Category");
 }
 
 void HTOutputFormatterText::printDashRow()
 {
-    const ColumnWidths w = columnWidths();
-    std::fprintf(output_, "%*s%*s%*s%*s%*s %10s    %s\n", w.dirty, kDashes, w.swapped,
-                 swappedColumnName_ ? kDashes : "", w.clean, kDashes, w.reclaimable, kDashes, w.wired,
-                 wiredColumnName_ ? kDashes : "", kDashes, kDashes);
+    printColumnsRow({kDashes, swappedColumnName_ ? kDashes : "", kDashes, kDashes, wiredColumnName_ ? kDashes : ""},
+                    kDashes, kDashes);
 }
 
 void HTOutputFormatterText::printSizeRow(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable,
-                                         uint64_t wired, long long regions, const std::string& name,
-                                         const std::string& detail)
+                                         uint64_t wired, long long regions, std::string_view name,
+                                         const std::optional<std::string>& detail)
 {
+    // The figures, of bounded width, go through a buffer on the stack.
     const ColumnWidths w = columnWidths();
-    const std::string swappedText = swappedColumnName_ ? formattedStringForSize(swapped) : "";
-    const std::string wiredText = wiredColumnName_ ? formattedStringForSize(wired) : "";
-    std::fprintf(output_, "%*s%*s%*s%*s%*s %10lld    %s%s\n", w.dirty, formattedStringForSize(dirty).c_str(),
-                 w.swapped, swappedText.c_str(), w.clean, formattedStringForSize(clean).c_str(), w.reclaimable,
-                 formattedStringForSize(reclaimable).c_str(), w.wired, wiredText.c_str(), regions, name.c_str(),
-                 detail.c_str());
+    char figures[6 * kColumnCapacity];
+    char* end = putSize(figures, dirty, w.dirty);
+    if (swappedColumnName_) end = putSize(end, swapped, w.swapped);
+    end = putSize(end, clean, w.clean);
+    end = putSize(end, reclaimable, w.reclaimable);
+    if (wiredColumnName_) end = putSize(end, wired, w.wired);
+    *end++ = ' ';
+    char count[24];
+    end = putRightAligned(end, std::string_view(count, std::to_chars(count, count + sizeof(count), regions).ptr - count),
+                          10);
+    line_.append(figures, end);
+    line_.append("    ");
+    line_.append(name);
+    if (detail) {
+        line_.append(" ");
+        if (std::optional<std::string_view> last = shortenedComponent(*detail)) {
+            line_.append(".../");
+            line_.append(*last);
+        } else {
+            line_.append(*detail);
+        }
+    }
+    line_.append("\n");
+    writeLine();
 }
 
 void HTOutputFormatterText::_printCategories(const HTCategoryMap& categories)
 {
-    for (const std::string& key : _sortedKeysForCategories(categories)) {
-        const HTMemoryCategory& category = *categories.find(key);
-        std::optional<std::string> name = category.name();
-        std::optional<std::string> detail = _truncatedNameForString(category.detailedName());
+    for (const HTCategoryMap::Entry* entry : sortedEntries(categories)) {
+        const HTMemoryCategory& category = *entry->second;
+        const std::optional<std::string>& name = category.name();
         printSizeRow(category.totalDirtySize() + category.totalSwappedSize(), category.totalSwappedSize(),
                      category.totalCleanSize(), category.totalReclaimableSize(), category.totalWiredSize(),
-                     category.totalRegions(), name ? *name : key, detail ? " " + *detail : std::string());
+                     category.totalRegions(), name ? *name : entry->first, category.detailedName());
     }
 }
 
@@ -194,7 +264,7 @@ void HTOutputFormatterText::_printTotalFooter(const HTMemoryTotals& total)
 {
     printDashRow();
     printSizeRow(total.dirty + total.swapped, total.swapped, total.clean, total.reclaimable, total.wired,
-                 total.regions, "TOTAL", "");
+                 total.regions, "TOTAL", std::nullopt);
 }
 
 void HTOutputFormatterText::_printPhysHeftBreakdownEnabled()
@@ -202,11 +272,17 @@ void HTOutputFormatterText::_printPhysHeftBreakdownEnabled()
     if (!breakDownPhysHeft_) std::fprintf(output_, "VM Object Dirty Analysis: Enabled\n");
 }
 
+void HTOutputFormatterText::appendEqualsRule()
+{
+    // Ten signs for every column shown.
+    const int tens = 7 + (swappedColumnName_ ? 1 : 0) + (wiredColumnName_ ? 1 : 0);
+    for (int i = 0; i < tens; ++i) line_.append(kEquals);
+}
+
 void HTOutputFormatterText::printEqualsRule()
 {
-    std::fprintf(output_, "%s%s%s%*s%s%s%*s%s%s", kEquals, kEquals, kEquals, swappedColumnName_ ? 10 : 0,
-                 swappedColumnName_ ? kEquals : "", kEquals, kEquals, wiredColumnName_ ? 10 : 0,
-                 wiredColumnName_ ? kEquals : "", kEquals, kEquals);
+    appendEqualsRule();
+    writeLine();
 }
 
 void HTOutputFormatterText::printTable(const HTCategoryMap& categories, const HTMemoryTotals& total)
@@ -228,19 +304,23 @@ void HTOutputFormatterText::printSharedCategories(const HTCategoryMap& categorie
                                                   const HTMemoryTotals& total)
 {
     const auto& members = sharedWith.processes();
+    line_.append("Shared with");
     if (members.size() < 21) {
-        std::vector<const HTProcess*> others;
+        // The others, separated by commas.
+        bool first = true;
         for (const auto& member : members) {
-            if (!member->isEqual(forProcess)) others.push_back(member.get());
+            if (member->isEqual(forProcess)) continue;
+            line_.append(first ? " " : ", ");
+            line_.append(member->displayString());
+            first = false;
         }
-        std::fprintf(output_, "Shared with");
-        for (size_t i = 0; i < others.size(); ++i) {
-            std::fprintf(output_, " %s%s", others[i]->displayString().c_str(), i + 1 < others.size() ? "," : "");
-        }
-        std::fprintf(output_, ":\n");
+        line_.append(":\n");
     } else {
-        std::fprintf(output_, "Shared with %lu processes:\n", static_cast<unsigned long>(members.size()));
+        line_.append(" ");
+        line_.append(std::to_string(members.size()));
+        line_.append(" processes:\n");
     }
+    writeLine();
     printProcessCategories(categories, total);
 }
 

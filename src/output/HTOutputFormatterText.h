@@ -1,11 +1,13 @@
 #pragma once
 
+#include "model/HTCategoryMap.h"
 #include "output/HTOutputFormatter.h"
 
 #include <cstdint>
 #include <cstdio>
 #include <optional>
 #include <string>
+#include <string_view>
 #include <vector>
 
 class HTAuxDataMap;
@@ -48,6 +50,9 @@ public:
 
     // A size as the summary format writes it: "16384 B", "16 KB", "4 pages".
     std::string formattedStringForSize(uint64_t size) const;
+    // The same text written into `out`, of at least kHTSizeTextCapacity
+    // bytes; returns its length.
+    size_t formatSize(uint64_t size, char* out) const;
 
     // --- HTOutputFormatter ---------------------------------------------------
     bool respondsToSpanlistLikeOutput() const override { return true; }
@@ -88,12 +93,29 @@ private:
         int dirty, swapped, clean, reclaimable, wired;
     };
     ColumnWidths columnWidths() const;
+    // The rows in the order of the sort column, as _sortedKeysForCategories.
+    std::vector<const HTCategoryMap::Entry*> sortedEntries(const HTCategoryMap& categories) const;
+    // The last component of a name that is shown shortened; nullopt when
+    // the name is shown whole.
+    std::optional<std::string_view> shortenedComponent(std::string_view name) const;
+
+    // Rows are built in line_ and written with one call each: the tables
+    // make up nearly all of a report of many processes.
+    // A size right-aligned in `width` columns at `out`, which has room for
+    // the wider of the two; returns the end of what was written.
+    char* putSize(char* out, uint64_t size, int width) const;
+    void appendEqualsRule();
+    void writeLine();
+
+    // A row of five column texts (empty for a column that is off), the
+    // region column and the category column, as the heading and dash rows.
+    void printColumnsRow(const std::string_view (&columns)[5], std::string_view regions, std::string_view category);
     void printHeadingRow();
     void printDashRow();
-    // One row of five sizes, a region count and a name, with `detail` (which
-    // carries its own leading space) or nothing after it.
+    // One row of five sizes, a region count and a name, followed by the
+    // detail, when there is one, after a space.
     void printSizeRow(uint64_t dirty, uint64_t swapped, uint64_t clean, uint64_t reclaimable, uint64_t wired,
-                      long long regions, const std::string& name, const std::string& detail);
+                      long long regions, std::string_view name, const std::optional<std::string>& detail);
     void printTable(const HTCategoryMap& categories, const HTMemoryTotals& total);
     void printEqualsRule();
 
@@ -106,4 +128,5 @@ private:
     std::string sort_;
     FILE* output_;
     bool breakDownPhysHeft_;
+    std::string line_;
 };
