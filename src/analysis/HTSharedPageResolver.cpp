@@ -105,7 +105,7 @@ void HTSharedPageResolver::registerPages()
     // Every identified page gets a number, in the order of the candidates
     // and of their pages: consecutive pages of one region have consecutive
     // numbers.
-    std::vector<IdentifiedPage> identified;
+    IdentifiedPages identified;
     size_t total = 0;
     for (const Candidate& candidate : candidates_) total += candidate.region->sharedPageList()->identifiedPages();
     identified.reserve(total);
@@ -139,7 +139,7 @@ void HTSharedPageResolver::registerPages()
     }
 }
 
-void HTSharedPageResolver::sortByIdentity(std::vector<IdentifiedPage>& pages)
+void HTSharedPageResolver::sortByIdentity(IdentifiedPages& pages)
 {
     // A radix sort a byte at a time from the lowest: stable, and a few
     // passes over the pages where a comparison sort takes twenty. Bytes
@@ -150,7 +150,7 @@ void HTSharedPageResolver::sortByIdentity(std::vector<IdentifiedPage>& pages)
     for (const IdentifiedPage& page : pages)
         for (unsigned byte = 0; byte < kBytes; ++byte) ++counts[byte][(page.identity >> (8 * byte)) & 0xFF];
 
-    std::vector<IdentifiedPage> sorted;
+    IdentifiedPages sorted;
     for (unsigned byte = 0; byte < kBytes; ++byte) {
         const unsigned shift = 8 * byte;
         std::array<uint32_t, 256>& count = counts[byte];

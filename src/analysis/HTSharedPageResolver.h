@@ -1,5 +1,7 @@
 #pragma once
 
+#include "base/HTHugePageAllocator.h"
+
 #include <cstdint>
 #include <memory>
 #include <vector>
@@ -58,7 +60,8 @@ private:
 
     // Sorts the pages by identity, keeping the order of pages of one
     // identity.
-    static void sortByIdentity(std::vector<IdentifiedPage>& pages);
+    using IdentifiedPages = std::vector<IdentifiedPage, HTHugePageAllocator<IdentifiedPage>>;
+    static void sortByIdentity(IdentifiedPages& pages);
 
     void registerPages();
     void cutRegions();
@@ -68,6 +71,6 @@ private:
 
     const ProcessList& processes_;
     std::vector<Candidate> candidates_;
-    std::vector<PageSet> pages_;
+    std::vector<PageSet, HTHugePageAllocator<PageSet>> pages_;
     std::unique_ptr<ProcessSets> sets_;
 };
