@@ -88,6 +88,8 @@ public:
 
     const FormatterList& outputFormatters() const { return outputFormatters_; }
     void addOutputFormatter(std::shared_ptr<HTOutputFormatter> formatter);
+    // Lets go of the output formatters, which finish and close their files.
+    void finishOutput() { outputFormatters_.clear(); }
 
     // Makes gathering skip the processes it has not begun. Safe to call from
     // any thread, at any time.

@@ -8,6 +8,7 @@
 #include "platform/HTSignalSource.h"
 
 #include <cstdio>
+#include <cstdlib>
 
 namespace {
 
@@ -53,7 +54,7 @@ void gather(HTHeft& heft, HTPlatform& platform)
 
 }  // namespace
 
-int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform)
+int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone)
 {
     HTError error;
     std::unique_ptr<HTHeftArgs> args = HTHeftArgs::initWithArgc(argc, argv, &error);
@@ -88,5 +89,11 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform)
         args->summaryFormat(), args->textOptions(), args->textSort(), HTHeft::breakDownPhysHeft(*platform)));
     if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
     heft.printOutputVerbose(args->spanlistLikeOutput(), args->summarize());
+    if (exitWhenDone) {
+        heft.finishOutput();
+        jsonFormatter.reset();
+        std::fflush(nullptr);
+        std::_Exit(0);
+    }
     return 0;
 }

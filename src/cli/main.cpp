@@ -38,5 +38,5 @@ void restartWithHugePageHeaps(char** argv)
 int main(int argc, char** argv)
 {
     restartWithHugePageHeaps(argv);
-    return heftMain(argc, argv, std::make_shared<HTLinuxPlatform>());
+    return heftMain(argc, argv, std::make_shared<HTLinuxPlatform>(), true);
 }
