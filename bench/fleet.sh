@@ -100,7 +100,7 @@ peak_kib=$(/usr/bin/time -f %M "$heft" -a 2>&1 > /dev/null | tail -n 1)
 summary=$({ "$heft" -a -f bytes 2> /dev/null || true; } | sed -n 's/^Summary Heft: \([0-9]*\) B.*/\1/p')
 # Processes heft may not read (pid 1 in some containers) are left out of both.
 kernel=$({ cat /proc/[0-9]*/smaps_rollup /proc/[0-9]*/status 2> /dev/null || true; } |
-    awk '$1 == "Pss_Dirty:" || $1 == "SwapPss:" || $1 == "VmPTE:" { total += $2 } END { printf "%d", total * 1024 }')
+    awk '$1 == "Pss_Dirty:" || $1 == "SwapPss:" || $1 == "VmPTE:" { total += $2 } END { printf "%.0f", total * 1024 }')
 
 ms() { printf '%d.%03d ms' $(($1 / 1000000)) $((($1 / 1000) % 1000)); }
 echo "cat /proc/*/smaps: $(ms "$smaps_ns") (best of $runs)"
