@@ -145,6 +145,16 @@ const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images,
     return nullptr;
 }
 
+// The state letter of the process (R, S, D, ...); 0 when unreadable.
+char processState(pid_t pid)
+{
+    HTProcBuffer stat;
+    if (!stat.readFile(AT_FDCWD, ("/proc/" + std::to_string(pid) + "/stat").c_str())) return 0;
+    std::string_view text = stat.view();
+    size_t close = text.rfind(')');
+    return close != std::string_view::npos && close + 2 < text.size() ? text[close + 2] : 0;
+}
+
 // The name of the image segment holding the address; empty when none.
 std::string segmentAt(const HTPlatformImage& image, uint64_t address)
 {
@@ -287,16 +297,13 @@ TEST(HTElfImageReader, ListsAChildProcess)
     auto task = openTask(child.pid());
     ASSERT_NE(task, nullptr);
     HTElfImageReader reader;
-    // exec has returned; the dynamic loader may still be mapping libraries.
-    std::vector<HTPlatformImage> images;
+    // exec has returned; the dynamic loader may still be mapping libraries
+    // and protecting their relocated data. Once the child sleeps, its
+    // mappings stay as they are.
     auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    for (;;) {
-        images = listImages(reader, *task);
-        bool hasLibc = std::any_of(images.begin(), images.end(),
-                                   [](const HTPlatformImage& image) { return image.path.find("/libc.so") != std::string::npos; });
-        if (hasLibc || std::chrono::steady_clock::now() > deadline) break;
-        std::this_thread::sleep_for(std::chrono::milliseconds(20));
-    }
+    while (processState(child.pid()) != 'S' && std::chrono::steady_clock::now() < deadline)
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    std::vector<HTPlatformImage> images = listImages(reader, *task);
     const HTPlatformImage* sleep = imageWithPath(images, "/bin/sleep");
     ASSERT_NE(sleep, nullptr);
     EXPECT_EQ(segmentAt(*sleep, sleep->baseAddress), "__LINKEDIT");
