@@ -4,7 +4,9 @@
 #include "model/HTAuxDataMap.h"
 #include "process/HTKernelProcess.h"
 #include "process/HTUserProcess.h"
+#include "platform/HTWorkQueue.h"
 
+#include <algorithm>
 #include <cerrno>
 #include <charconv>
 #include <cstdio>
@@ -22,6 +24,20 @@ std::vector<std::string>& globalErrorList()
 {
     static std::vector<std::string> list;
     return list;
+}
+
+// Where the errors of the process being set up on this thread go, when
+// processes are set up side by side; the main thread adds them to the
+// global list afterwards, in the order of the process list.
+thread_local std::vector<std::string>* capturedErrors = nullptr;
+
+// Threads for setting up the processes of a listing: one per core, and
+// none for a handful of processes.
+unsigned setupThreadCount(size_t processes)
+{
+    constexpr size_t kProcessesPerThread = 64;
+    return static_cast<unsigned>(
+        std::clamp<size_t>(processes / kProcessesPerThread, 1, HTWorkQueue::defaultThreadCount()));
 }
 
 // Every readable process record of the system, in the order the kernel
@@ -169,11 +185,26 @@ std::optional<HTProcess::ProcessMap> HTProcess::allProcessesExcludingPids(
 {
     auto records = listAllProcesses(*platform);
     if (!records) return std::nullopt;
+    std::erase_if(*records, [&](const proc_bsdinfo& info) {
+        return excludedPids.count(static_cast<int32_t>(info.pbi_pid)) != 0;
+    });
+
+    // Setting up a process reads several of its files; thousands of
+    // processes are set up side by side, each touching only its own.
+    std::vector<std::shared_ptr<HTProcess>> made(records->size());
+    std::vector<std::vector<std::string>> errors(records->size());
+    {
+        HTWorkQueue queue(kSetupQueueLabel, setupThreadCount(records->size()));
+        queue.parallelFor(records->size(), [&](size_t index) {
+            capturedErrors = &errors[index];
+            made[index] = processWithBsdInfo(platform, (*records)[index]);
+            capturedErrors = nullptr;
+        });
+    }
     ProcessMap processes;
-    for (const auto& info : *records) {
-        int32_t pid = static_cast<int32_t>(info.pbi_pid);
-        if (excludedPids.count(pid)) continue;
-        if (auto process = processWithBsdInfo(platform, info)) processes.set(pid, std::move(process));
+    for (size_t index = 0; index < records->size(); ++index) {
+        for (std::string& error : errors[index]) _addGlobalError(std::move(error));
+        if (made[index]) processes.set(static_cast<int32_t>((*records)[index].pbi_pid), std::move(made[index]));
     }
     return processes;
 }
@@ -246,7 +277,13 @@ HTProcess::ProcessMap HTProcess::removeIdleExitCleanProcessesFrom(const ProcessM
     return kept;
 }
 
-void HTProcess::_addGlobalError(std::string error) { globalErrorList().push_back(std::move(error)); }
+void HTProcess::_addGlobalError(std::string error)
+{
+    if (capturedErrors != nullptr)
+        capturedErrors->push_back(std::move(error));
+    else
+        globalErrorList().push_back(std::move(error));
+}
 
 std::vector<std::string> HTProcess::globalErrors() { return globalErrorList(); }
 

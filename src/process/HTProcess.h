@@ -100,6 +100,8 @@ public:
 
     // The program-wide list of errors not tied to one process. Written on
     // the main thread only.
+    // Labels the threads that set up the processes of a listing.
+    static constexpr const char* kSetupQueueLabel = "heft.setup";
     static void _addGlobalError(std::string error);
     static std::vector<std::string> globalErrors();
     static void _clearGlobalErrors();
