@@ -11,6 +11,8 @@
 #include <fcntl.h>
 #include <optional>
 #include <string>
+#include <thread>
+#include <chrono>
 #include <sys/mman.h>
 #include <sys/syscall.h>
 #include <unistd.h>
@@ -399,4 +401,50 @@ TEST_F(HTLinuxAddressSpace, PhysicalHeftPageTableLedgerAndPaths)
     std::optional<std::string> resolved = platform_.realpath("/tmp/.." + filePath_);
     EXPECT_EQ(resolved, std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
+}
+
+TEST(HTLinuxAddressSpaceExit, ProcessKilledWhileItsMappingsAreReadIsNeverWhole)
+{
+    // Tens of thousands of mappings take the kernel milliseconds to list;
+    // a kill lands in the middle of the listing, and the text then ends
+    // early without an error. Whatever the moment of the kill, the walk
+    // either has every mapping or says that the process exited.
+    constexpr size_t kMappings = 30000;
+    const size_t page = pageSize();
+    for (int delayMs : {1, 3, 6, 10, 20}) {
+        SCOPED_TRACE("kill after " + std::to_string(delayMs) + " ms");
+        int ready[2];
+        ASSERT_EQ(::pipe(ready), 0);
+        HTTestChild child = HTTestChild::fork([&] {
+            // Every other page inaccessible: no two mappings can merge.
+            auto* base = static_cast<char*>(
+                ::mmap(nullptr, 2 * kMappings * page, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+            if (base == MAP_FAILED) return 1;
+            for (size_t i = 0; i < kMappings; ++i)
+                if (::mprotect(base + 2 * i * page, page, PROT_READ) != 0) return 2;
+            char byte = 1;
+            if (::write(ready[1], &byte, 1) != 1) return 3;
+            ::pause();
+            return 0;
+        });
+        ::close(ready[1]);
+        char byte = 0;
+        ASSERT_EQ(::read(ready[0], &byte, 1), 1);
+        ::close(ready[0]);
+
+        HTLinuxPlatform platform;
+        std::shared_ptr<HTTaskPort> task;
+        ASSERT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
+        std::thread killer([&] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(delayMs));
+            ::kill(child.pid(), SIGKILL);
+        });
+        kern_return_t result = KERN_SUCCESS;
+        std::vector<WalkedRegion> regions = walk(platform, *task, result);
+        killer.join();
+        if (result == MACH_SEND_INVALID_DEST)
+            EXPECT_TRUE(regions.empty()) << regions.size() << " regions of a process said to have exited";
+        else
+            EXPECT_GT(regions.size(), kMappings) << "result " << result;
+    }
 }

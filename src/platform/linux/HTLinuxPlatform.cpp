@@ -84,14 +84,16 @@ void closeKeepingErrno(int fd)
     errno = savedErrno;
 }
 
-// Whether the process behind a /proc/PID descriptor has exited: it is gone
-// (its files vanish) or a zombie (its files read empty).
+// Whether the process behind a /proc/PID descriptor has exited or is
+// exiting: it is gone (its files vanish), a zombie (its files read empty),
+// or on its way out, with its address space being torn down.
 bool processHasExited(int dirfd)
 {
     thread_local HTProcBuffer buffer;
     if (!buffer.readFile(dirfd, "stat", HTProcBuffer::End::ShortRead)) return errno == ESRCH || errno == ENOENT;
     std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
-    return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x';
+    return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x' ||
+           (stat->flags & HT_PF_EXITING) != 0;
 }
 
 bool meansGone(int error)
@@ -621,8 +623,11 @@ kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
         task.clearVmas();
         return meansGone(error) ? MACH_SEND_INVALID_DEST : HT_KERN_ERRNO_BASE | error;
     }
-    // A zombie's smaps opens but reads empty: it has no address space left.
-    if (smaps.size() == 0 && processHasExited(task.procDirFd())) {
+    // A process that dies while its smaps is read ends the text early,
+    // without an error, and a zombie's reads empty: either way the text
+    // does not describe the whole process. The descriptor stays bound to
+    // the process it was opened on, so a reused pid cannot pass for it.
+    if (processHasExited(task.procDirFd())) {
         task.clearVmas();
         return MACH_SEND_INVALID_DEST;
     }

@@ -10,6 +10,8 @@
 
 // The kernel's task flag of a kernel thread (field 9 of the stat line).
 inline constexpr uint32_t HT_PF_KTHREAD = 0x00200000;
+// Set as a task begins to exit, before it lets go of its address space.
+inline constexpr uint32_t HT_PF_EXITING = 0x00000004;
 
 struct HTProcStat {
     int32_t pid = 0;
