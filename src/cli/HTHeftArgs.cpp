@@ -178,16 +178,15 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
 
 bool HTHeftArgs::_applyPid(const char* argument, HTError* error)
 {
-    // Like every pid on the command line, read as strtol reads it: leading
-    // blanks and a sign allowed, trailing characters ignored.
-    char* end = nullptr;
-    long value = std::strtol(argument, &end, 10);
-    if (end == argument)
+    // A pid is a whole number within the range of pids: "12abc" or a value
+    // that would wrap to another pid names no process.
+    std::optional<int32_t> pid = HTProcess::pidForText(argument);
+    if (!pid)
         return fail(error, HTHeftErrorCodePid,
                     stringWithFormat("'%s' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
                                      "specify a process name.",
                                      argument));
-    targetPids_.set(static_cast<int32_t>(value), std::nullopt);
+    targetPids_.set(*pid, std::nullopt);
     return true;
 }
 

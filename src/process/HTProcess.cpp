@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <cerrno>
+#include <climits>
 #include <charconv>
 #include <cstdio>
 #include <cstdlib>
@@ -61,17 +62,6 @@ std::optional<std::vector<proc_bsdinfo>> listAllProcesses(HTPlatform& platform)
     }
     if (records.empty()) return std::nullopt;
     return records;
-}
-
-// A decimal integer at the start of the text, as strtol reads it: leading
-// white space and a sign allowed, trailing characters ignored.
-std::optional<long> leadingInteger(const std::string& text)
-{
-    errno = 0;
-    char* end = nullptr;
-    long value = std::strtol(text.c_str(), &end, 10);
-    if (end == text.c_str()) return std::nullopt;
-    return value;
 }
 
 // A fixed-size, possibly unterminated name field of a record.
@@ -225,7 +215,7 @@ std::optional<HTProcess::PidDescriptionMap> HTProcess::pidsForStringDescriptions
     PidDescriptionMap pids;
     std::vector<std::string> collected;
     for (const auto& description : descriptions) {
-        std::optional<long> number = leadingInteger(description);
+        std::optional<int32_t> number = pidForText(description);
         bool matched = false;
         for (size_t i = 0; i < records->size(); ++i) {
             int32_t pid = static_cast<int32_t>((*records)[i].pbi_pid);
@@ -275,6 +265,18 @@ HTProcess::ProcessMap HTProcess::removeIdleExitCleanProcessesFrom(const ProcessM
     for (const auto& [pid, process] : processes)
         if (process->idleExitStatus() != HTIdleExitStatusClean) kept.set(pid, process);
     return kept;
+}
+
+std::optional<int32_t> HTProcess::pidForText(const std::string& text)
+{
+    // Leading blanks are allowed, as strtol allows them; anything after
+    // the digits makes the text a name, not a pid.
+    errno = 0;
+    char* end = nullptr;
+    long long value = std::strtoll(text.c_str(), &end, 10);
+    if (end == text.c_str() || *end != '\0' || errno == ERANGE || value < 0 || value > INT32_MAX)
+        return std::nullopt;
+    return static_cast<int32_t>(value);
 }
 
 void HTProcess::_addGlobalError(std::string error)

@@ -87,6 +87,9 @@ public:
                                                          const proc_bsdinfo& info);
     static std::shared_ptr<HTProcess> processWithPid(const std::shared_ptr<HTPlatform>& platform, int32_t pid);
     static std::string _nameForBsdInfo(HTPlatform& platform, const proc_bsdinfo& info);
+    // The pid a command line names: a whole decimal number, leading blanks
+    // allowed, within the range of pids; nullopt for anything else.
+    static std::optional<int32_t> pidForText(const std::string& text);
     static std::string _nameForBsdInfoCommName(const proc_bsdinfo& info);
     // nullopt when the system process list cannot be read.
     static std::optional<ProcessMap> allProcessesExcludingPids(const std::shared_ptr<HTPlatform>& platform,

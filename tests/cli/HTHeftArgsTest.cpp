@@ -91,20 +91,26 @@ TEST(HTHeftArgsTest, SortMatchesAnyCaseAndStoresTheColumnName)
               "Accepted arguments: dirty, swapped, clean, reclaimable, wired, regions, category");
 }
 
-TEST(HTHeftArgsTest, PidValuesAreReadLikeStrtol)
+TEST(HTHeftArgsTest, PidValuesMustBeWholeNumbersInRange)
 {
-    Parsed parsed = parse({"--pid", "42x", "--pid", " -7", "--pid", "42"});
+    Parsed parsed = parse({"--pid", "42", "--pid", " 7", "--pid", "0", "--pid", "2147483647"});
     ASSERT_TRUE(parsed.args);
-    EXPECT_EQ(pidsOf(*parsed.args), (std::vector<int32_t>{42, -7}));
+    EXPECT_EQ(pidsOf(*parsed.args), (std::vector<int32_t>{42, 7, 0, 2147483647}));
     for (const auto& entry : parsed.args->targetPids()) EXPECT_FALSE(entry.second) << entry.first;
     EXPECT_TRUE(parsed.args->potentialTargetProcesses().empty());
 
-    parsed = parse({"--pid", "5", "--pid", "abc"});
-    EXPECT_FALSE(parsed.args);
-    EXPECT_EQ(parsed.error.domain, "HTHeftError");
-    EXPECT_EQ(parsed.error.code, 4);
-    EXPECT_EQ(parsed.error.description,
-              "'abc' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name.");
+    // Trailing characters, values that would wrap to another pid, and
+    // negative numbers name no process.
+    for (const char* value : {"abc", "42x", "12 abc", "", "-7", "2147483648", "4294967297", "99999999999999999999"}) {
+        SCOPED_TRACE(value);
+        parsed = parse({"--pid", "5", "--pid", value});
+        EXPECT_FALSE(parsed.args);
+        EXPECT_EQ(parsed.error.domain, "HTHeftError");
+        EXPECT_EQ(parsed.error.code, 4);
+        EXPECT_EQ(parsed.error.description, std::string("'") + value +
+                                                "' is not a valid integer for --pid.\n\nUse -p / --proc if you "
+                                                "meant to specify a process name.");
+    }
 }
 
 TEST(HTHeftArgsTest, FormatMustMatchExactly)

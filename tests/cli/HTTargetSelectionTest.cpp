@@ -107,10 +107,11 @@ TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
     } rows[] = {
         {"a name selects every process of that name; pid 100 is reached twice, selected once",
          {"worker", "100", "init"}, {}, {}, kNone, {100, 201, 203, 1}, ""},
-        {"unknown operands are reported and the others kept",
-         {"nosuchthing", "shell", "99999"}, {}, {}, kNone, {200},
+        {"unknown operands are reported and the others kept; a pid with more after it is a name",
+         {"nosuchthing", "shell", "99999", "100 x"}, {}, {}, kNone, {200},
          "Unable to find pid for process matching 'nosuchthing'\n"
-         "Unable to find pid for process matching '99999'\n"},
+         "Unable to find pid for process matching '99999'\n"
+         "Unable to find pid for process matching '100 x'\n"},
         {"heft leaves itself out; exclusions that match nothing stay silent",
          {"heft", "worker"}, {kOwnPid}, {"201", "helper", "nosuchthing"}, kNone, {501, 100, 203}, ""},
         {"heft alone", {}, {kOwnPid}, {}, kNone, {}, ""},
