@@ -8,6 +8,7 @@
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryRegion.h"
 #include "output/HTSizeText.h"
+#include "output/HTTerminalText.h"
 #include "process/HTProcess.h"
 
 #include <algorithm>
@@ -235,14 +236,14 @@ void HTOutputFormatterText::printSizeRow(uint64_t dirty, uint64_t swapped, uint6
                           10);
     line_.append(figures, end);
     line_.append("    ");
-    line_.append(name);
+    htAppendTerminalSafe(line_, name);
     if (detail) {
         line_.append(" ");
         if (std::optional<std::string_view> last = shortenedComponent(*detail)) {
             line_.append(".../");
-            line_.append(*last);
+            htAppendTerminalSafe(line_, *last);
         } else {
-            line_.append(*detail);
+            htAppendTerminalSafe(line_, *detail);
         }
     }
     line_.append("\n");
@@ -311,7 +312,7 @@ void HTOutputFormatterText::printSharedCategories(const HTCategoryMap& categorie
         for (const auto& member : members) {
             if (member->isEqual(forProcess)) continue;
             line_.append(first ? " " : ", ");
-            line_.append(member->displayString());
+            htAppendTerminalSafe(line_, member->displayString());
             first = false;
         }
         line_.append(":\n");
@@ -345,7 +346,7 @@ void HTOutputFormatterText::printSpanlistLikeOutputForProcess(const HTProcess& p
 {
     const bool swapped = swappedColumnName_.has_value();
     const bool wired = wiredColumnName_.has_value();
-    std::fprintf(output_, "%s\n\n", process.displayString().c_str());
+    std::fprintf(output_, "%s\n\n", htTerminalSafe(process.displayString()).c_str());
     std::fprintf(output_,
                  "           start                end  [objectid]      VRT     DRT%*s     CLN     RCL%*s   tag "
                  "(detail)\n",
@@ -373,8 +374,8 @@ void HTOutputFormatterText::printSpanlistLikeOutputForProcess(const HTProcess& p
 
         const std::optional<std::string>& name = region->name();
         std::optional<std::string> detail = _truncatedNameForString(region->detailedName());
-        std::fprintf(output_, "   %s%s%s\n", name ? name->c_str() : "", detail ? " " : "",
-                     detail ? detail->c_str() : "");
+        std::fprintf(output_, "   %s%s%s\n", name ? htTerminalSafe(*name).c_str() : "", detail ? " " : "",
+                     detail ? htTerminalSafe(*detail).c_str() : "");
     }
     std::fprintf(output_, "\n");
 }
@@ -387,17 +388,18 @@ void HTOutputFormatterText::printProcessHeader(const HTProcess& process)
     printEqualsRule();
     std::fprintf(output_, "\n");
     // The line stays open: without warnings or errors the heft follows on it.
-    std::fprintf(output_, "%s: %s-bit", process.displayString().c_str(), process.is64bit() ? "64" : "32");
+    std::fprintf(output_, "%s: %s-bit", htTerminalSafe(process.displayString()).c_str(),
+                 process.is64bit() ? "64" : "32");
 
     const auto& warnings = process.warnings();
     if (!warnings.empty()) {
         std::fprintf(output_, "\nWarnings were encountered while examining the process.\n");
-        for (const auto& warning : warnings) std::fprintf(output_, "\t%s\n", warning.c_str());
+        for (const auto& warning : warnings) std::fprintf(output_, "\t%s\n", htTerminalSafe(warning).c_str());
     }
     const auto errors = process.errors();
     if (!errors.empty()) {
         std::fprintf(output_, "\nErrors were encountered while examining the process. No results gathered.\n");
-        for (const auto& error : errors) std::fprintf(output_, "\t%s\n", error.c_str());
+        for (const auto& error : errors) std::fprintf(output_, "\t%s\n", htTerminalSafe(error).c_str());
     }
 }
 
@@ -419,15 +421,17 @@ void HTOutputFormatterText::printProcessesWithWarnings(const ProcessList& proces
 {
     if (!processesWithWarnings.empty()) {
         std::fprintf(output_, "\nWarnings were encountered while examining the following processes:\n");
-        for (const auto& process : processesWithWarnings) std::fprintf(output_, "\t%s\n", process->name().c_str());
+        for (const auto& process : processesWithWarnings)
+            std::fprintf(output_, "\t%s\n", htTerminalSafe(process->name()).c_str());
     }
     if (!processesWithErrors.empty()) {
         std::fprintf(output_, "\nErrors were encountered while examining the following processes:\n");
-        for (const auto& process : processesWithErrors) std::fprintf(output_, "\t%s\n", process->name().c_str());
+        for (const auto& process : processesWithErrors)
+            std::fprintf(output_, "\t%s\n", htTerminalSafe(process->name()).c_str());
     }
     if (!globalErrors.empty()) {
         std::fprintf(output_, "\nErrors were encountered:\n");
-        for (const auto& error : globalErrors) std::fprintf(output_, "\t%s\n", error.c_str());
+        for (const auto& error : globalErrors) std::fprintf(output_, "\t%s\n", htTerminalSafe(error).c_str());
     }
     if (!processesWithErrors.empty() || !globalErrors.empty())
         std::fprintf(output_, "\nDue to errors, summary results may be invalid\n");

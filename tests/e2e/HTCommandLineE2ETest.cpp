@@ -2,9 +2,10 @@
 // and its exit status, for every way the command line can end a run before
 // the analysis, and for a run that selects a live process.
 
-#include "e2e/HTE2ESupport.h"
+#include "e2e/HTE2EReport.h"
 
 #include <getopt.h>
+#include <spawn.h>
 
 #include <gmock/gmock.h>
 
@@ -168,6 +169,40 @@ TEST(HTCommandLineE2ETest, SelectingALiveProcessReportsItOnceAndWritesTheJSONFil
                runHeft);
     EXPECT_TRUE(readFile(directory.file("out.json"))
                     .starts_with("{\"unit\":\"byte\",\"bytes per unit\":1,\"processes\":[{\"name\":"));
+}
+
+TEST(HTCommandLineE2ETest, HostileNamesAreEscapedInTheTextAndKeptInTheJSON)
+{
+    // Any user can name a program with a line feed, a tab and a terminal
+    // escape, and run it for root's heft to report.
+    TempDir directory;
+    ASSERT_TRUE(directory.ok());
+    const std::string name = "evil\n\t\x1B[7mname";
+    const std::string program = directory.path + "/" + name;
+    std::error_code error;
+    std::filesystem::copy_file("/bin/sleep", program, error);
+    ASSERT_FALSE(error) << error.message();
+    std::filesystem::permissions(program, std::filesystem::perms::owner_all, error);
+    pid_t pid = -1;
+    char* argv[] = {const_cast<char*>("sleep"), const_cast<char*>("30"), nullptr};
+    ASSERT_EQ(posix_spawn(&pid, program.c_str(), nullptr, nullptr, argv, environ), 0);
+    const std::string json = directory.file("out.json");
+    Outcome outcome = runHeft({"-v", "-j", json, std::to_string(pid)});
+    kill(pid, SIGKILL);
+    waitpid(pid, nullptr, 0);
+
+    EXPECT_EQ(outcome.status, 0) << outcome.standardError;
+    EXPECT_EQ(outcome.standardOutput.find('\x1B'), std::string::npos);
+    // The header stays one line. Paths come from the kernel with the line
+    // feed already written as "\012"; the rest is escaped too.
+    EXPECT_THAT(outcome.standardOutput,
+                testing::HasSubstr("evil\\n\\t\\x1B[7mname [" + std::to_string(pid) + "]: 64-bit\tHeft: "));
+    EXPECT_THAT(outcome.standardOutput, testing::HasSubstr("__TEXT .../evil\\012\\t\\x1B[7mname\n"));
+    rapidjson::Document report;
+    ASSERT_TRUE(loadReport(json, report));
+    const rapidjson::Value* process = processIn(report, pid);
+    ASSERT_NE(process, nullptr);
+    EXPECT_EQ(nameOf(*process), name);
 }
 
 }  // namespace
