@@ -7,8 +7,10 @@
 #include "output/HTOutputFormatterText.h"
 #include "platform/HTSignalSource.h"
 
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
 
 namespace {
 
@@ -82,6 +84,8 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform,
     }
 
     auto jsonFormatter = openJSONFormatter(*args, *platform);
+    // A report that could not be written whole ends the run in failure.
+    int status = args->JSONOutputFile() && !jsonFormatter ? 1 : 0;
     HTHeft heft(std::move(*targets), platform);
     gather(heft, *platform);
 
@@ -89,11 +93,21 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform,
         args->summaryFormat(), args->textOptions(), args->textSort(), HTHeft::breakDownPhysHeft(*platform)));
     if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
     heft.printOutputVerbose(args->spanlistLikeOutput(), args->summarize());
+    if (jsonFormatter && jsonFormatter->writeError()) {
+        std::fprintf(stderr, "%s\n", jsonFormatter->writeError()->c_str());
+        status = 1;
+    }
+    // The error of a failed write of the report is still in errno: after
+    // it, the report is only written to, and every later write fails alike.
+    if (std::fflush(stdout) != 0 || std::ferror(stdout)) {
+        std::fprintf(stderr, "Unable to write the report: %s\n", std::strerror(errno != 0 ? errno : EIO));
+        status = 1;
+    }
     if (exitWhenDone) {
         heft.finishOutput();
         jsonFormatter.reset();
         std::fflush(nullptr);
-        std::_Exit(0);
+        std::_Exit(status);
     }
-    return 0;
+    return status;
 }

@@ -1,6 +1,7 @@
 #include "cli/HTHeftMain.h"
 #include "platform/linux/HTLinuxPlatform.h"
 
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <memory>
@@ -38,5 +39,9 @@ void restartWithHugePageHeaps(char** argv)
 int main(int argc, char** argv)
 {
     restartWithHugePageHeaps(argv);
+    // A reader that closes the pipe of the report (`heft -a -j f | head`)
+    // must not end the run before the JSON file is written: the failed
+    // write is reported instead.
+    std::signal(SIGPIPE, SIG_IGN);
     return heftMain(argc, argv, std::make_shared<HTLinuxPlatform>(), true);
 }

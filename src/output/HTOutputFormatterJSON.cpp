@@ -6,6 +6,7 @@
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryRegion.h"
+#include "output/HTOutputFile.h"
 #include "process/HTProcess.h"
 
 #include <rapidjson/filewritestream.h>
@@ -57,24 +58,18 @@ size_t wellFormedSequenceLength(const unsigned char* p, size_t left)
 
 constexpr std::string_view kReplacementCharacter = "\xEF\xBF\xBD";
 
-std::string formatOpenError(const std::string& path, int error)
-{
-    return "Unable to open JSON output file '" + path + "': " + std::strerror(error);
-}
-
 }  // namespace
 
-// The output file and the streaming writer on it. Closing the file flushes
-// what was written, whether or not the document was finished.
+// The output file and the streaming writer on it. The file keeps its name
+// only once the document is finished and every byte written.
 struct HTOutputFormatterJSON::Writer {
-    explicit Writer(std::FILE* f) : file(f), stream(f, buffer, sizeof(buffer)), json(stream) {}
-    ~Writer()
+    Writer(std::unique_ptr<HTOutputFile> f, std::string p)
+        : file(std::move(f)), path(std::move(p)), stream(file->stream(), buffer, sizeof(buffer)), json(stream)
     {
-        stream.Flush();
-        std::fclose(file);
     }
 
-    std::FILE* file;
+    std::unique_ptr<HTOutputFile> file;
+    std::string path;
     char buffer[64 * 1024];
     rapidjson::FileWriteStream stream;
     rapidjson::Writer<rapidjson::FileWriteStream> json;
@@ -87,13 +82,14 @@ std::shared_ptr<HTOutputFormatterJSON> HTOutputFormatterJSON::initWithPath(const
                                                                            uint64_t kernelPageSize,
                                                                            std::string* errorText)
 {
-    std::FILE* file = std::fopen(path.c_str(), "w+");
+    std::string reason;
+    std::unique_ptr<HTOutputFile> file = HTOutputFile::open(path, &reason);
     if (!file) {
-        if (errorText) *errorText = formatOpenError(path, errno);
+        if (errorText) *errorText = "Unable to open JSON output file '" + path + "': " + reason;
         return nullptr;
     }
     std::shared_ptr<HTOutputFormatterJSON> formatter(
-        new HTOutputFormatterJSON(std::make_unique<Writer>(file), kernelPageSize));
+        new HTOutputFormatterJSON(std::make_unique<Writer>(std::move(file), path), kernelPageSize));
 
     formatter->startObject();
     formatter->key("unit");
@@ -389,6 +385,10 @@ void HTOutputFormatterJSON::end()
     number(pageSize_);
     endObject();
 
+    json_->stream.Flush();
+    std::string reason;
+    if (!json_->file->commit(&reason))
+        writeError_ = "Unable to write JSON output file '" + json_->path + "': " + reason;
     json_.reset();
     shared_.clear();
 }

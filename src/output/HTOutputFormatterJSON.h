@@ -57,6 +57,9 @@ public:
     void setPageSize(uint64_t value) { pageSize_ = value; }
     // False once end() has closed the file.
     bool hasWriter() const { return json_ != nullptr; }
+    // Set by end() when the file could not be written whole; the file is
+    // then left as it was before the run.
+    const std::optional<std::string>& writeError() const { return writeError_; }
 
     // --- HTOutputFormatter -------------------------------------------------
     // The region listing only switches the per-process "regions" arrays on.
@@ -117,4 +120,5 @@ private:
     uint64_t pageSize_ = 0;
     uint64_t kernelPageSize_;
     std::unique_ptr<Writer> json_;
+    std::optional<std::string> writeError_;
 };

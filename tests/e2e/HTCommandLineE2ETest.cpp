@@ -159,16 +159,34 @@ TEST(HTCommandLineE2ETest, SelectingALiveProcessReportsItOnceAndWritesTheJSONFil
                 {{"--pid", pid, "-p", pid, pid}, 0, "", reportedOnce},
                 {{"--json", directory.file("out.json"), pid}, 0, "", reportedOnce},
                 // A JSON file that cannot be created is reported before the
-                // analysis, and the text report is still written.
+                // analysis, the text report is still written, and the run
+                // fails; so does one whose writes fail.
                 {{"-j", "/nonexistent-heft-dir/out.json", pid},
-                 0,
+                 1,
                  "Unable to open JSON output file '/nonexistent-heft-dir/out.json': No such file or directory\n",
+                 reportedOnce},
+                {{"-j", directory.path, pid},
+                 1,
+                 "Unable to open JSON output file '" + directory.path + "': Is a directory\n",
+                 reportedOnce},
+                {{"-j", "/dev/full", pid},
+                 1,
+                 "Unable to write JSON output file '/dev/full': No space left on device\n",
                  reportedOnce},
                 // Excluding the only target leaves nothing to analyse.
                 {{pid, "-x", pid}, 1, kNoProcesses, ""}},
                runHeft);
     EXPECT_TRUE(readFile(directory.file("out.json"))
                     .starts_with("{\"unit\":\"byte\",\"bytes per unit\":1,\"processes\":[{\"name\":"));
+    // The file was written under a temporary name that is gone.
+    size_t entries = 0;
+    for (const auto& entry : std::filesystem::directory_iterator(directory.path)) entries += entry.exists();
+    EXPECT_EQ(entries, 1u);
+
+    // A report that cannot be written is said once, and the run fails.
+    Outcome full = runProgram("/bin/sh", {"sh", "-c", std::string("exec ") + kHeftBinary + " " + pid + " > /dev/full"});
+    EXPECT_EQ(full.status, 1);
+    EXPECT_EQ(full.standardError, "Unable to write the report: No space left on device\n");
 }
 
 TEST(HTCommandLineE2ETest, HostileNamesAreEscapedInTheTextAndKeptInTheJSON)

@@ -1,0 +1,95 @@
+#include "output/HTOutputFile.h"
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+namespace {
+
+std::string errorFor(int error) { return std::strerror(error); }
+
+// The permissions a newly created file gets from the process's umask.
+mode_t newFileMode()
+{
+    mode_t mask = ::umask(0);
+    ::umask(mask);
+    return 0666 & ~mask;
+}
+
+}  // namespace
+
+HTOutputFile::HTOutputFile(std::string path, std::string temporaryPath, std::FILE* stream)
+    : path_(std::move(path)), temporaryPath_(std::move(temporaryPath)), stream_(stream)
+{
+}
+
+std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::string* errorText)
+{
+    struct stat existing {};
+    const bool exists = ::stat(path.c_str(), &existing) == 0;
+    if (exists && S_ISDIR(existing.st_mode)) {
+        *errorText = errorFor(EISDIR);
+        return nullptr;
+    }
+    if (exists && !S_ISREG(existing.st_mode)) {
+        std::FILE* stream = std::fopen(path.c_str(), "w");
+        if (stream == nullptr) {
+            *errorText = errorFor(errno);
+            return nullptr;
+        }
+        return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, "", stream));
+    }
+    // A file heft may not write keeps its content, as a plain open would.
+    if (exists && ::access(path.c_str(), W_OK) != 0) {
+        *errorText = errorFor(errno);
+        return nullptr;
+    }
+    std::string temporary = path + ".XXXXXX";
+    int fd = ::mkostemp(temporary.data(), O_CLOEXEC);
+    if (fd < 0) {
+        *errorText = errorFor(errno);
+        return nullptr;
+    }
+    (void)::fchmod(fd, exists ? existing.st_mode & 07777 : newFileMode());
+    std::FILE* stream = ::fdopen(fd, "w");
+    if (stream == nullptr) {
+        *errorText = errorFor(errno);
+        ::close(fd);
+        ::unlink(temporary.c_str());
+        return nullptr;
+    }
+    return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, std::move(temporary), stream));
+}
+
+HTOutputFile::~HTOutputFile()
+{
+    if (stream_ == nullptr) return;
+    std::fclose(stream_);
+    if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
+}
+
+bool HTOutputFile::commit(std::string* errorText)
+{
+    std::FILE* stream = stream_;
+    stream_ = nullptr;
+    // A failed write leaves the stream's error flag set; the close writes
+    // what is still buffered.
+    errno = 0;
+    const bool written = std::fflush(stream) == 0 && !std::ferror(stream);
+    int error = errno != 0 ? errno : EIO;
+    const bool closed = std::fclose(stream) == 0;
+    if (written && !closed) error = errno;
+    bool ok = written && closed;
+    if (ok && !temporaryPath_.empty() && ::rename(temporaryPath_.c_str(), path_.c_str()) != 0) {
+        error = errno;
+        ok = false;
+    }
+    if (!ok) {
+        if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
+        *errorText = errorFor(error);
+    }
+    return ok;
+}

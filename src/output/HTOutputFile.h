@@ -1,0 +1,34 @@
+#pragma once
+
+#include <cstdio>
+#include <memory>
+#include <string>
+
+// A file the report is written to, whole or not at all. A regular file (or
+// one that does not exist yet) is written under a temporary name beside it
+// and takes its name only when commit() finds every write done, so that an
+// earlier file is never damaged and an interrupted or failed run leaves no
+// half file. A device or pipe (/dev/stdout, a FIFO) is written in place.
+class HTOutputFile {
+public:
+    // Null, with `errorText` set to the reason, when the file cannot be
+    // written: its directory is missing or closed to heft, or it is a
+    // directory.
+    static std::unique_ptr<HTOutputFile> open(const std::string& path, std::string* errorText);
+    // Without a commit, the temporary file is removed.
+    ~HTOutputFile();
+    HTOutputFile(const HTOutputFile&) = delete;
+    HTOutputFile& operator=(const HTOutputFile&) = delete;
+
+    std::FILE* stream() const { return stream_; }
+    // Closes the file and gives it its name; false, with `errorText` set,
+    // when a write, the close or the rename failed (the file is then gone).
+    bool commit(std::string* errorText);
+
+private:
+    HTOutputFile(std::string path, std::string temporaryPath, std::FILE* stream);
+
+    std::string path_;
+    std::string temporaryPath_;  // empty when written in place
+    std::FILE* stream_;
+};
