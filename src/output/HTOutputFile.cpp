@@ -1,6 +1,7 @@
 #include "output/HTOutputFile.h"
 
 #include <cerrno>
+#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
@@ -10,6 +11,36 @@
 namespace {
 
 std::string errorFor(int error) { return std::strerror(error); }
+
+// The temporary file being written, for a signal that ends the program to
+// remove; empty when there is none. One report file is written at a time.
+char pendingTemporary[4096];
+
+void removePendingAndDie(int signal)
+{
+    if (pendingTemporary[0] != '\0') ::unlink(pendingTemporary);
+    ::signal(signal, SIG_DFL);
+    ::raise(signal);
+}
+
+// Signals that end the program at once (Ctrl-C on a terminal, kill, a
+// closed terminal) first remove the temporary file. Signals the program
+// handles or ignores otherwise are left alone.
+void removeTemporaryOnFatalSignals(const std::string& temporary)
+{
+    if (temporary.size() >= sizeof(pendingTemporary)) return;
+    std::memcpy(pendingTemporary, temporary.c_str(), temporary.size() + 1);
+    for (int signal : {SIGINT, SIGTERM, SIGHUP}) {
+        struct sigaction current {};
+        if (::sigaction(signal, nullptr, &current) != 0 || current.sa_handler != SIG_DFL) continue;
+        struct sigaction handler {};
+        handler.sa_handler = removePendingAndDie;
+        ::sigemptyset(&handler.sa_mask);
+        ::sigaction(signal, &handler, nullptr);
+    }
+}
+
+void forgetTemporary() { pendingTemporary[0] = '\0'; }
 
 // The permissions a newly created file gets from the process's umask.
 mode_t newFileMode()
@@ -61,6 +92,7 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
         ::unlink(temporary.c_str());
         return nullptr;
     }
+    removeTemporaryOnFatalSignals(temporary);
     return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, std::move(temporary), stream));
 }
 
@@ -69,6 +101,7 @@ HTOutputFile::~HTOutputFile()
     if (stream_ == nullptr) return;
     std::fclose(stream_);
     if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
+    forgetTemporary();
 }
 
 bool HTOutputFile::commit(std::string* errorText)
@@ -91,5 +124,6 @@ bool HTOutputFile::commit(std::string* errorText)
         if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
         *errorText = errorFor(error);
     }
+    forgetTemporary();
     return ok;
 }

@@ -189,6 +189,52 @@ TEST(HTCommandLineE2ETest, SelectingALiveProcessReportsItOnceAndWritesTheJSONFil
     EXPECT_EQ(full.standardError, "Unable to write the report: No space left on device\n");
 }
 
+TEST(HTCommandLineE2ETest, KilledRunsLeaveTheEarlierJSONFileAndNoOther)
+{
+    if (geteuid() != 0) GTEST_SKIP() << "-a needs root";
+    TempDir directory;
+    ASSERT_TRUE(directory.ok());
+    const std::string path = directory.file("out.json");
+    auto entries = [&] {
+        size_t count = 0;
+        for (const auto& entry : std::filesystem::directory_iterator(directory.path)) count += entry.exists();
+        return count;
+    };
+    for (int signal : {SIGTERM, SIGHUP}) {
+        SCOPED_TRACE(strsignal(signal));
+        {
+            std::ofstream earlier(path);
+            earlier << "earlier report";
+        }
+        // The report goes to a small pipe that nobody reads: heft stops in
+        // the middle of writing it, its JSON file not yet finished.
+        int report[2];
+        ASSERT_EQ(pipe2(report, O_CLOEXEC), 0);
+        fcntl(report[1], F_SETPIPE_SZ, 4096);
+        std::vector<std::string> arguments = {"heft", "-a", "-v", "-j", path};
+        std::vector<char*> argv = argvOf(arguments);
+        pid_t heft = fork();
+        if (heft == 0) {
+            dup2(report[1], STDOUT_FILENO);
+            int null = open("/dev/null", O_WRONLY);
+            dup2(null, STDERR_FILENO);
+            execv(kHeftBinary, argv.data());
+            _exit(127);
+        }
+        ASSERT_GT(heft, 0);
+        close(report[1]);
+        for (int waited = 0; waited < 500 && entries() < 2; ++waited) usleep(10 * 1000);
+        EXPECT_EQ(entries(), 2u) << "no temporary file beside the JSON file";
+        kill(heft, signal);
+        int status = 0;
+        while (waitpid(heft, &status, 0) < 0 && errno == EINTR) {}
+        close(report[0]);
+        EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == signal);
+        EXPECT_EQ(readFile(path), "earlier report");
+        EXPECT_EQ(entries(), 1u);
+    }
+}
+
 TEST(HTCommandLineE2ETest, HostileNamesAreEscapedInTheTextAndKeptInTheJSON)
 {
     // Any user can name a program with a line feed, a tab and a terminal
