@@ -54,10 +54,12 @@ void gather(HTHeft& heft, HTPlatform& platform)
     if (source) source->cancel();
 }
 
-}  // namespace
-
-int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone)
+// The run itself; `stage` says what it is doing, for a message if memory
+// runs out.
+int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone,
+            const char*& stage)
 {
+    stage = "reading the command line";
     HTError error;
     std::unique_ptr<HTHeftArgs> args = HTHeftArgs::initWithArgc(argc, argv, &error);
     if (!args) return reportArgumentError(error);
@@ -71,6 +73,7 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform,
         return 1;
     }
 
+    stage = "listing the processes";
     auto targets = args->targetProcessesAndError(platform, &error);
     if (!targets) {
         if (error.description) std::fprintf(stderr, "%s\n", error.description->c_str());
@@ -86,8 +89,10 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform,
     auto jsonFormatter = openJSONFormatter(*args, *platform);
     // A report that could not be written whole ends the run in failure.
     int status = args->JSONOutputFile() && !jsonFormatter ? 1 : 0;
+    stage = "gathering the processes' memory";
     HTHeft heft(std::move(*targets), platform);
     gather(heft, *platform);
+    stage = "writing the report";
 
     heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(
         args->summaryFormat(), args->textOptions(), args->textSort(), HTHeft::breakDownPhysHeft(*platform)));
@@ -110,4 +115,20 @@ int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform,
         std::_Exit(status);
     }
     return status;
+}
+
+}  // namespace
+
+int heftMain(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone)
+{
+    const char* stage = "starting";
+    try {
+        return runHeft(argc, argv, platform, exitWhenDone, stage);
+    } catch (const std::bad_alloc&) {
+        // Whatever was built is freed on the way here, and a JSON file not
+        // yet finished is removed with it.
+        std::fflush(stdout);
+        std::fprintf(stderr, "heft: out of memory while %s\n", stage);
+        return 1;
+    }
 }

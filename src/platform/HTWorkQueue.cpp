@@ -5,6 +5,7 @@
 #include <pthread.h>
 #include <sys/resource.h>
 #include <system_error>
+#include <utility>
 #include <sys/syscall.h>
 #include <unistd.h>
 
@@ -60,7 +61,15 @@ void HTWorkQueue::parallelFor(size_t count, const std::function<void(size_t)>& b
 {
     if (count == 0) return;
     if (workers_.empty()) {
-        for (size_t index = 0; index < count; ++index) body(index);
+        std::exception_ptr failure;
+        for (size_t index = 0; index < count; ++index) {
+            try {
+                body(index);
+            } catch (...) {
+                if (!failure) failure = std::current_exception();
+            }
+        }
+        if (failure) std::rethrow_exception(failure);
         return;
     }
     {
@@ -68,6 +77,7 @@ void HTWorkQueue::parallelFor(size_t count, const std::function<void(size_t)>& b
         body_ = &body;
         count_ = count;
         completed_ = 0;
+        failure_ = nullptr;
         nextIndex_.store(0, std::memory_order_relaxed);
         ++generation_;
     }
@@ -80,6 +90,7 @@ void HTWorkQueue::parallelFor(size_t count, const std::function<void(size_t)>& b
     // A worker that wakes only now finds no loop to join.
     body_ = nullptr;
     count_ = 0;
+    if (failure_) std::rethrow_exception(std::exchange(failure_, nullptr));
 }
 
 void HTWorkQueue::runIterations(const std::function<void(size_t)>& body, size_t count)
@@ -87,8 +98,14 @@ void HTWorkQueue::runIterations(const std::function<void(size_t)>& body, size_t 
     for (;;) {
         size_t index = nextIndex_.fetch_add(1, std::memory_order_relaxed);
         if (index >= count) return;
-        body(index);
+        std::exception_ptr failure;
+        try {
+            body(index);
+        } catch (...) {
+            failure = std::current_exception();
+        }
         std::lock_guard<std::mutex> lock(mutex_);
+        if (failure && !failure_) failure_ = failure;
         ++completed_;
     }
 }

@@ -4,6 +4,7 @@
 #include <condition_variable>
 #include <cstddef>
 #include <cstdint>
+#include <exception>
 #include <functional>
 #include <mutex>
 #include <string>
@@ -30,7 +31,9 @@ public:
     // Runs body(i) once for every i in [0, count), spread over the workers,
     // and returns when every iteration has ended. The calling thread only
     // waits, so that the whole loop runs at the workers' priority; without
-    // workers it runs the loop itself. The body must not throw.
+    // workers it runs the loop itself. An iteration that throws (out of
+    // memory, say) ends no thread: the other iterations run, and
+    // parallelFor then throws the first exception on the calling thread.
     void parallelFor(size_t count, const std::function<void(size_t)>& body);
 
     const std::string& label() const { return label_; }
@@ -60,6 +63,7 @@ private:
     uint64_t generation_ = 0;
     size_t activeWorkers_ = 0;
     size_t completed_ = 0;
+    std::exception_ptr failure_;
     bool stopping_ = false;
 
     // The next index of the current loop to hand out.

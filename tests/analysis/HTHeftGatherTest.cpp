@@ -71,6 +71,17 @@ TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
     }
     queue.parallelFor(0, [](size_t) { ADD_FAILURE() << "no iteration expected"; });
     EXPECT_EQ(currentThreadNice(), callerNice);
+
+    // An iteration that runs out of memory ends no worker: the others run,
+    // and the loop throws on the calling thread.
+    std::vector<std::atomic<int>> runs(50);
+    EXPECT_THROW(queue.parallelFor(runs.size(),
+                                   [&](size_t i) {
+                                       runs[i].fetch_add(1);
+                                       if (i % 7 == 3) throw std::bad_alloc();
+                                   }),
+                 std::bad_alloc);
+    for (size_t i = 0; i < runs.size(); ++i) EXPECT_EQ(runs[i].load(), 1) << "index " << i;
 }
 
 TEST(HTHeftGatherSignalSourceTest, DeliversSigintToAThreadAndRestoresItOnCancel)

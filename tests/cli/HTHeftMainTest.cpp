@@ -4,7 +4,11 @@
 
 #include <gtest/gtest.h>
 
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
 #include <string>
+#include <unistd.h>
 #include <vector>
 
 namespace {
@@ -65,6 +69,19 @@ TEST_F(HTHeftMainTest, TurnsTheBreakdownModeOnUnlessVmObjectDirty)
     EXPECT_NE(result.standardOutput.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << result.standardOutput;
     EXPECT_EQ(result.standardError, "");
     EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 1);
+}
+
+TEST_F(HTHeftMainTest, RunningOutOfMemorySaysWhereAndLeavesNoFile)
+{
+    char directory[] = "/tmp/heft-main-XXXXXX";
+    ASSERT_NE(mkdtemp(directory), nullptr);
+    const std::string json = std::string(directory) + "/out.json";
+    platform_->outOfMemoryInWalk = true;
+    Run result = run({"-j", json, "42"});
+    EXPECT_EQ(result.status, 1);
+    EXPECT_EQ(result.standardError, "heft: out of memory while gathering the processes' memory\n");
+    // The JSON file begun before the gathering is gone with its directory entry.
+    EXPECT_EQ(rmdir(directory), 0) << std::strerror(errno);
 }
 
 TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRoot)

@@ -3,6 +3,7 @@
 #include "platform/HTMachErrorText.h"
 
 #include <algorithm>
+#include <new>
 #include <cerrno>
 #include <cstring>
 
@@ -204,6 +205,7 @@ kern_return_t HTFakePlatform::regionFailure(const Process& process, size_t index
 kern_return_t HTFakePlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
                                                      uint32_t* depth, vm_region_submap_info_64* info, uint32_t* count)
 {
+    if (outOfMemoryInWalk) throw std::bad_alloc();
     ++regionLookups;
     Process* found = process(task.pid());
     if (found == nullptr) return MACH_SEND_INVALID_DEST;

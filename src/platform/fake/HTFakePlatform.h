@@ -104,6 +104,8 @@ public:
     // Whether populatedRuns answers the disposition of runs of pages of one
     // disposition itself, as a backend that knows them without page queries.
     bool uniformRuns = false;
+    // Whether walking an address space runs out of memory.
+    bool outOfMemoryInWalk = false;
     uint32_t euid = 0;
     std::set<int> terminals;            // descriptors that are terminals
     std::set<std::string> existingFiles;
