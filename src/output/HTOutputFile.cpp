@@ -5,6 +5,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
+#include <pthread.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -23,14 +24,14 @@ void removePendingAndDie(int signal)
     ::raise(signal);
 }
 
+constexpr int kFatalSignals[] = {SIGINT, SIGTERM, SIGHUP};
+
 // Signals that end the program at once (Ctrl-C on a terminal, kill, a
 // closed terminal) first remove the temporary file. Signals the program
 // handles or ignores otherwise are left alone.
-void removeTemporaryOnFatalSignals(const std::string& temporary)
+void removeTemporaryOnFatalSignals()
 {
-    if (temporary.size() >= sizeof(pendingTemporary)) return;
-    std::memcpy(pendingTemporary, temporary.c_str(), temporary.size() + 1);
-    for (int signal : {SIGINT, SIGTERM, SIGHUP}) {
+    for (int signal : kFatalSignals) {
         struct sigaction current {};
         if (::sigaction(signal, nullptr, &current) != 0 || current.sa_handler != SIG_DFL) continue;
         struct sigaction handler {};
@@ -41,6 +42,26 @@ void removeTemporaryOnFatalSignals(const std::string& temporary)
 }
 
 void forgetTemporary() { pendingTemporary[0] = '\0'; }
+
+// Creates the temporary file from `pattern` with those signals held back,
+// so that none can end the program between the file's creation and its
+// name being recorded for removal.
+int createTemporary(std::string& pattern)
+{
+    removeTemporaryOnFatalSignals();
+    sigset_t fatal;
+    sigset_t previous;
+    ::sigemptyset(&fatal);
+    for (int signal : kFatalSignals) ::sigaddset(&fatal, signal);
+    ::pthread_sigmask(SIG_BLOCK, &fatal, &previous);
+    int fd = ::mkostemp(pattern.data(), O_CLOEXEC);
+    if (fd >= 0 && pattern.size() < sizeof(pendingTemporary))
+        std::memcpy(pendingTemporary, pattern.c_str(), pattern.size() + 1);
+    const int error = errno;
+    ::pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+    errno = error;
+    return fd;
+}
 
 // The permissions a newly created file gets from the process's umask.
 mode_t newFileMode()
@@ -79,7 +100,7 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
         return nullptr;
     }
     std::string temporary = path + ".XXXXXX";
-    int fd = ::mkostemp(temporary.data(), O_CLOEXEC);
+    int fd = createTemporary(temporary);
     if (fd < 0) {
         *errorText = errorFor(errno);
         return nullptr;
@@ -90,9 +111,9 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
         *errorText = errorFor(errno);
         ::close(fd);
         ::unlink(temporary.c_str());
+        forgetTemporary();
         return nullptr;
     }
-    removeTemporaryOnFatalSignals(temporary);
     return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, std::move(temporary), stream));
 }
 

@@ -218,6 +218,9 @@ TEST(HTCommandLineE2ETest, KilledRunsLeaveTheEarlierJSONFileAndNoOther)
             dup2(report[1], STDOUT_FILENO);
             int null = open("/dev/null", O_WRONLY);
             dup2(null, STDERR_FILENO);
+            // As a user's shell starts it, whatever this test inherited.
+            ::signal(SIGTERM, SIG_DFL);
+            ::signal(SIGHUP, SIG_DFL);
             execv(kHeftBinary, argv.data());
             _exit(127);
         }
@@ -227,7 +230,14 @@ TEST(HTCommandLineE2ETest, KilledRunsLeaveTheEarlierJSONFileAndNoOther)
         EXPECT_EQ(entries(), 2u) << "no temporary file beside the JSON file";
         kill(heft, signal);
         int status = 0;
-        while (waitpid(heft, &status, 0) < 0 && errno == EINTR) {}
+        pid_t ended = 0;
+        for (int waited = 0; waited < 500 && (ended = waitpid(heft, &status, WNOHANG)) == 0; ++waited)
+            usleep(10 * 1000);
+        if (ended == 0) {
+            ADD_FAILURE() << "heft did not end on the signal";
+            kill(heft, SIGKILL);
+            waitpid(heft, &status, 0);
+        }
         close(report[0]);
         EXPECT_TRUE(WIFSIGNALED(status) && WTERMSIG(status) == signal);
         EXPECT_EQ(readFile(path), "earlier report");
