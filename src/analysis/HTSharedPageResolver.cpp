@@ -43,25 +43,19 @@ struct HTSharedPageResolver::Candidate {
 };
 
 // Sets of processes, each a sorted list of places in the process list,
-// under small numbers; set 0 is the empty set. Pages are met sorted by
-// identity, and neighbouring identities mostly belong to one fork family,
-// so the set last asked for is tried first.
+// under small numbers from 1 (0 stands for a page one process alone maps).
+// Pages are met sorted by identity, and neighbouring identities mostly
+// belong to one fork family, so the set last asked for is tried first.
 class HTSharedPageResolver::ProcessSets {
 public:
-    ProcessSets() : members_(1) {}
-
     uint32_t setOf(const std::vector<uint32_t>& members)
     {
-        if (members == members_[last_]) return last_;
-        auto found = numbers_.find(members);
-        if (found == numbers_.end()) {
-            found = numbers_.emplace(members, static_cast<uint32_t>(members_.size())).first;
-            members_.push_back(members);
-        }
+        if (last_ != 0 && members == lastMembers_) return last_;
+        auto found = numbers_.try_emplace(members, static_cast<uint32_t>(numbers_.size() + 1)).first;
+        lastMembers_ = members;
         last_ = found->second;
         return last_;
     }
-    size_t size(uint32_t set) const { return members_[set].size(); }
 
 private:
     struct Hash {
@@ -72,8 +66,8 @@ private:
             return static_cast<size_t>(hash);
         }
     };
-    std::vector<std::vector<uint32_t>> members_;
     std::unordered_map<std::vector<uint32_t>, uint32_t, Hash> numbers_;
+    std::vector<uint32_t> lastMembers_;
     uint32_t last_ = 0;
 };
 

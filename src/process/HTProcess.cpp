@@ -2,14 +2,14 @@
 
 #include "analysis/HTHeft.h"
 #include "model/HTAuxDataMap.h"
+#include "platform/HTWorkQueue.h"
 #include "process/HTKernelProcess.h"
 #include "process/HTUserProcess.h"
-#include "platform/HTWorkQueue.h"
 
 #include <algorithm>
 #include <cerrno>
-#include <climits>
 #include <charconv>
+#include <climits>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
