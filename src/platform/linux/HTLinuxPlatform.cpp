@@ -111,7 +111,7 @@ HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
     mapping.hugetlb = vma.hasFlag(HTVmFlagHugetlb);
     mapping.privateFile = vma.kind == HTSmapsKind::File && !vma.shared;
     // Device memory has frames of its own kind.
-    if (vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) || vma.hasFlag(HTVmFlagMixedMap)) return mapping;
+    if (vma.mapsDeviceMemory()) return mapping;
     // A block device's file systems keep their pages on the device, never in
     // swap (tmpfs and its kin sit on anonymous devices, major number 0), and
     // without a dirty page, counted from the same smaps as the walk, no file
@@ -135,9 +135,7 @@ HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
 // and copies shared after a fork are dirty or swapped.
 bool mayHoldSharedAnonymousPages(const HTSmapsEntry& vma)
 {
-    if (vma.shared || vma.hasFlag(HTVmFlagHugetlb) || vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) ||
-        vma.hasFlag(HTVmFlagMixedMap))
-        return false;
+    if (vma.shared || vma.hasFlag(HTVmFlagHugetlb) || vma.mapsDeviceMemory()) return false;
     switch (vma.kind) {
     case HTSmapsKind::Anonymous:
     case HTSmapsKind::Heap:
@@ -154,9 +152,7 @@ bool mayHoldSharedAnonymousPages(const HTSmapsEntry& vma)
 // a page answers the same.
 int32_t uniformDisposition(const HTSmapsEntry& vma, bool swapped)
 {
-    if (swapped || vma.hasFlag(HTVmFlagHugetlb) || vma.hasFlag(HTVmFlagIO) || vma.hasFlag(HTVmFlagPfnMap) ||
-        vma.hasFlag(HTVmFlagMixedMap))
-        return 0;
+    if (swapped || vma.hasFlag(HTVmFlagHugetlb) || vma.mapsDeviceMemory()) return 0;
     // Shared memory is all swap-backed: dirty.
     if (vma.shared && vma.isSharedMemory()) return VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
     // A file of a block device that smaps finds wholly clean, with no

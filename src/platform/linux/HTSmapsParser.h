@@ -72,6 +72,8 @@ struct HTSmapsEntry {
 
     uint64_t size() const { return end - start; }
     bool hasFlag(HTSmapsVmFlag flag) const { return (vmFlags & flag) != 0; }
+    // Device memory: raw page frames, with or without page structures.
+    bool mapsDeviceMemory() const { return (vmFlags & (HTVmFlagIO | HTVmFlagPfnMap | HTVmFlagMixedMap)) != 0; }
     bool isSharedMemory() const
     {
         return kind == HTSmapsKind::SharedMemory || kind == HTSmapsKind::NamedSharedMemory;
