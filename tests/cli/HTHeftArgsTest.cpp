@@ -105,8 +105,10 @@ TEST(HTHeftArgsTest, BadValuesAreRejectedWithTheirOwnCodeAndRemedy)
     // Trailing characters, values that would wrap to another pid, and
     // negative numbers name no process.
     for (const char* value : {"abc", "42x", "12 abc", "", "-7", "2147483648", "4294967297", "99999999999999999999"})
-        rows.push_back({{"--pid", "5", "--pid", value}, 4, std::string("'") + value +
-                        "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name."});
+        rows.push_back({{"--pid", "5", "--pid", value}, 4,
+                        std::string("'") + value +
+                            "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process "
+                            "name."});
     // The format must match exactly.
     for (const char* value : {"bad", "Bytes", "page", ""})
         rows.push_back({{"-f", value}, 2,
