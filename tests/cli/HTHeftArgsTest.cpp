@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -25,6 +26,17 @@ Parsed parse(std::vector<std::string> arguments)
     testing::internal::CaptureStderr();
     parsed.args = HTHeftArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data(), &parsed.error);
     parsed.standardError = testing::internal::GetCapturedStderr();
+    return parsed;
+}
+
+// Parses `arguments`, which must fail with `code` and `description`.
+Parsed rejected(std::vector<std::string> arguments, int code, const std::optional<std::string>& description)
+{
+    Parsed parsed = parse(std::move(arguments));
+    EXPECT_FALSE(parsed.args);
+    EXPECT_EQ(parsed.error.domain, "HTHeftError");
+    EXPECT_EQ(parsed.error.code, code);
+    EXPECT_EQ(parsed.error.description, description);
     return parsed;
 }
 
@@ -94,53 +106,34 @@ TEST(HTHeftArgsTest, PidValuesAreWholeNumbersInRange)
 
 TEST(HTHeftArgsTest, BadValuesAreRejectedWithTheirOwnCodeAndRemedy)
 {
-    struct Row {
-        std::vector<std::string> arguments;
-        int code;
-        std::string description;
-    };
-    std::vector<Row> rows = {{{"--sort", "size"}, 3,
-                              "Unrecognized argument 'size' to --sort.\nAccepted arguments: dirty, swapped, clean, "
-                              "reclaimable, wired, regions, category"}};
+    rejected({"--sort", "size"}, 3,
+             "Unrecognized argument 'size' to --sort.\nAccepted arguments: dirty, swapped, clean, reclaimable, wired, "
+             "regions, category");
     // Trailing characters, values that would wrap to another pid, and
     // negative numbers name no process.
-    for (const char* value : {"abc", "42x", "12 abc", "", "-7", "2147483648", "4294967297", "99999999999999999999"})
-        rows.push_back({{"--pid", "5", "--pid", value}, 4,
-                        std::string("'") + value +
-                            "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process "
-                            "name."});
+    for (const char* value : {"abc", "42x", "12 abc", "", "-7", "2147483648", "4294967297", "99999999999999999999"}) {
+        SCOPED_TRACE(value);
+        rejected({"--pid", "5", "--pid", value}, 4,
+                 std::string("'") + value +
+                     "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name.");
+    }
     // The format must match exactly.
-    for (const char* value : {"bad", "Bytes", "page", ""})
-        rows.push_back({{"-f", value}, 2,
-                        "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'."});
-    for (const Row& row : rows) {
-        SCOPED_TRACE(row.arguments.front() + " '" + row.arguments.back() + "'");
-        Parsed parsed = parse(row.arguments);
-        EXPECT_FALSE(parsed.args);
-        EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, row.code);
-        EXPECT_EQ(parsed.error.description, row.description);
+    for (const char* value : {"bad", "Bytes", "page", ""}) {
+        SCOPED_TRACE(value);
+        rejected({"-f", value}, 2,
+                 "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.");
     }
 }
 
 TEST(HTHeftArgsTest, HelpAndParserErrorsCarryNoDescription)
 {
-    for (const char* help : {"-h", "--help"}) {
-        Parsed parsed = parse({"-a", help, "--sort", "size"});
-        EXPECT_FALSE(parsed.args);
-        EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, 1) << "parsing stops at the first error";
-        EXPECT_FALSE(parsed.error.description);
-        EXPECT_EQ(parsed.standardError, "");
-    }
-
+    // Parsing stops at the first error; help leaves standard error alone.
+    for (const char* help : {"-h", "--help"})
+        EXPECT_EQ(rejected({"-a", help, "--sort", "size"}, 1, std::nullopt).standardError, "") << help;
+    // The option parser names the culprit itself.
     for (std::vector<std::string> bad : {std::vector<std::string>{"--bogus"}, {"-q"}, {"-j"}, {"--sort"}}) {
-        Parsed parsed = parse(bad);
-        EXPECT_FALSE(parsed.args) << bad[0];
-        EXPECT_EQ(parsed.error.code, 5) << bad[0];
-        EXPECT_FALSE(parsed.error.description);
-        // The option parser names the culprit itself.
-        EXPECT_NE(parsed.standardError.find("heft: "), std::string::npos) << parsed.standardError;
+        SCOPED_TRACE(bad[0]);
+        EXPECT_NE(rejected(bad, 5, std::nullopt).standardError.find("heft: "), std::string::npos);
     }
 
     // Without an error slot a failure is silent.
