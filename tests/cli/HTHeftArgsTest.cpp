@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -25,6 +26,17 @@ Parsed parse(std::vector<std::string> arguments)
     testing::internal::CaptureStderr();
     parsed.args = HTHeftArgs::initWithArgc(static_cast<int>(arguments.size()), argv.data(), &parsed.error);
     parsed.standardError = testing::internal::GetCapturedStderr();
+    return parsed;
+}
+
+// Parses `arguments`, which must fail with `code` and `description`.
+Parsed rejected(std::vector<std::string> arguments, int code, const std::optional<std::string>& description)
+{
+    Parsed parsed = parse(std::move(arguments));
+    EXPECT_FALSE(parsed.args);
+    EXPECT_EQ(parsed.error.domain, "HTHeftError");
+    EXPECT_EQ(parsed.error.code, code);
+    EXPECT_EQ(parsed.error.description, description);
     return parsed;
 }
 
@@ -81,68 +93,47 @@ TEST(HTHeftArgsTest, SortMatchesAnyCaseAndStoresTheColumnName)
     EXPECT_EQ(parse({"--sort", "DIRTY"}).args->textSort(), "Dirty");
     EXPECT_EQ(parse({"--sort", "cAtEgOrY"}).args->textSort(), "Category");
     EXPECT_EQ(parse({"--sort", "wired", "--sort", "reclaimable"}).args->textSort(), "Reclaimable");
-
-    Parsed parsed = parse({"--sort", "size"});
-    EXPECT_FALSE(parsed.args);
-    EXPECT_EQ(parsed.error.domain, "HTHeftError");
-    EXPECT_EQ(parsed.error.code, 3);
-    EXPECT_EQ(parsed.error.description,
-              "Unrecognized argument 'size' to --sort.\n"
-              "Accepted arguments: dirty, swapped, clean, reclaimable, wired, regions, category");
 }
 
-TEST(HTHeftArgsTest, PidValuesMustBeWholeNumbersInRange)
+TEST(HTHeftArgsTest, PidValuesAreWholeNumbersInRange)
 {
     Parsed parsed = parse({"--pid", "42", "--pid", " 7", "--pid", "0", "--pid", "2147483647"});
     ASSERT_TRUE(parsed.args);
     EXPECT_EQ(pidsOf(*parsed.args), (std::vector<int32_t>{42, 7, 0, 2147483647}));
     for (const auto& entry : parsed.args->targetPids()) EXPECT_FALSE(entry.second) << entry.first;
     EXPECT_TRUE(parsed.args->potentialTargetProcesses().empty());
+}
 
+TEST(HTHeftArgsTest, BadValuesAreRejectedWithTheirOwnCodeAndRemedy)
+{
+    rejected({"--sort", "size"}, 3,
+             "Unrecognized argument 'size' to --sort.\nAccepted arguments: dirty, swapped, clean, reclaimable, wired, "
+             "regions, category");
     // Trailing characters, values that would wrap to another pid, and
     // negative numbers name no process.
     for (const char* value : {"abc", "42x", "12 abc", "", "-7", "2147483648", "4294967297", "99999999999999999999"}) {
         SCOPED_TRACE(value);
-        parsed = parse({"--pid", "5", "--pid", value});
-        EXPECT_FALSE(parsed.args);
-        EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, 4);
-        EXPECT_EQ(parsed.error.description, std::string("'") + value +
-                                                "' is not a valid integer for --pid.\n\nUse -p / --proc if you "
-                                                "meant to specify a process name.");
+        rejected({"--pid", "5", "--pid", value}, 4,
+                 std::string("'") + value +
+                     "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process name.");
     }
-}
-
-TEST(HTHeftArgsTest, FormatMustMatchExactly)
-{
-    for (const char* bad : {"bad", "Bytes", "page", ""}) {
-        Parsed parsed = parse({"-f", bad});
-        EXPECT_FALSE(parsed.args) << bad;
-        EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, 2) << bad;
-        EXPECT_EQ(parsed.error.description,
-                  "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.");
+    // The format must match exactly.
+    for (const char* value : {"bad", "Bytes", "page", ""}) {
+        SCOPED_TRACE(value);
+        rejected({"-f", value}, 2,
+                 "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.");
     }
 }
 
 TEST(HTHeftArgsTest, HelpAndParserErrorsCarryNoDescription)
 {
-    for (const char* help : {"-h", "--help"}) {
-        Parsed parsed = parse({"-a", help, "--sort", "size"});
-        EXPECT_FALSE(parsed.args);
-        EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, 1) << "parsing stops at the first error";
-        EXPECT_FALSE(parsed.error.description);
-        EXPECT_EQ(parsed.standardError, "");
-    }
-
+    // Parsing stops at the first error; help leaves standard error alone.
+    for (const char* help : {"-h", "--help"})
+        EXPECT_EQ(rejected({"-a", help, "--sort", "size"}, 1, std::nullopt).standardError, "") << help;
+    // The option parser names the culprit itself.
     for (std::vector<std::string> bad : {std::vector<std::string>{"--bogus"}, {"-q"}, {"-j"}, {"--sort"}}) {
-        Parsed parsed = parse(bad);
-        EXPECT_FALSE(parsed.args) << bad[0];
-        EXPECT_EQ(parsed.error.code, 5) << bad[0];
-        EXPECT_FALSE(parsed.error.description);
-        // The option parser names the culprit itself.
-        EXPECT_NE(parsed.standardError.find("heft: "), std::string::npos) << parsed.standardError;
+        SCOPED_TRACE(bad[0]);
+        EXPECT_NE(rejected(bad, 5, std::nullopt).standardError.find("heft: "), std::string::npos);
     }
 
     // Without an error slot a failure is silent.

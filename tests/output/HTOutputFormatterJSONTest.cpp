@@ -258,13 +258,11 @@ TEST_F(HTOutputFormatterJSONTest, SharedTables)
     auto a = process(30, "a");
     auto b = process(10, "b");
     auto c = process(20, "c");
-    auto all = std::make_shared<HTProcessGroup>();
-    for (const auto& member : {a, b, c}) all->addProcess(member);
-    all->freeze();
-    auto pair = std::make_shared<HTProcessGroup>();
-    pair->addProcess(a);
-    pair->addProcess(b);
-    pair->freeze();
+    HTProcessGroup all, pair;
+    for (const auto& member : {a, b, c}) all.addProcess(member);
+    for (const auto& member : {a, b}) pair.addProcess(member);
+    all.freeze();
+    pair.freeze();
 
     {
         // The tables are gone before end(): the formatter keeps what it needs.
@@ -278,8 +276,8 @@ TEST_F(HTOutputFormatterJSONTest, SharedTables)
             formatter->printProcessHeader(*p);
             formatter->printProcessTotal(0, *p);
             formatter->endProcessHeader(*p);
-            formatter->printSharedCategories(common, *all, *p, false, HTMemoryTotals{});
-            if (p != c) formatter->printSharedCategories(p == a ? viewA : viewB, *pair, *p, true, HTMemoryTotals{});
+            formatter->printSharedCategories(common, all, *p, false, HTMemoryTotals{});
+            if (p != c) formatter->printSharedCategories(p == a ? viewA : viewB, pair, *p, true, HTMemoryTotals{});
             formatter->printProcessAuxData(nullptr);
         }
     }

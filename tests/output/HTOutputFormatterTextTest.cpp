@@ -141,31 +141,24 @@ TEST(HTOutputFormatterText, RendersSizesInEachFormat)
     // Formatted: powers of 1024, no decimals, at most four digits before the unit.
     struct Row {
         int64_t format;
-        uint64_t pageSize, size;
-        const char* expected;
+        uint64_t pageSize;
+        std::vector<std::pair<uint64_t, const char*>> sizes;
     } rows[] = {
-        {HTTextFormatBytes, 0, 0, "0 B"},
-        {HTTextFormatBytes, 0, 16384, "16384 B"},
-        {HTTextFormatPages, 0, 12345, "0 pages"},  // no page size yet
-        {HTTextFormatPages, 16384, 0, "0 pages"},
-        {HTTextFormatPages, 16384, 1, "1 pages"},
-        {HTTextFormatPages, 16384, 16384, "1 pages"},
-        {HTTextFormatPages, 16384, 16385, "2 pages"},
-        {HTTextFormatPages, 16384, UINT64_MAX, "1125899906842624 pages"},
-        {HTTextFormatFormatted, 0, 0, "0 B"},
-        {HTTextFormatFormatted, 0, 1023, "1023 B"},
-        {HTTextFormatFormatted, 0, 1024, "1024 B"},
-        {HTTextFormatFormatted, 0, 1536, "1536 B"},
-        {HTTextFormatFormatted, 0, 16384, "16 KB"},
-        {HTTextFormatFormatted, 0, 10 * 1024 * 1024, "10 MB"},
-        {HTTextFormatFormatted, 0, 1023 * 1024, "1023 KB"},
-        {HTTextFormatFormatted, 0, 2 * 1024 * 1024, "2048 KB"},
+        {HTTextFormatBytes, 0, {{0, "0 B"}, {16384, "16384 B"}}},
+        {HTTextFormatPages, 0, {{12345, "0 pages"}}},  // no page size yet
+        {HTTextFormatPages, 16384,
+         {{0, "0 pages"}, {1, "1 pages"}, {16384, "1 pages"}, {16385, "2 pages"},
+          {UINT64_MAX, "1125899906842624 pages"}}},
+        {HTTextFormatFormatted, 0,
+         {{0, "0 B"}, {1023, "1023 B"}, {1024, "1024 B"}, {1536, "1536 B"}, {16384, "16 KB"},
+          {10 * 1024 * 1024, "10 MB"}, {1023 * 1024, "1023 KB"}, {2 * 1024 * 1024, "2048 KB"}}},
     };
     HTOutputCapture out;
     for (const Row& row : rows) {
         HTOutputFormatterText formatter(row.format, 0, "Dirty", true, out.file());
         if (row.pageSize) formatter.setPageSize(row.pageSize);
-        EXPECT_EQ(formatter.formattedStringForSize(row.size), row.expected) << row.format << " " << row.size;
+        for (const auto& [size, expected] : row.sizes)
+            EXPECT_EQ(formatter.formattedStringForSize(size), expected) << row.format << " " << size;
     }
     EXPECT_EQ(out.take(), "");
 }
@@ -191,22 +184,16 @@ TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
         TextFormatter formatter(HTTextFormatFormatted, 0, sort, true, stdout);
         return formatter._sortedKeysForCategories(categories);
     };
-    // Equal rows keep the map's order.
-    EXPECT_EQ(keysSortedBy("Dirty"),
-              (Keys{"MALLOC_SMALL", "stack", "__TEXT /usr/lib/libexample", "__DATA libplain", "unnamed"}));
-    EXPECT_EQ(keysSortedBy("Swapped"),
-              (Keys{"MALLOC_SMALL", "__DATA libplain", "__TEXT /usr/lib/libexample", "stack", "unnamed"}));
-    EXPECT_EQ(keysSortedBy("Clean"),
-              (Keys{"__TEXT /usr/lib/libexample", "__DATA libplain", "MALLOC_SMALL", "stack", "unnamed"}));
-    EXPECT_EQ(keysSortedBy("Reclaimable"),
-              (Keys{"stack", "__DATA libplain", "__TEXT /usr/lib/libexample", "MALLOC_SMALL", "unnamed"}));
-    EXPECT_EQ(keysSortedBy("Wired"),
-              (Keys{"MALLOC_SMALL", "__DATA libplain", "__TEXT /usr/lib/libexample", "stack", "unnamed"}));
-    EXPECT_EQ(keysSortedBy("Regions"),
-              (Keys{"stack", "__TEXT /usr/lib/libexample", "__DATA libplain", "MALLOC_SMALL", "unnamed"}));
-    // Character codes: upper case before "_" before lower case.
-    EXPECT_EQ(keysSortedBy("Category"),
-              (Keys{"MALLOC_SMALL", "__DATA libplain", "__TEXT /usr/lib/libexample", "stack", "unnamed"}));
+    const std::string D = "__DATA libplain", T = "__TEXT /usr/lib/libexample", M = "MALLOC_SMALL", S = "stack",
+                      U = "unnamed";
+    // Equal rows keep the map's order; "Category" goes by character codes:
+    // upper case before "_" before lower case.
+    const std::pair<const char*, Keys> rows[] = {
+        {"Dirty", {M, S, T, D, U}}, {"Swapped", {M, D, T, S, U}}, {"Clean", {T, D, M, S, U}},
+        {"Reclaimable", {S, D, T, M, U}}, {"Wired", {M, D, T, S, U}}, {"Regions", {S, T, D, M, U}},
+        {"Category", {M, D, T, S, U}},
+    };
+    for (const auto& [sort, keys] : rows) EXPECT_EQ(keysSortedBy(sort), keys) << sort;
 
     EXPECT_DEATH(keysSortedBy("dirty"), "HTOutputFormatterText.*Unhandled text sort column");
 }
