@@ -21,6 +21,9 @@ inline HTRegionFigures figures(const HTMemoryRegion& region)
     return {region.dirtySize(), region.swappedSize(), region.cleanNonSpecSize(), region.reclaimableSize()};
 }
 
+// The page-range queries the fake platform answered, as {address, size}.
+using HTPageQueries = decltype(HTFakePlatform::pageQueries);
+
 // A scripted region with the page counts the kernel reports for it.
 inline HTFakePlatform::Region withPages(HTFakePlatform::Region region, uint32_t resident, uint32_t dirtied,
                                         uint32_t swapped = 0)

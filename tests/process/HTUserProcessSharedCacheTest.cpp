@@ -12,6 +12,8 @@ using Region = HTFakePlatform::Region;
 constexpr uint64_t kBase = 0x180000000;
 constexpr uint64_t kPrivate = 0x100000000;
 constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
+// Where most tests put their one writable mapping.
+constexpr uint64_t kStart = kBase + 0x100000;
 
 class HTUserProcessSharedCacheTest : public HTUserProcessTest {
 protected:
@@ -151,14 +153,13 @@ TEST_F(HTUserProcessSharedCacheTest, ImagesCutMappingsIntoPieces)
 
 TEST_F(HTUserProcessSharedCacheTest, PageQueriesCountASharedPageOnce)
 {
-    const uint64_t start = kBase + 0x100000;
-    addMapping(start, 4, true);
-    addImage("/usr/lib/liba.dylib", {{"__DATA", start, 0x1800}});
-    addImage("/usr/lib/libb.dylib", {{"__DATA", start + 0x1800, 0x1800}});
-    target().dispositions[start] = kPresent;
-    target().dispositions[start + kPage] = kPresent | VM_PAGE_QUERY_PAGE_DIRTY | VM_PAGE_QUERY_PAGE_EXTERNAL;
-    target().dispositions[start + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-    target().dispositions[start + 3 * kPage] = kPresent;
+    addMapping(kStart, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", kStart, 0x1800}});
+    addImage("/usr/lib/libb.dylib", {{"__DATA", kStart + 0x1800, 0x1800}});
+    target().dispositions[kStart] = kPresent;
+    target().dispositions[kStart + kPage] = kPresent | VM_PAGE_QUERY_PAGE_DIRTY | VM_PAGE_QUERY_PAGE_EXTERNAL;
+    target().dispositions[kStart + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    target().dispositions[kStart + 3 * kPage] = kPresent;
 
     // A page-aligned piece: resident anonymous pages are dirty, clean file
     // pages are nothing, paged-out pages are swapped.
@@ -177,18 +178,16 @@ TEST_F(HTUserProcessSharedCacheTest, PageQueriesCountASharedPageOnce)
     const std::vector<HTRegionFigures> measured = {{0x1800, 0, 0, 0}, {0x800, kPage, 0, 0}, {}, {kPage, kPage, 0, 0}};
     for (size_t i = 0; i < measured.size(); ++i) EXPECT_EQ(figures(*shared[i]), measured[i]) << "piece " << i;
     EXPECT_EQ(platform_->pageQueries,
-              (std::vector<std::pair<uint64_t, uint64_t>>{
-                  {start, 2 * kPage}, {start + 2 * kPage, kPage}, {other, 3 * kPage}}));
+              (HTPageQueries{{kStart, 2 * kPage}, {kStart + 2 * kPage, kPage}, {other, 3 * kPage}}));
 }
 
 TEST_F(HTUserProcessSharedCacheTest, UnusedPieceGetsItsLastPageFromTheNextQuery)
 {
-    const uint64_t start = kBase + 0x100000;
-    addMapping(start, 4, true);
-    addImage("/usr/lib/liba.dylib", {{"__DATA", start + 0x1800, 0x1800}});
-    target().dispositions[start] = kPresent;
-    target().dispositions[start + kPage] = kPresent;
-    target().dispositions[start + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
+    addMapping(kStart, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", kStart + 0x1800, 0x1800}});
+    target().dispositions[kStart] = kPresent;
+    target().dispositions[kStart + kPage] = kPresent;
+    target().dispositions[kStart + 2 * kPage] = VM_PAGE_QUERY_PAGE_PAGED_OUT;
 
     auto shared = pieces(*gatheredMach());
     ASSERT_EQ(shared.size(), 3u);
@@ -197,17 +196,15 @@ TEST_F(HTUserProcessSharedCacheTest, UnusedPieceGetsItsLastPageFromTheNextQuery)
     EXPECT_TRUE(shared[0]->unusedSharedCacheRegion());
     EXPECT_EQ(figures(*shared[0]), (HTRegionFigures{0x800, 0, 0, 0}));
     EXPECT_EQ(figures(*shared[1]), (HTRegionFigures{0x800, kPage, 0, 0}));
-    EXPECT_EQ(platform_->pageQueries,
-              (std::vector<std::pair<uint64_t, uint64_t>>{{start + kPage, 2 * kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{kStart + kPage, 2 * kPage}}));
 }
 
 TEST_F(HTUserProcessSharedCacheTest, FailedPageQueryStopsTheWalk)
 {
-    const uint64_t start = kBase + 0x100000;
-    addMapping(start, 4, true);
-    addImage("/usr/lib/liba.dylib", {{"__DATA", start, 4 * kPage}});
+    addMapping(kStart, 4, true);
+    addImage("/usr/lib/liba.dylib", {{"__DATA", kStart, 4 * kPage}});
     addMapping(kBase + 0x200000, 4, true);
-    target().pageQueryFailureAddress = start + kPage;
+    target().pageQueryFailureAddress = kStart + kPage;
 
     testing::internal::CaptureStderr();
     auto process = gatheredMach();

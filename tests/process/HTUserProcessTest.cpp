@@ -430,10 +430,9 @@ TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem
 
     auto process = gathered();
     // Only the populated runs are queried, a chunk of at most 4096 pages at a time.
-    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
-                                          {start + 10 * kPage, 4096 * kPage},
-                                          {start + 4106 * kPage, 94 * kPage},
-                                          {start + 4201 * kPage, 799 * kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{start + 10 * kPage, 4096 * kPage},
+                                                     {start + 4106 * kPage, 94 * kPage},
+                                                     {start + 4201 * kPage, 799 * kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{10 * kPage, 4190 * kPage, 4190 * kPage, 0, 0, 0, 0},
                                  {4201 * kPage, 799 * kPage, 0, 0, 799 * kPage, 0, 0}}));
@@ -452,8 +451,7 @@ TEST_F(HTUserProcessSubrangeTest, EmptyStretchesOfSparseRegionsAreNotQueried)
     target().dispositions[start + far * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
 
     auto process = gathered();
-    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
-                                          {start + 7 * kPage, kPage}, {start + far * kPage, kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{start + 7 * kPage, kPage}, {start + far * kPage, kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{0x1000 + 7 * kPage, kPage, kPage, 0, 0, 0, 0},
                                  {0x1000 + far * kPage, kPage, kPage, 0, 0, 0, 0}}));
