@@ -67,9 +67,9 @@ TEST_F(HTUserProcessTest, LedgerFailuresLeaveNoPageTableRegion)
     addTarget().ledgerErrno = EPERM;
     platform_->ledgerTemplate = std::vector<std::string>{"page_table"};
     auto process = gathered();
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0], std::string("target [500]: Unable to retrieve ledger entry info - ") +
-                                          std::strerror(EPERM));
+    EXPECT_EQ(process->warnings(), std::vector<std::string>{
+                                       std::string("target [500]: Unable to retrieve ledger entry info - ") +
+                                       std::strerror(EPERM)});
     EXPECT_TRUE(process->memoryRegions().empty());
 
     // An unreadable template: a message on standard error, no warning.
@@ -218,8 +218,7 @@ TEST_F(HTUserProcessTest, OwnedObjectListGrowingBetweenAsksIsReadWhole)
     auto failed = gathered();
     std::string expected = std::string("target [500]: vm.get_owned_vmobjects - ") + std::strerror(EPERM);
     EXPECT_EQ(testing::internal::GetCapturedStderr(), expected + "\n");
-    ASSERT_EQ(failed->warnings().size(), 1u);
-    EXPECT_EQ(failed->warnings()[0], expected);
+    EXPECT_EQ(failed->warnings(), std::vector<std::string>{expected});
 }
 
 TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
@@ -244,10 +243,9 @@ TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
     ASSERT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->memoryRegions()[0]->ownedExclusivelyByParentProcess());
     EXPECT_EQ(process->memoryRegions()[0]->dirtySize(), 4096u);
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0],
-              "target [500]: Heft changed while analyzing \u2013 unmapped owned physical heft may be over-counted "
-              "by 2048 bytes");
+    EXPECT_EQ(process->warnings(),
+              std::vector<std::string>{"target [500]: Heft changed while analyzing \u2013 unmapped owned physical "
+                                       "heft may be over-counted by 2048 bytes"});
     EXPECT_EQ(platform_->regionLookups, 3);
 }
 
@@ -310,16 +308,14 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     EXPECT_EQ(platform_->machErrors.back(), "mach_vm_region_recurse: process is gone");
     EXPECT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->errors().empty());
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0], "target [500]: process is gone (process exited)");
+    EXPECT_EQ(process->warnings(), std::vector<std::string>{"target [500]: process is gone (process exited)"});
 
     script.exited = false;
     script.info.pbi_status = SZOMB;
     testing::internal::CaptureStderr();
     auto zombie = gathered();
     testing::internal::GetCapturedStderr();
-    ASSERT_EQ(zombie->warnings().size(), 1u);
-    EXPECT_EQ(zombie->warnings()[0], "target [500]: process is gone (zombie)");
+    EXPECT_EQ(zombie->warnings(), std::vector<std::string>{"target [500]: process is gone (zombie)"});
 
     // A running process, or another code: an error.
     script.info.pbi_status = SRUN;
