@@ -6,6 +6,7 @@
 
 #include <gtest/gtest.h>
 
+#include <array>
 #include <memory>
 
 namespace {
@@ -26,6 +27,13 @@ std::shared_ptr<HTMemoryRegion> region(uint64_t objectId, uint64_t offsetPages, 
     made->setShare_mode(shareMode);
     made->setName("shared memory");
     return made;
+}
+
+// An object's totals: dirty, swapped, clean, reclaimable.
+using Totals = std::array<uint64_t, 4>;
+Totals totals(const HTMemoryObject& o)
+{
+    return {o.totalDirtySize(), o.totalSwappedSize(), o.totalCleanSize(), o.totalReclaimableSize()};
 }
 
 // Processes whose platform answers the per-region heft setting. HTHeft
@@ -83,8 +91,7 @@ TEST(HTMemoryObject, TotalsCountEachPageOnce)
     object->addRegion(region(0, 0, 8, 8), *p1);
 
     object->finalize(false);
-    EXPECT_EQ(object->totalDirtySize(), 6 * kPage);
-    EXPECT_EQ(object->totalCleanSize(), kPage);
+    EXPECT_EQ(totals(*object), (Totals{6 * kPage, 0, kPage, 0}));
     EXPECT_EQ(object->memoryRegions().size(), 4u);
     EXPECT_EQ(object->rangeList(), nullptr);
     // A single process sees the object whole.
@@ -108,19 +115,15 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
     ASSERT_EQ(object->processMemoryRegions()->keys(), (std::vector<int32_t>{2, 1}));
     EXPECT_EQ(object->processMemoryRegions()->find(1)->size(), 1u);
 
-    // Two processes, one region each, equal to the totals: dropped.
-    auto equal = std::make_shared<HTMemoryObject>();
-    equal->addRegion(region(5, 0, 2, 2), *p1);
-    equal->addRegion(region(5, 0, 2, 2), *p2);
-    equal->finalize(false);
-    EXPECT_FALSE(equal->processMemoryRegions());
-
-    // One region each, but one differs from the totals: kept.
-    auto differing = std::make_shared<HTMemoryObject>();
-    differing->addRegion(region(5, 0, 2, 2), *p1);
-    differing->addRegion(region(5, 0, 2, 1), *p2);
-    differing->finalize(false);
-    EXPECT_TRUE(differing->processMemoryRegions());
+    // Two processes, one region each: dropped when both equal the totals,
+    // kept when one differs.
+    for (uint64_t secondDirty : {2, 1}) {
+        auto two = std::make_shared<HTMemoryObject>();
+        two->addRegion(region(5, 0, 2, 2), *p1);
+        two->addRegion(region(5, 0, 2, secondDirty), *p2);
+        two->finalize(false);
+        EXPECT_EQ(bool(two->processMemoryRegions()), secondDirty != 2) << secondDirty << " dirty";
+    }
 }
 
 TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
@@ -130,13 +133,12 @@ TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
     auto p2 = process(2);
     auto pageCounted = mappedTwiceByOne(*p1, *p2);
     pageCounted->finalize(false);
-    EXPECT_EQ(pageCounted->totalDirtySize(), 3 * kPage);
+    EXPECT_EQ(totals(*pageCounted), (Totals{3 * kPage, kPage, 0, 0}));
 
     // With the switch on no process is charged less than its regions say.
     auto object = mappedTwiceByOne(*p1, *p2);
     object->finalize(true);
-    EXPECT_EQ(object->totalDirtySize(), 4 * kPage);
-    EXPECT_EQ(object->totalSwappedSize(), kPage);
+    EXPECT_EQ(totals(*object), (Totals{4 * kPage, kPage, 0, 0}));
 
     // p1's regions report per-region heft: its view sums them as reported.
     auto view1 = object->viewForProcess(*p1, true);
@@ -162,11 +164,8 @@ TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
         object->addRegion(mapped, *p1);
     }
     object->finalize(false);
-    EXPECT_EQ(object->totalDirtySize(), 2 * kPage);
-    EXPECT_EQ(object->totalCleanSize(), 2 * kPage);
-    auto view = object->viewForProcess(*p1, false);
-    EXPECT_EQ(view->totalDirtySize(), 2 * kPage);
-    EXPECT_EQ(view->totalCleanSize(), 2 * kPage);
+    EXPECT_EQ(totals(*object), (Totals{2 * kPage, 0, 2 * kPage, 0}));
+    EXPECT_EQ(totals(*object->viewForProcess(*p1, false)), (Totals{2 * kPage, 0, 2 * kPage, 0}));
 }
 
 TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
@@ -185,8 +184,7 @@ TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
 
     EXPECT_EQ(object->viewForProcess(*owner, false), object);
     auto seen = object->viewForProcess(*other, false);
-    EXPECT_EQ(seen->totalDirtySize() + seen->totalSwappedSize() + seen->totalReclaimableSize(), 0u);
-    EXPECT_EQ(seen->totalCleanSize(), 4 * kPage);
+    EXPECT_EQ(totals(*seen), (Totals{0, 0, 4 * kPage, 0}));
     EXPECT_EQ(&seen->memoryRegions(), &object->memoryRegions()) << "a copy shares the region set";
 
     // Outside a kept per-process map a process sees the object whole, owned or not.

@@ -3,13 +3,14 @@
 #include "process/HTStringTable.h"
 
 #include "model/HTMemoryRegion.h"
-#include "platform/HTPlatform.h"
+#include "platform/fake/HTFakePlatform.h"
 
 #include <gtest/gtest.h>
 
 #include <map>
 #include <set>
 #include <thread>
+#include <tuple>
 
 namespace {
 
@@ -22,72 +23,46 @@ std::shared_ptr<HTImage> makeImage(uint64_t start, uint64_t size, const std::str
     return image;
 }
 
-// Answers the image listing from a script; everything else is unused.
-class HTImageListPlatform : public HTPlatform {
+// The fake platform, recording the listing's flags and resolving only the
+// paths it was given.
+class HTImageListPlatform : public HTFakePlatform {
 public:
-    std::vector<HTPlatformImage> images;
-    std::map<std::string, std::string> resolved;
     uint32_t flagsSeen = 0;
 
-    bool forEachTaskImage(HTTaskPort&, uint32_t flags,
+    bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
                           const std::function<void(const HTPlatformImage&)>& callback) override
     {
         flagsSeen = flags;
-        for (const auto& image : images) callback(image);
-        return true;
+        return HTFakePlatform::forEachTaskImage(task, flags, callback);
     }
     std::optional<std::string> realpath(const std::string& path) override
     {
-        auto found = resolved.find(path);
-        if (found == resolved.end()) return std::nullopt;
+        auto found = realpaths.find(path);
+        if (found == realpaths.end()) return std::nullopt;
         return found->second;
     }
 
-    int proc_listallpids(int32_t*, int) override { return 0; }
-    int proc_pidinfo(int32_t, int, uint64_t, void*, int) override { return 0; }
-    int proc_get_dirty(int32_t, uint32_t*) override { return ENOTSUP; }
-    int sysctl(const int*, unsigned, void*, size_t*, const void*, size_t) override { return unsupported(); }
-    int sysctlbyname(const char*, void*, size_t*, const void*, size_t) override { return unsupported(); }
-    uint64_t vm_kernel_page_size() override { return 4096; }
-    kern_return_t task_for_pid(int32_t, std::shared_ptr<HTTaskPort>*) override { return KERN_FAILURE; }
-    std::string mach_error_string(kern_return_t) override { return {}; }
-    void mach_error(const char*, kern_return_t) override {}
-    int32_t getpid() override { return 1; }
-    uint32_t geteuid() override { return 0; }
-    bool isatty(int) override { return false; }
-    bool stat(const char*) override { return false; }
+    // The task of a process listing `images`.
+    std::shared_ptr<HTTaskPort> task(std::vector<HTPlatformImage> images)
+    {
+        addProcess(42, 1, "imaged").images = std::move(images);
+        std::shared_ptr<HTTaskPort> port;
+        EXPECT_EQ(task_for_pid(42, &port), KERN_SUCCESS);
+        return port;
+    }
 };
-
-class HTImageTestTask : public HTTaskPort {
-public:
-    int32_t pid() const override { return 42; }
-};
-
-HTPlatformImage platformImage(const std::string& path, uint64_t base,
-                              std::vector<HTPlatformImageSegment> segments)
-{
-    HTPlatformImage image;
-    image.path = path;
-    image.baseAddress = base;
-    image.segments = std::move(segments);
-    return image;
-}
 
 }  // namespace
 
 TEST(HTImage, SettingTheNameSetsTheSegmentCode)
 {
+    // Renamed in turn; a name outside the families leaves the code as it was.
     HTImage image;
-    image.setName("__TEXT_EXEC");
-    EXPECT_EQ(image.segment(), HTSegmentText);
-    image.setName("__LINKEDIT");
-    EXPECT_EQ(image.segment(), HTSegmentLinkEdit);
-    image.setName("__DATA_CONST");
-    EXPECT_EQ(image.segment(), HTSegmentOther);
-    // A name outside the families leaves the code as it was.
-    image.setName("MACH_HEADER");
-    EXPECT_EQ(image.segment(), HTSegmentOther);
-    EXPECT_EQ(image.name(), "MACH_HEADER");
+    for (auto [name, segment] : {std::pair{"__TEXT_EXEC", HTSegmentText}, {"__LINKEDIT", HTSegmentLinkEdit},
+                                 {"__DATA_CONST", HTSegmentOther}, {"MACH_HEADER", HTSegmentOther}}) {
+        image.setName(name);
+        EXPECT_EQ(image.segment(), segment) << name;
+    }
 
     HTImage plain;
     plain.setName("data");
@@ -182,47 +157,39 @@ TEST(HTImage, GatherImagesNamesSegmentsAndResolvesPaths)
     const uint64_t sharedBase = 0x180000000;
     const uint64_t sharedSize = 0x40000000;
     HTImageListPlatform platform;
-    platform.resolved["/lib/link.so"] = "/lib/real.so";
-    platform.images = {
-        platformImage("/lib/link.so", 0x7f0000000000,
-                      {{"__DATA", 0x7f0000004000, 0x1000}, {"MACH_HEADER", 0x7f0000000000, 0x1000},
-                       {"__TEXT", 0x7f0000001000, 0x3000}}),
-        platformImage("/gone/lib.so", 0x10000, {{"", 0x10000, 0x1000}, {"text segment", 0x11000, 0x1000}}),
-        platformImage("/usr/lib/shared/libshared.so", sharedBase + 0x4000,
-                      {{"__DATA_CONST", sharedBase + 0x8000, 0x1000}, {"__LINKEDIT", sharedBase + 0x4000, 0x2000}}),
-    };
-    HTImageTestTask task;
-    auto images = HTImage::gatherImages(platform, task, sharedBase, sharedSize);
+    platform.realpaths["/lib/link.so"] = "/lib/real.so";
+    auto task = platform.task({
+        {"/lib/link.so", 0x7f0000000000,
+         {{"__DATA", 0x7f0000004000, 0x1000}, {"MACH_HEADER", 0x7f0000000000, 0x1000},
+          {"__TEXT", 0x7f0000001000, 0x3000}}},
+        {"/gone/lib.so", 0x10000, {{"", 0x10000, 0x1000}, {"text segment", 0x11000, 0x1000}}},
+        {"/usr/lib/shared/libshared.so", sharedBase + 0x4000,
+         {{"__DATA_CONST", sharedBase + 0x8000, 0x1000}, {"__LINKEDIT", sharedBase + 0x4000, 0x2000}}},
+    });
+    auto images = HTImage::gatherImages(platform, *task, sharedBase, sharedSize);
     EXPECT_EQ(platform.flagsSeen & 0x20101002u, 0x20101002u);
 
+    // In address order. An unresolvable path is kept as given; names run up
+    // to the first blank, "unknown" for none; the header counts as text.
+    using Row = std::tuple<uint64_t, uint64_t, std::string, int, std::string>;
+    std::vector<Row> rows;
+    for (const auto& image : images)
+        rows.emplace_back(image->start(), image->size(), image->name(), image->segment(), image->ownerPath());
+    EXPECT_EQ(rows, (std::vector<Row>{
+        {0x10000, 0x1000, "unknown", HTSegmentNotSet, "/gone/lib.so"},
+        {0x11000, 0x1000, "text", HTSegmentNotSet, "/gone/lib.so"},
+        {sharedBase + 0x4000, 0x2000, "__LINKEDIT", HTSegmentLinkEdit, "/usr/lib/shared/libshared.so"},
+        {sharedBase + 0x8000, 0x1000, "__DATA_CONST", HTSegmentOther, "/usr/lib/shared/libshared.so"},
+        {0x7f0000000000, 0x1000, "__TEXT", HTSegmentText, "/lib/real.so"},
+        {0x7f0000001000, 0x3000, "__TEXT", HTSegmentText, "/lib/real.so"},
+        {0x7f0000004000, 0x1000, "__DATA", HTSegmentOther, "/lib/real.so"},
+    }));
     ASSERT_EQ(images.size(), 7u);
-    for (size_t i = 1; i < images.size(); i++) EXPECT_LE(images[i - 1]->start(), images[i]->start());
-
-    // Unresolvable path kept as given; names up to the first blank, and
-    // "unknown" for none.
-    EXPECT_EQ(images[0]->start(), 0x10000u);
-    EXPECT_EQ(images[0]->name(), "unknown");
-    EXPECT_EQ(images[0]->segment(), HTSegmentNotSet);
-    EXPECT_EQ(images[0]->ownerPath(), "/gone/lib.so");
-    EXPECT_EQ(images[1]->name(), "text");
-
-    EXPECT_EQ(images[2]->name(), "__LINKEDIT");
-    EXPECT_EQ(images[2]->segment(), HTSegmentLinkEdit);
-    EXPECT_EQ(images[2]->ownerPath(), "/usr/lib/shared/libshared.so");
-    EXPECT_EQ(images[3]->name(), "__DATA_CONST");
-    EXPECT_EQ(images[3]->segment(), HTSegmentOther);
-    EXPECT_EQ(images[3]->size(), 0x1000u);
-
-    EXPECT_EQ(images[4]->start(), 0x7f0000000000u);
-    EXPECT_EQ(images[4]->name(), "__TEXT");
-    EXPECT_EQ(images[4]->segment(), HTSegmentText);
-    EXPECT_EQ(images[4]->ownerPath(), "/lib/real.so");
-    EXPECT_EQ(images[6]->name(), "__DATA");
 
     // Segment names, and paths in the shared region, are one string for
     // the whole run.
     EXPECT_EQ(&images[4]->name(), &images[5]->name());
-    auto again = HTImage::gatherImages(platform, task, sharedBase, sharedSize);
+    auto again = HTImage::gatherImages(platform, *task, sharedBase, sharedSize);
     ASSERT_EQ(again.size(), 7u);
     EXPECT_EQ(&again[2]->ownerPath(), &images[2]->ownerPath());
     EXPECT_EQ(&again[3]->name(), &images[3]->name());
@@ -238,9 +205,8 @@ TEST(HTImage, GatherImagesKeepsTheRightPathWhenThePathTableIsCrowded)
         HTStringTable::pathTable().intern("/crowded/other" + std::to_string(i), first + i, 1);
     }
     HTImageListPlatform platform;
-    platform.images = {platformImage("/crowded/mine.so", base, {{"MACH_HEADER", base, 0x1000}})};
-    HTImageTestTask task;
-    auto images = HTImage::gatherImages(platform, task, sharedBase, 0x10000000);
+    auto task = platform.task({{"/crowded/mine.so", base, {{"MACH_HEADER", base, 0x1000}}}});
+    auto images = HTImage::gatherImages(platform, *task, sharedBase, 0x10000000);
     ASSERT_EQ(images.size(), 1u);
     EXPECT_EQ(images[0]->ownerPath(), "/crowded/mine.so");
     EXPECT_EQ(images[0]->name(), "__TEXT");

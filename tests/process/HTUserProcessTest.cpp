@@ -1,3 +1,4 @@
+#include "process/HTRegionFigures.h"
 #include "process/HTUserProcessTestSupport.h"
 
 #include "model/HTAuxData.h"
@@ -66,9 +67,9 @@ TEST_F(HTUserProcessTest, LedgerFailuresLeaveNoPageTableRegion)
     addTarget().ledgerErrno = EPERM;
     platform_->ledgerTemplate = std::vector<std::string>{"page_table"};
     auto process = gathered();
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0], std::string("target [500]: Unable to retrieve ledger entry info - ") +
-                                          std::strerror(EPERM));
+    EXPECT_EQ(process->warnings(), std::vector<std::string>{
+                                       std::string("target [500]: Unable to retrieve ledger entry info - ") +
+                                       std::strerror(EPERM)});
     EXPECT_TRUE(process->memoryRegions().empty());
 
     // An unreadable template: a message on standard error, no warning.
@@ -98,65 +99,47 @@ TEST_F(HTUserProcessTest, EmptyProcessEndsTheWalkAtOnce)
 TEST_F(HTUserProcessTest, SizesFromPageCounts)
 {
     HTFakePlatform::Process& script = addTarget();
-    Region plain = anonymous(0x10000, 12);
-    plain.info.pages_resident = 10;
-    plain.info.pages_reusable = 3;
-    plain.info.pages_dirtied = 4;
-    plain.info.pages_swapped_out = 2;
-    Region volatileRegion = anonymous(0x20000, 8);
-    volatileRegion.info.pages_resident = 5;
-    volatileRegion.info.pages_dirtied = 5;
-    volatileRegion.purgeState = VM_PURGABLE_VOLATILE;
-    Region emptied = anonymous(0x30000, 8);
-    emptied.purgeState = VM_PURGABLE_EMPTY;
-    // More dirtied than resident is clamped, not wrapped.
-    Region odd = anonymous(0x40000, 4);
-    odd.info.pages_resident = 2;
-    odd.info.pages_dirtied = 3;
-    script.regions = {plain, volatileRegion, emptied, odd};
+    // The last has more dirtied than resident: clamped, not wrapped.
+    script.regions = {withPages(anonymous(0x10000, 12), 10, 4, 2), withPages(anonymous(0x20000, 8), 5, 5),
+                      anonymous(0x30000, 8), withPages(anonymous(0x40000, 4), 2, 3)};
+    script.regions[0].info.pages_reusable = 3;
+    script.regions[1].purgeState = VM_PURGABLE_VOLATILE;
+    script.regions[2].purgeState = VM_PURGABLE_EMPTY;
 
     // Without the breakdown, resident anonymous memory that is not
     // reusable is dirty.
     auto process = gathered();
     ASSERT_EQ(process->memoryRegions().size(), 4u);
-    const HTMemoryRegion& first = regionAt(*process, 0x10000);
-    EXPECT_EQ(first.dirtySize(), 7 * kPage);
-    EXPECT_EQ(first.reclaimableSize(), 3 * kPage);
-    EXPECT_EQ(first.cleanNonSpecSize(), 0u);
-    EXPECT_EQ(first.swappedSize(), 2 * kPage);
-    EXPECT_EQ(first.object_id(), plain.info.object_id_full);
-    EXPECT_EQ(regionAt(*process, 0x20000).dirtySize(), 0u);
-    EXPECT_EQ(regionAt(*process, 0x20000).reclaimableSize(), 5 * kPage);
+    EXPECT_EQ(figures(regionAt(*process, 0x10000)), (HTRegionFigures{7 * kPage, 2 * kPage, 0, 3 * kPage}));
+    EXPECT_EQ(regionAt(*process, 0x10000).object_id(), script.regions[0].info.object_id_full);
+    EXPECT_EQ(figures(regionAt(*process, 0x20000)), (HTRegionFigures{0, 0, 0, 5 * kPage}));
     EXPECT_EQ(regionAt(*process, 0x30000).reclaimableSize(), 8 * kPage);
 
     // With it, the kernel's dirtied count.
     setBreakdown(true);
     process = gathered();
-    EXPECT_EQ(regionAt(*process, 0x10000).dirtySize(), 4 * kPage);
-    EXPECT_EQ(regionAt(*process, 0x10000).cleanNonSpecSize(), 3 * kPage);
-    EXPECT_EQ(regionAt(*process, 0x10000).reclaimableSize(), 3 * kPage);
+    EXPECT_EQ(figures(regionAt(*process, 0x10000)), (HTRegionFigures{4 * kPage, 2 * kPage, 3 * kPage, 3 * kPage}));
     EXPECT_EQ(regionAt(*process, 0x40000).cleanNonSpecSize(), 0u);
 }
 
 TEST_F(HTUserProcessTest, RegionsAreNamedByImageFileOrTag)
 {
     HTFakePlatform::Process& script = addTarget();
-    Region text = anonymous(0x400000, 4);
-    text.info.external_pager = 1;
+    auto file = [](uint64_t start, uint64_t pages, std::optional<std::string> path) {
+        Region region = anonymous(start, pages);
+        region.info.external_pager = 1;
+        region.path = std::move(path);
+        return region;
+    };
+    Region text = file(0x400000, 4, "/usr/bin/target");
     text.info.share_mode = SM_COW;
-    text.path = "/usr/bin/target";
-    Region file = anonymous(0x500000, 2);
-    file.info.external_pager = 1;
-    file.path = "/var/data.db";
-    Region pathless = anonymous(0x600000, 2);
-    pathless.info.external_pager = 1;
     Region stack = anonymous(0x700000, 2);
     stack.info.user_tag = 30;
     stack.info.user_wired_count = 1;
     // An older kernel's short record: the 32-bit object id stands in.
     stack.infoCount = VM_REGION_SUBMAP_INFO_COUNT_64 - 2;
     stack.info.object_id = 0x1234;
-    script.regions = {text, file, pathless, stack};
+    script.regions = {text, file(0x500000, 2, "/var/data.db"), file(0x600000, 2, std::nullopt), stack};
     script.images = {{"/usr/bin/target", 0x400000, {{"__TEXT", 0x400000, 4 * kPage}}}};
     platform_->realpaths["/usr/bin/target"] = "/opt/target/bin/target";
 
@@ -183,14 +166,9 @@ TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeR
 {
     setBreakdown(true);
     HTFakePlatform::Process& script = addTarget();
-    Region mapped = anonymous(0x10000, 8, 0x77);
-    mapped.info.pages_resident = 8;
-    mapped.info.pages_dirtied = 8;
-    Region kernelFake = anonymous(0x90000, 2);
+    Region kernelFake = withPages(anonymous(0x90000, 2), 2, 2);
     kernelFake.info.user_tag = HTFakeRegionTag;
-    kernelFake.info.pages_resident = 2;
-    kernelFake.info.pages_dirtied = 2;
-    script.regions = {mapped, kernelFake};
+    script.regions = {withPages(anonymous(0x10000, 8, 0x77), 8, 8), kernelFake};
     script.ownedVmObjects = std::vector<HTFakePlatform::OwnedVmObject>{
         // object, virtual, resident, wired, reusable, compressed, flags
         {0x77, 8 * kPage, 5 * kPage, 0, 1 * kPage, 2 * kPage, 0},
@@ -203,12 +181,8 @@ TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeR
     const auto& regions = process->memoryRegions();
     // The kernel's own fake region gives way to the owned-object list.
     ASSERT_EQ(regions.size(), 4u);
-    const HTMemoryRegion& owned = *regions[0];
-    EXPECT_TRUE(owned.ownedExclusivelyByParentProcess());
-    EXPECT_EQ(owned.dirtySize(), 4 * kPage);
-    EXPECT_EQ(owned.swappedSize(), 2 * kPage);
-    EXPECT_EQ(owned.reclaimableSize(), 1 * kPage);
-    EXPECT_EQ(owned.cleanNonSpecSize(), 0u);
+    EXPECT_TRUE(regions[0]->ownedExclusivelyByParentProcess());
+    EXPECT_EQ(figures(*regions[0]), (HTRegionFigures{4 * kPage, 2 * kPage, 0, kPage}));
 
     // The others, in the kernel's order, as unmapped owned memory.
     const HTMemoryRegion& unmapped = *regions[1];
@@ -216,12 +190,10 @@ TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeR
     EXPECT_EQ(unmapped.name(), "Owned physical heft (unmapped)");
     EXPECT_EQ(unmapped.start(), HTNoAddress);
     EXPECT_EQ(unmapped.size(), 16 * kPage);
-    EXPECT_EQ(unmapped.dirtySize(), 4 * kPage);
-    EXPECT_EQ(unmapped.swappedSize(), 3 * kPage);
+    EXPECT_EQ(figures(unmapped), (HTRegionFigures{4 * kPage, 3 * kPage, 0, 2 * kPage}));
     EXPECT_TRUE(unmapped.wired());
     EXPECT_EQ(regions[2]->object_id(), 0x99u);
-    EXPECT_EQ(regions[2]->dirtySize(), 3 * kPage);
-    EXPECT_EQ(regions[2]->swappedSize(), 0u);
+    EXPECT_EQ(figures(*regions[2]), (HTRegionFigures{3 * kPage, 0, 0, 0}));
     EXPECT_EQ(regions[3]->object_id(), 0xAAu);
     EXPECT_EQ(regions[3]->dirtySize() + regions[3]->swappedSize(), 0u);
     EXPECT_TRUE(process->warnings().empty());
@@ -246,8 +218,7 @@ TEST_F(HTUserProcessTest, OwnedObjectListGrowingBetweenAsksIsReadWhole)
     auto failed = gathered();
     std::string expected = std::string("target [500]: vm.get_owned_vmobjects - ") + std::strerror(EPERM);
     EXPECT_EQ(testing::internal::GetCapturedStderr(), expected + "\n");
-    ASSERT_EQ(failed->warnings().size(), 1u);
-    EXPECT_EQ(failed->warnings()[0], expected);
+    EXPECT_EQ(failed->warnings(), std::vector<std::string>{expected});
 }
 
 TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
@@ -258,19 +229,13 @@ TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
     HTFakePlatform::Process& script = addTarget();
     // Purgeable memory without an owned-object list counts as owned: 4096
     // bytes in all.
-    Region purgeable = anonymous(0x10000, 4);
+    Region purgeable = withPages(anonymous(0x10000, 4), 4, 4);
     purgeable.size = 4 * 1024;
-    purgeable.info.pages_resident = 4;
-    purgeable.info.pages_dirtied = 4;
     purgeable.purgeState = VM_PURGABLE_NONVOLATILE;
-    Region fake = anonymous(0x20000, 1);
+    Region fake = withPages(anonymous(0x20000, 1), 1, 1, 1);
     fake.size = 4 * 1024;
     fake.info.user_tag = HTFakeRegionTag;
-    fake.info.pages_resident = 1;
-    fake.info.pages_dirtied = 1;
-    fake.info.pages_swapped_out = 1;
-    Region after = anonymous(0x30000, 1);
-    script.regions = {purgeable, fake, after};
+    script.regions = {purgeable, fake, anonymous(0x30000, 1)};
 
     auto process = gathered();
     // Only the owned region: the fake one had too little to give, and the
@@ -278,10 +243,9 @@ TEST_F(HTUserProcessTest, HeldFakeRegionGivesUpWhatMappedRegionsCharged)
     ASSERT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->memoryRegions()[0]->ownedExclusivelyByParentProcess());
     EXPECT_EQ(process->memoryRegions()[0]->dirtySize(), 4096u);
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0],
-              "target [500]: Heft changed while analyzing \u2013 unmapped owned physical heft may be over-counted "
-              "by 2048 bytes");
+    EXPECT_EQ(process->warnings(),
+              std::vector<std::string>{"target [500]: Heft changed while analyzing \u2013 unmapped owned physical "
+                                       "heft may be over-counted by 2048 bytes"});
     EXPECT_EQ(platform_->regionLookups, 3);
 }
 
@@ -289,18 +253,12 @@ TEST_F(HTUserProcessTest, HeldFakeRegionWithRoomLeftIsAppendedWithoutAddress)
 {
     setBreakdown(true);
     HTFakePlatform::Process& script = addTarget();
-    Region purgeable = anonymous(0x10000, 1);
-    purgeable.info.pages_resident = 1;
-    purgeable.info.pages_dirtied = 1;
+    Region purgeable = withPages(anonymous(0x10000, 1), 1, 1);
     purgeable.purgeState = VM_PURGABLE_VOLATILE;  // no owned dirty: owned total stays 0
-    Region tagged = anonymous(0x20000, 2);
-    tagged.info.pages_resident = 2;
-    tagged.info.pages_dirtied = 2;
+    Region tagged = withPages(anonymous(0x20000, 2), 2, 2);
     tagged.purgeState = VM_PURGABLE_NONVOLATILE;  // owned: 2 pages
-    Region fake = anonymous(0x30000, 8);
+    Region fake = withPages(anonymous(0x30000, 8), 8, 8);
     fake.info.user_tag = HTFakeRegionTag;
-    fake.info.pages_resident = 8;
-    fake.info.pages_dirtied = 8;
     fake.info.object_id_full = 0;
     fake.info.object_id = 0x5151;
     script.regions = {purgeable, tagged, fake};
@@ -322,7 +280,7 @@ TEST_F(HTUserProcessTest, HeldFakeRegionWithRoomLeftIsAppendedWithoutAddress)
     const HTMemoryRegion& pageTables = *regions[3];
     EXPECT_EQ(pageTables.name(), "page table");
     EXPECT_EQ(pageTables.size(), 5 * kPage);
-    EXPECT_EQ(pageTables.dirtySize(), 5 * kPage);
+    EXPECT_EQ(figures(pageTables), (HTRegionFigures{5 * kPage, 0, 0, 0}));
     EXPECT_EQ(pageTables.start(), HTNoAddress);
     EXPECT_EQ(pageTables.object_id(), 0xFFFFFFFFFFFFFFFFu);
     EXPECT_EQ(pageTables.share_mode(), SM_PRIVATE);
@@ -350,16 +308,14 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     EXPECT_EQ(platform_->machErrors.back(), "mach_vm_region_recurse: process is gone");
     EXPECT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->errors().empty());
-    ASSERT_EQ(process->warnings().size(), 1u);
-    EXPECT_EQ(process->warnings()[0], "target [500]: process is gone (process exited)");
+    EXPECT_EQ(process->warnings(), std::vector<std::string>{"target [500]: process is gone (process exited)"});
 
     script.exited = false;
     script.info.pbi_status = SZOMB;
     testing::internal::CaptureStderr();
     auto zombie = gathered();
     testing::internal::GetCapturedStderr();
-    ASSERT_EQ(zombie->warnings().size(), 1u);
-    EXPECT_EQ(zombie->warnings()[0], "target [500]: process is gone (zombie)");
+    EXPECT_EQ(zombie->warnings(), std::vector<std::string>{"target [500]: process is gone (zombie)"});
 
     // A running process, or another code: an error.
     script.info.pbi_status = SRUN;
@@ -470,10 +426,9 @@ TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem
 
     auto process = gathered();
     // Only the populated runs are queried, a chunk of at most 4096 pages at a time.
-    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
-                                          {start + 10 * kPage, 4096 * kPage},
-                                          {start + 4106 * kPage, 94 * kPage},
-                                          {start + 4201 * kPage, 799 * kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{start + 10 * kPage, 4096 * kPage},
+                                                     {start + 4106 * kPage, 94 * kPage},
+                                                     {start + 4201 * kPage, 799 * kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{10 * kPage, 4190 * kPage, 4190 * kPage, 0, 0, 0, 0},
                                  {4201 * kPage, 799 * kPage, 0, 0, 799 * kPage, 0, 0}}));
@@ -492,8 +447,7 @@ TEST_F(HTUserProcessSubrangeTest, EmptyStretchesOfSparseRegionsAreNotQueried)
     target().dispositions[start + far * kPage] = VM_PAGE_QUERY_PAGE_DIRTY;
 
     auto process = gathered();
-    EXPECT_EQ(platform_->pageQueries, (std::vector<std::pair<uint64_t, uint64_t>>{
-                                          {start + 7 * kPage, kPage}, {start + far * kPage, kPage}}));
+    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{start + 7 * kPage, kPage}, {start + far * kPage, kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{0x1000 + 7 * kPage, kPage, kPage, 0, 0, 0, 0},
                                  {0x1000 + far * kPage, kPage, kPage, 0, 0, 0, 0}}));
