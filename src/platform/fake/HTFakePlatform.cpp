@@ -182,6 +182,7 @@ std::string HTFakePlatform::mach_error_string(kern_return_t code)
 
 void HTFakePlatform::mach_error(const char* label, kern_return_t code)
 {
+    std::lock_guard<std::mutex> guard(recordLock);
     machErrors.push_back(std::string(label) + ": " + mach_error_string(code));
 }
 
@@ -206,7 +207,10 @@ kern_return_t HTFakePlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t*
                                                      uint32_t* depth, vm_region_submap_info_64* info, uint32_t* count)
 {
     if (outOfMemoryInWalk) throw std::bad_alloc();
-    ++regionLookups;
+    {
+        std::lock_guard<std::mutex> guard(recordLock);
+        ++regionLookups;
+    }
     Process* found = process(task.pid());
     if (found == nullptr) return MACH_SEND_INVALID_DEST;
     size_t index = regionIndexAtOrAfter(*found, *address);
@@ -226,7 +230,10 @@ kern_return_t HTFakePlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t*
 kern_return_t HTFakePlatform::mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
                                              vm_region_basic_info_64* info, uint32_t* count)
 {
-    ++basicRegionLookups;
+    {
+        std::lock_guard<std::mutex> guard(recordLock);
+        ++basicRegionLookups;
+    }
     Process* found = process(task.pid());
     if (found == nullptr) return MACH_SEND_INVALID_DEST;
     size_t index = regionIndexAtOrAfter(*found, *address);
@@ -265,7 +272,10 @@ kern_return_t HTFakePlatform::mach_vm_purgable_control(HTTaskPort& task, uint64_
 kern_return_t HTFakePlatform::mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
                                                        int32_t* dispositions, uint64_t* count)
 {
-    pageQueries.emplace_back(address, size);
+    {
+        std::lock_guard<std::mutex> guard(recordLock);
+        pageQueries.emplace_back(address, size);
+    }
     Process* found = process(task.pid());
     if (found == nullptr) return KERN_INVALID_ARGUMENT;
     if (found->pageQueryFailureAddress && *found->pageQueryFailureAddress >= address &&
@@ -347,7 +357,10 @@ int HTFakePlatform::proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* inf
 
 int HTFakePlatform::ledger_template(ledger_template_info* entries, int* count)
 {
-    ++ledgerTemplateReads;
+    {
+        std::lock_guard<std::mutex> guard(recordLock);
+        ++ledgerTemplateReads;
+    }
     if (!ledgerTemplate) {
         errno = ledgerTemplateErrno;
         return -1;

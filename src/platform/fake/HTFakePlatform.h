@@ -11,6 +11,7 @@
 
 #include <cstdint>
 #include <map>
+#include <mutex>
 #include <optional>
 #include <set>
 #include <string>
@@ -119,10 +120,13 @@ public:
     // realpath: the mapped paths; any other path resolves to itself.
     std::map<std::string, std::string> realpaths;
 
-    // Every page query made, as (address, bytes), in call order.
+    // Every page query made, as (address, bytes), in call order. The
+    // records below are written from the gathering threads, under
+    // recordLock.
     std::vector<std::pair<uint64_t, uint64_t>> pageQueries;
     int regionLookups = 0;       // mach_vm_region_recurse calls
     int basicRegionLookups = 0;  // mach_vm_region calls
+    std::mutex recordLock;
 
     int proc_listallpids(int32_t* buffer, int bufferSize) override;
     int proc_pidinfo(int32_t pid, int flavor, uint64_t arg, void* buffer, int bufferSize) override;
