@@ -24,6 +24,8 @@ void HTLinuxTaskPort::parseVmas(std::string_view smaps)
 {
     htParseSmaps(smaps, vmas_);
     zeroPageAnswers_.assign(vmas_.size(), kNotAsked);
+    scanStart_ = scanEnd_ = 0;
+    scannedZeroRuns_.clear();
     hasParsedVmas_ = true;
 }
 
@@ -31,6 +33,8 @@ void HTLinuxTaskPort::clearVmas()
 {
     vmas_.clear();
     zeroPageAnswers_.clear();
+    scanStart_ = scanEnd_ = 0;
+    scannedZeroRuns_.clear();
     hasParsedVmas_ = false;
 }
 
@@ -39,6 +43,7 @@ void HTLinuxTaskPort::releaseVmas()
     clearVmas();
     vmas_.shrink_to_fit();
     zeroPageAnswers_.shrink_to_fit();
+    scannedZeroRuns_.shrink_to_fit();
 }
 
 const HTSmapsEntry* HTLinuxTaskPort::vmaAtOrAbove(uint64_t address) const
@@ -79,4 +84,35 @@ std::optional<bool> HTLinuxTaskPort::mayMapZeroPage(size_t index)
     }
     if (answer == kUnknown) return std::nullopt;
     return answer == kZeroPage;
+}
+
+void HTLinuxTaskPort::noteScan(uint64_t start, uint64_t end, const std::vector<HTPagemapRun>& runs)
+{
+    scanStart_ = start;
+    scanEnd_ = end;
+    scannedZeroRuns_.clear();
+    for (const HTPagemapRun& run : runs)
+        if (run.zeroPage) scannedZeroRuns_.emplace_back(run.start, run.end);
+    // A huge page entry may map the huge zero page, which kernels have not
+    // always reported as a zero page.
+    auto run = runs.begin();
+    for (auto vma = std::partition_point(vmas_.begin(), vmas_.end(),
+                                         [start](const HTSmapsEntry& entry) { return entry.start < start; });
+         vma != vmas_.end() && vma->end <= end; ++vma) {
+        while (run != runs.end() && run->end <= vma->start) ++run;
+        bool mayHoldZero = false;
+        for (auto inside = run; inside != runs.end() && inside->start < vma->end; ++inside)
+            mayHoldZero = mayHoldZero || inside->zeroPage || inside->huge;
+        zeroPageAnswers_[static_cast<size_t>(vma - vmas_.begin())] = mayHoldZero ? kZeroPage : kNoZeroPage;
+    }
+}
+
+bool HTLinuxTaskPort::zeroPageRunsFromScan(uint64_t from, uint64_t to,
+                                           std::vector<std::pair<uint64_t, uint64_t>>& runs) const
+{
+    if (from < scanStart_ || to > scanEnd_) return false;
+    runs.clear();
+    for (const auto& [start, end] : scannedZeroRuns_)
+        if (start < to && end > from) runs.emplace_back(std::max(start, from), std::min(end, to));
+    return true;
 }

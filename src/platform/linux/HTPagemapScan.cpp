@@ -58,9 +58,11 @@ std::optional<uint64_t> firstPageWithAny(int pagemapFd, uint64_t start, uint64_t
 
 // Calls `found(start, end, categories)` for the runs of pages in
 // [start, end) that have all of `required` and any of `anyOf`, in address
-// order. False when the kernel does not offer the scan or it fails.
+// order; runs are told apart by those categories and by `alsoReturned`.
+// False when the kernel does not offer the scan or it fails.
 template <typename Found>
-bool scanRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf, Found found)
+bool scanRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf, uint64_t alsoReturned,
+              Found found)
 {
     PageRegion regions[256];
     while (start < end) {
@@ -72,7 +74,7 @@ bool scanRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, ui
         arg.vec_len = sizeof(regions) / sizeof(regions[0]);
         arg.category_mask = required;
         arg.category_anyof_mask = anyOf;
-        arg.return_mask = required | anyOf;
+        arg.return_mask = required | anyOf | alsoReturned;
         long count = ::ioctl(pagemapFd, kPagemapScan, &arg);
         if (count < 0) return false;
         for (long i = 0; i < count; ++i) found(regions[i].start, regions[i].end, regions[i].categories);
@@ -97,20 +99,23 @@ bool htPagemapZeroPageRuns(int pagemapFd, uint64_t start, uint64_t end,
                            std::vector<std::pair<uint64_t, uint64_t>>& runs)
 {
     runs.clear();
-    return scanRuns(pagemapFd, start, end, kPageIsZeroFrame, 0,
+    return scanRuns(pagemapFd, start, end, kPageIsZeroFrame, 0, 0,
                     [&](uint64_t from, uint64_t to, uint64_t) { runs.emplace_back(from, to); });
 }
 
 bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end, std::vector<HTPagemapRun>& runs)
 {
     runs.clear();
-    return scanRuns(pagemapFd, start, end, 0, kPageIsPresent | kPageIsSwapped,
+    return scanRuns(pagemapFd, start, end, 0, kPageIsPresent | kPageIsSwapped, kPageIsZeroFrame | kPageIsHuge,
                     [&](uint64_t from, uint64_t to, uint64_t categories) {
-                        const bool swapped = (categories & kPageIsSwapped) != 0;
+                        const HTPagemapRun run{from, to, (categories & kPageIsSwapped) != 0,
+                                               (categories & kPageIsZeroFrame) != 0, (categories & kPageIsHuge) != 0};
                         // A walk cut short by a full vector goes on where it stopped.
-                        if (!runs.empty() && runs.back().end == from && runs.back().swapped == swapped)
-                            runs.back().end = to;
+                        HTPagemapRun* last = runs.empty() ? nullptr : &runs.back();
+                        if (last && last->end == from && last->swapped == run.swapped &&
+                            last->zeroPage == run.zeroPage && last->huge == run.huge)
+                            last->end = to;
                         else
-                            runs.push_back(HTPagemapRun{from, to, swapped});
+                            runs.push_back(run);
                     });
 }

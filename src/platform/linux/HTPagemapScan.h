@@ -5,19 +5,25 @@
 #include <utility>
 #include <vector>
 
-// A run [start, end) of resident pages, or of pages swapped out.
+// A run [start, end) of resident pages, or of pages swapped out, all of one
+// kind: zero pages (the shared zero page), pages mapped by a huge page
+// entry, or neither.
 struct HTPagemapRun {
     uint64_t start;
     uint64_t end;
     bool swapped;
+    bool zeroPage = false;
+    bool huge = false;
 };
 
 // Asks the kernel, through the pagemap's scan request, for the runs of
 // pages in [start, end) that are resident or swapped out, in address order,
 // into `runs`. The kernel walks its page tables and steps over empty
 // stretches whole, so a terabyte-sized sparse reservation costs what its
-// populated pages cost, not one entry per page. False when the kernel does
-// not offer the request (kernels before 6.7) or it fails.
+// populated pages cost, not one entry per page. The same walk says which
+// pages are zero pages or huge, so that nothing else need walk the range
+// again for them. False when the kernel does not offer the request
+// (kernels before 6.7) or it fails.
 bool htPagemapPopulatedRuns(int pagemapFd, uint64_t start, uint64_t end, std::vector<HTPagemapRun>& runs);
 
 // Whether any page in [start, end) may be a zero page: the shared zero
