@@ -1,5 +1,6 @@
 #include "platform/linux/HTElfImageReader.h"
-#include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTSmapsParser.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/HTTestChildren.h"
 
@@ -115,18 +116,16 @@ std::string temporaryFile(const std::string& bytes, int& fd)
     return pattern;
 }
 
-std::shared_ptr<HTLinuxTaskPort> openTask(pid_t pid)
+std::shared_ptr<HTTaskPort> openTask(HTLinuxPlatform& platform, pid_t pid)
 {
-    std::string directory = "/proc/" + std::to_string(pid);
-    int dirfd = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dirfd < 0) return nullptr;
-    return std::make_shared<HTLinuxTaskPort>(pid, dirfd);
+    std::shared_ptr<HTTaskPort> task;
+    return platform.task_for_pid(pid, &task) == KERN_SUCCESS ? task : nullptr;
 }
 
-std::vector<HTPlatformImage> listImages(HTElfImageReader& reader, HTLinuxTaskPort& task)
+std::vector<HTPlatformImage> listImages(HTLinuxPlatform& platform, HTTaskPort& task)
 {
     std::vector<HTPlatformImage> images;
-    EXPECT_TRUE(reader.forEachTaskImage(task, [&](const HTPlatformImage& image) { images.push_back(image); }));
+    EXPECT_TRUE(platform.forEachTaskImage(task, 0, [&](const HTPlatformImage& image) { images.push_back(image); }));
     return images;
 }
 
@@ -169,28 +168,24 @@ std::string segmentAt(const HTPlatformImage& image, uint64_t address)
 // read-only first page in __LINKEDIT.
 void expectMappingsMatchSegments(pid_t pid, const std::vector<HTPlatformImage>& images)
 {
-    HTProcBuffer maps;
-    ASSERT_TRUE(maps.readFile(AT_FDCWD, ("/proc/" + std::to_string(pid) + "/maps").c_str()));
-    std::string_view text = maps.view();
+    HTProcBuffer smaps;
+    ASSERT_TRUE(smaps.readFile(AT_FDCWD, ("/proc/" + std::to_string(pid) + "/smaps").c_str()));
+    std::vector<HTSmapsEntry> mappings;
+    htParseSmaps(smaps.view(), mappings);
     int checked = 0;
-    while (!text.empty()) {
-        size_t end = text.find('\n');
-        std::string_view line = text.substr(0, end);
-        text = end == std::string_view::npos ? std::string_view() : text.substr(end + 1);
-        HTMapsLine mapping;
-        ASSERT_TRUE(HTElfImageReader::parseMapsLine(line, mapping)) << line;
+    for (const HTSmapsEntry& mapping : mappings) {
         for (const auto& image : images) {
             if (image.path != mapping.path) continue;
             std::string first = segmentAt(image, mapping.start);
             std::string last = segmentAt(image, mapping.end - 1);
             if (first.empty()) continue;  // another load of the same file
-            EXPECT_EQ(first, last) << line;
-            if (mapping.perms.substr(0, 3) == "r-x") {
-                EXPECT_EQ(first, "__TEXT") << line;
-            } else if (mapping.perms.substr(0, 3) == "rw-") {
-                EXPECT_EQ(first, "__DATA") << line;
+            EXPECT_EQ(first, last) << mapping.path << " at " << mapping.start;
+            if (mapping.protection == (VM_PROT_READ | VM_PROT_EXECUTE)) {
+                EXPECT_EQ(first, "__TEXT") << mapping.start;
+            } else if (mapping.protection == (VM_PROT_READ | VM_PROT_WRITE)) {
+                EXPECT_EQ(first, "__DATA") << mapping.start;
             } else if (mapping.offset == 0) {
-                EXPECT_EQ(first, "__LINKEDIT") << line;
+                EXPECT_EQ(first, "__LINKEDIT") << mapping.start;
             }
             checked++;
         }
@@ -265,10 +260,10 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
 
 TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
 {
-    auto task = openTask(::getpid());
+    HTLinuxPlatform platform;
+    auto task = openTask(platform, ::getpid());
     ASSERT_NE(task, nullptr);
-    HTElfImageReader reader;
-    auto images = listImages(reader, *task);
+    auto images = listImages(platform, *task);
 
     const HTPlatformImage* self = imageWithPath(images, "/proc/self/exe");
     ASSERT_NE(self, nullptr);
@@ -294,16 +289,16 @@ TEST(HTElfImageReader, ListsAChildProcess)
 {
     HTTestChild child = HTTestChild::exec("/bin/sleep", {"sleep", "30"});
     ASSERT_TRUE(child.valid());
-    auto task = openTask(child.pid());
+    HTLinuxPlatform platform;
+    auto task = openTask(platform, child.pid());
     ASSERT_NE(task, nullptr);
-    HTElfImageReader reader;
     // exec has returned; the dynamic loader may still be mapping libraries
     // and protecting their relocated data. Once the child sleeps, its
     // mappings stay as they are.
     auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
     while (processState(child.pid()) != 'S' && std::chrono::steady_clock::now() < deadline)
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    std::vector<HTPlatformImage> images = listImages(reader, *task);
+    std::vector<HTPlatformImage> images = listImages(platform, *task);
     const HTPlatformImage* sleep = imageWithPath(images, "/bin/sleep");
     ASSERT_NE(sleep, nullptr);
     EXPECT_EQ(segmentAt(*sleep, sleep->baseAddress), "__LINKEDIT");
@@ -311,7 +306,7 @@ TEST(HTElfImageReader, ListsAChildProcess)
 
     child.reap();
     errno = 0;
-    EXPECT_FALSE(reader.forEachTaskImage(*task, [](const HTPlatformImage&) {}));
+    EXPECT_FALSE(platform.forEachTaskImage(*task, 0, [](const HTPlatformImage&) {}));
     EXPECT_NE(errno, 0);
 }
 
@@ -333,10 +328,10 @@ TEST(HTElfImageReader, MappedFilesGiveImagesOnlyWhenTheyAreElf)
     ASSERT_NE(area, MAP_FAILED);
     ASSERT_NE(dataMap, MAP_FAILED);
 
-    auto task = openTask(::getpid());
+    HTLinuxPlatform platform;
+    auto task = openTask(platform, ::getpid());
     ASSERT_NE(task, nullptr);
-    HTElfImageReader reader;
-    auto images = listImages(reader, *task);
+    auto images = listImages(platform, *task);
     const HTPlatformImage* object = imageWithPath(images, elfPath);
     EXPECT_EQ(imageWithPath(images, textPath), nullptr);
     ::unlink(textPath.c_str());

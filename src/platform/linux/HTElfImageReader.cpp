@@ -1,7 +1,5 @@
 #include "platform/linux/HTElfImageReader.h"
 
-#include "platform/linux/HTLinuxTaskPort.h"
-#include "platform/linux/HTProcBuffer.h"
 
 #include <algorithm>
 #include <cerrno>
@@ -148,7 +146,7 @@ HTElfImageReader::ReadResult readLayoutOf(int fd, const unsigned char* headerByt
 // from its root, else the path as we see it. Only regular files are opened:
 // opening a device node can have effects of its own. -1 when none opens;
 // *notRegular is set when the mapped file is known not to be a regular file.
-int openMappedFile(int procDirFd, const HTMapsLine& mapping, bool* notRegular)
+int openMappedFile(int procDirFd, const HTSmapsEntry& mapping, bool* notRegular)
 {
     *notRegular = false;
     char mapFile[64];
@@ -164,11 +162,8 @@ int openMappedFile(int procDirFd, const HTMapsLine& mapping, bool* notRegular)
         if (fd >= 0) return fd;
     }
     // A deleted file's path names nothing, or some other file.
-    constexpr std::string_view deleted = " (deleted)";
-    if (mapping.path.size() >= deleted.size() && mapping.path.substr(mapping.path.size() - deleted.size()) == deleted) {
-        return -1;
-    }
-    std::string path(mapping.path);
+    if (htSmapsPathWithoutDeleted(mapping.path).size() != mapping.path.size()) return -1;
+    const std::string& path = mapping.path;
     std::string rootPath = "root" + path;
     const std::pair<int, const char*> candidates[] = {{procDirFd, rootPath.c_str()}, {AT_FDCWD, path.c_str()}};
     for (const auto& [dirfd, name] : candidates) {
@@ -183,51 +178,12 @@ int openMappedFile(int procDirFd, const HTMapsLine& mapping, bool* notRegular)
     return -1;
 }
 
-template <class T>
-bool parseNumber(std::string_view text, size_t& position, int base, T& value)
-{
-    const char* first = text.data() + position;
-    auto [end, error] = std::from_chars(first, text.data() + text.size(), value, base);
-    if (error != std::errc() || end == first) return false;
-    position += static_cast<size_t>(end - first);
-    return true;
-}
-
-bool expect(std::string_view text, size_t& position, char c)
-{
-    if (position >= text.size() || text[position] != c) return false;
-    position++;
-    return true;
-}
-
 }  // namespace
 
 HTElfImageReader::HTElfImageReader()
 {
     long size = ::sysconf(_SC_PAGESIZE);
     pageSize_ = size > 0 ? static_cast<uint64_t>(size) : 4096;
-}
-
-bool HTElfImageReader::parseMapsLine(std::string_view line, HTMapsLine& out)
-{
-    size_t position = 0;
-    if (!parseNumber(line, position, 16, out.start) || !expect(line, position, '-') ||
-        !parseNumber(line, position, 16, out.end) || !expect(line, position, ' ')) {
-        return false;
-    }
-    size_t permsEnd = line.find(' ', position);
-    if (permsEnd == std::string_view::npos) return false;
-    out.perms = line.substr(position, permsEnd - position);
-    position = permsEnd + 1;
-    if (!parseNumber(line, position, 16, out.offset) || !expect(line, position, ' ') ||
-        !parseNumber(line, position, 16, out.devMajor) || !expect(line, position, ':') ||
-        !parseNumber(line, position, 16, out.devMinor) || !expect(line, position, ' ') ||
-        !parseNumber(line, position, 10, out.inode)) {
-        return false;
-    }
-    while (position < line.size() && line[position] == ' ') position++;
-    out.path = line.substr(position);
-    return true;
 }
 
 HTElfImageReader::ReadResult HTElfImageReader::readLayout(int fd, uint64_t pageSize,
@@ -267,7 +223,7 @@ bool HTElfImageReader::biasForMapping(const Layout& layout, uint64_t mapStart, u
 }
 
 std::shared_ptr<const HTElfImageReader::Layout> HTElfImageReader::layoutForMapping(int procDirFd,
-                                                                                 const HTMapsLine& mapping)
+                                                                                 const HTSmapsEntry& mapping)
 {
     FileKey key{(uint64_t(mapping.devMajor) << 32) | mapping.devMinor, mapping.inode};
     {
@@ -293,28 +249,16 @@ std::shared_ptr<const HTElfImageReader::Layout> HTElfImageReader::layoutForMappi
     return cache_.emplace(key, std::move(layout)).first->second;
 }
 
-bool HTElfImageReader::forEachTaskImage(HTLinuxTaskPort& task,
+void HTElfImageReader::forEachTaskImage(int procDirFd, const std::vector<HTSmapsEntry>& mappings,
                                         const std::function<void(const HTPlatformImage&)>& callback)
 {
-    // One buffer a gathering thread, kept from process to process.
-    thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(task.procDirFd(), "maps")) return false;
-
     struct Placed {
         FileKey key;
         uint64_t low;
         uint64_t high;
     };
     std::vector<Placed> placed;
-    std::vector<HTPlatformImage> images;
-    std::string_view maps = buffer.view();
-    while (!maps.empty()) {
-        size_t lineEnd = maps.find('\n');
-        std::string_view line = maps.substr(0, lineEnd);
-        maps = lineEnd == std::string_view::npos ? std::string_view() : maps.substr(lineEnd + 1);
-
-        HTMapsLine mapping;
-        if (!parseMapsLine(line, mapping)) continue;
+    for (const HTSmapsEntry& mapping : mappings) {
         if (mapping.inode == 0 || mapping.path.empty() || mapping.path[0] != '/') continue;
         FileKey key{(uint64_t(mapping.devMajor) << 32) | mapping.devMinor, mapping.inode};
         // The further mappings of an object already placed.
@@ -323,24 +267,20 @@ bool HTElfImageReader::forEachTaskImage(HTLinuxTaskPort& task,
         });
         if (known) continue;
 
-        std::shared_ptr<const Layout> layout = layoutForMapping(task.procDirFd(), mapping);
+        std::shared_ptr<const Layout> layout = layoutForMapping(procDirFd, mapping);
         if (!layout) continue;
-        bool executable = mapping.perms.size() >= 3 && mapping.perms[2] == 'x';
+        bool executable = (mapping.protection & VM_PROT_EXECUTE) != 0;
         uint64_t bias;
         if (!biasForMapping(*layout, mapping.start, mapping.offset, executable, pageSize_, &bias)) continue;
 
         HTPlatformImage image;
-        image.path = std::string(mapping.path);
+        image.path = mapping.path;
         image.baseAddress = bias + layout->lowestAddress;
         image.segments.reserve(layout->segments.size());
         for (const Layout::Segment& segment : layout->segments) {
             image.segments.push_back({segment.name, bias + segment.start, segment.end - segment.start});
         }
         placed.push_back({key, bias + layout->low, bias + layout->high});
-        images.push_back(std::move(image));
+        callback(image);
     }
-    // Called once the maps are parsed, so that a callback may itself list
-    // another task's images on this thread.
-    for (const HTPlatformImage& image : images) callback(image);
-    return true;
 }

@@ -12,7 +12,7 @@
 //     relocation (PT_GNU_RELRO)                  "__DATA_CONST"
 //   writable, the rest (data and bss)            "__DATA"
 //
-// The objects come from /proc/PID/maps: every mapping of a regular file
+// The objects come from the process's mappings: every mapping of a regular file
 // that begins with an ELF header. A file's layout is read once per run and
 // kept by (device, inode), since all processes map the same libraries;
 // what differs from process to process is only where the object was
@@ -21,28 +21,15 @@
 // Safe to call from several threads at once.
 
 #include "platform/HTPlatform.h"
+#include "platform/linux/HTSmapsParser.h"
 
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <mutex>
-#include <string_view>
 #include <unordered_map>
 #include <vector>
 
-class HTLinuxTaskPort;
-
-// One line of /proc/PID/maps. The views point into the line.
-struct HTMapsLine {
-    uint64_t start = 0;
-    uint64_t end = 0;
-    std::string_view perms;
-    uint64_t offset = 0;
-    uint32_t devMajor = 0;
-    uint32_t devMinor = 0;
-    uint64_t inode = 0;
-    std::string_view path;
-};
 
 class HTElfImageReader {
 public:
@@ -73,13 +60,13 @@ public:
     HTElfImageReader(const HTElfImageReader&) = delete;
     HTElfImageReader& operator=(const HTElfImageReader&) = delete;
 
-    // Calls `callback` once per ELF object mapped by the task, in address
-    // order. False with errno set when the task's maps cannot be read.
-    bool forEachTaskImage(HTLinuxTaskPort& task, const std::function<void(const HTPlatformImage&)>& callback);
+    // Calls `callback` once per ELF object among a process's mappings (as
+    // its smaps lists them), in address order; the files are opened
+    // through the process's /proc directory.
+    void forEachTaskImage(int procDirFd, const std::vector<HTSmapsEntry>& mappings,
+                          const std::function<void(const HTPlatformImage&)>& callback);
 
     // --- the pieces, pure enough to test on their own ---------------------
-    // Parses one maps line (without its line feed); false when malformed.
-    static bool parseMapsLine(std::string_view line, HTMapsLine& out);
     // Reads the ELF and program headers of an open file. Image: *layout is
     // set; NotImage: not an ELF executable or shared object, or headers cut
     // short; Unreadable: the read itself failed.
@@ -102,7 +89,7 @@ private:
 
     // The layout of the file of a mapping, from the cache or read now; null
     // when it is no image or cannot be read.
-    std::shared_ptr<const Layout> layoutForMapping(int procDirFd, const HTMapsLine& mapping);
+    std::shared_ptr<const Layout> layoutForMapping(int procDirFd, const HTSmapsEntry& mapping);
 
     uint64_t pageSize_;
     std::mutex cacheMutex_;

@@ -635,8 +635,9 @@ kern_return_t HTLinuxPlatform::vmaAtOrAbove(HTTaskPort& task, uint64_t address, 
 {
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
     if (linuxTask == nullptr) return KERN_INVALID_ARGUMENT;
-    // A walk starts at address 0: that is when the mappings are read anew.
-    kern_return_t loaded = loadVmas(*linuxTask, address == 0);
+    // A walk starts at address 0: that is when the mappings are read anew,
+    // unless the image listing has just read them for this walk.
+    kern_return_t loaded = loadVmas(*linuxTask, address == 0 && !linuxTask->takeVmasKeptForWalk());
     if (loaded != KERN_SUCCESS) return loaded;
     *vma = linuxTask->vmaAtOrAbove(address);
     if (*vma != nullptr) return KERN_SUCCESS;
@@ -841,7 +842,22 @@ std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path)
 bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
                                        const std::function<void(const HTPlatformImage&)>& callback)
 {
-    return imageReader_.forEachTaskImage(static_cast<HTLinuxTaskPort&>(task), callback);
+    auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(&task);
+    if (linuxTask == nullptr) {
+        errno = EINVAL;
+        return false;
+    }
+    // The images are found among the mappings of the process's smaps, and
+    // the walk of its address space that follows takes the same reading:
+    // one pass of the kernel over the process's page tables serves both.
+    kern_return_t loaded = loadVmas(*linuxTask, true);
+    if (loaded != KERN_SUCCESS) {
+        errno = loaded == MACH_SEND_INVALID_DEST ? ESRCH : loaded & ~HT_KERN_ERRNO_BASE;
+        return false;
+    }
+    linuxTask->keepVmasForNextWalk();
+    imageReader_.forEachTaskImage(linuxTask->procDirFd(), linuxTask->vmas(), callback);
+    return true;
 }
 
 void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)
@@ -855,6 +871,7 @@ void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t e
         runs.assign(1, HTPageRun{start, end, 0});
         return;
     }
+    linuxTask->noteScan(start, end, scanned);
     runs.clear();
     const std::vector<HTSmapsEntry>& vmas = linuxTask->vmas();
     const HTSmapsEntry* vma = linuxTask->vmaAtOrAbove(start);
@@ -936,7 +953,8 @@ kern_return_t HTLinuxPlatform::identifyPages(HTLinuxTaskPort& task, size_t index
     // a kernel without the scan is asked page by page.
     thread_local std::vector<std::pair<uint64_t, uint64_t>> zeroRuns;
     const bool checkZero = task.mayMapZeroPage(index) != false;
-    const bool zeroRunsKnown = checkZero && htPagemapZeroPageRuns(pagemap, from, to, zeroRuns);
+    const bool zeroRunsKnown = checkZero && (task.zeroPageRunsFromScan(from, to, zeroRuns) ||
+                                             htPagemapZeroPageRuns(pagemap, from, to, zeroRuns));
     HTRunCursor zeroPages(zeroRuns);
 
     thread_local std::array<uint64_t, HTPageQueryChunk::kPages> ownEntries;
