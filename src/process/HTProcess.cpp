@@ -52,14 +52,23 @@ std::optional<std::vector<proc_bsdinfo>> listAllProcesses(HTPlatform& platform)
     int delivered = platform.proc_listallpids(pids.data(), static_cast<int>(pids.size() * sizeof(int32_t)));
     if (delivered < 0) return std::nullopt;
 
-    std::vector<proc_bsdinfo> records;
-    records.reserve(static_cast<size_t>(delivered));
-    for (int i = 0; i < delivered; ++i) {
-        proc_bsdinfo info{};
-        // Processes that exited in between drop out here.
-        if (platform.proc_pidinfo(pids[i], PROC_PIDTBSDINFO, 0, &info, sizeof(info)) == sizeof(info))
-            records.push_back(info);
+    // Each record is a read of the process's own files: thousands of them
+    // are read side by side, and kept in the order of the list.
+    const size_t listed = static_cast<size_t>(std::max(delivered, 0));
+    std::vector<proc_bsdinfo> records(listed);
+    std::vector<char> found(listed, 0);
+    {
+        HTWorkQueue queue(HTProcess::kSetupQueueLabel, setupThreadCount(listed));
+        queue.parallelFor(listed, [&](size_t index) {
+            found[index] = platform.proc_pidinfo(pids[index], PROC_PIDTBSDINFO, 0, &records[index],
+                                                 sizeof(proc_bsdinfo)) == sizeof(proc_bsdinfo);
+        });
     }
+    // Processes that exited in between drop out here.
+    size_t kept = 0;
+    for (size_t index = 0; index < listed; ++index)
+        if (found[index]) records[kept++] = records[index];
+    records.resize(kept);
     if (records.empty()) return std::nullopt;
     return records;
 }
