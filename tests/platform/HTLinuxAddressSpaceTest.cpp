@@ -314,8 +314,14 @@ TEST_F(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
     kern_return_t result;
     walk(platform_, *task, result);
     const auto start = reinterpret_cast<uint64_t>(aligned);
+    // Asked alone, and after a scan of the mapping's populated pages, which
+    // answers whether the mapping holds zero pages on its way.
     std::vector<int32_t> answers = dispositions(platform_, *task, start, pages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
+    std::vector<HTPageRun> runs;
+    platform_.populatedRuns(*task, reinterpret_cast<uint64_t>(base), reinterpret_cast<uint64_t>(base) + 3 * kHuge,
+                            runs);
+    EXPECT_EQ(dispositions(platform_, *task, start, pages, result), answers);
 
     int pagemap = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
     int kpageflags = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
