@@ -168,6 +168,24 @@ uint32_t HTSharedPageResolver::candidateOfOrdinal(uint32_t ordinal, uint32_t hin
     return static_cast<uint32_t>(after - candidates_.begin()) - 1;
 }
 
+uint32_t HTSharedPageResolver::stretchOfPages(uint32_t ordinal, uint32_t limit, uint32_t firstMapping) const
+{
+    const PageSet& first = pages_[ordinal];
+    // An object's pages stay together only while they come from one region
+    // of its first process.
+    const uint32_t regionEnd =
+        firstMapping + 1 < candidates_.size() ? candidates_[firstMapping + 1].firstOrdinal : UINT32_MAX;
+    uint32_t length = 1;
+    while (length < limit) {
+        const PageSet& next = pages_[ordinal + length];
+        if (next.set != first.set) break;
+        if (first.set != 0 && (next.firstOrdinal != first.firstOrdinal + length || next.firstOrdinal >= regionEnd))
+            break;
+        ++length;
+    }
+    return length;
+}
+
 void HTSharedPageResolver::cutRegions()
 {
     size_t next = 0;
@@ -258,24 +276,30 @@ void HTSharedPageResolver::cutRegion(const Candidate& candidate, std::vector<std
     uint32_t firstMapping = 0;
     uint32_t ordinal = candidate.firstOrdinal;
     for (const HTSharedPageList::Run& run : list->runs()) {
-        for (uint32_t i = 0; i < run.count; ++i) {
+        const bool identified = run.firstIdentity != HTSharedPageList::kNoIdentity;
+        for (uint32_t i = 0; i < run.count;) {
             const uint64_t index = uint64_t{run.firstPage} + i;
-            if (run.firstIdentity != HTSharedPageList::kNoIdentity) {
-                const PageSet& entry = pages_[ordinal++];
-                if (entry.set != 0) {
-                    // The object's pages lie in the order the first process
-                    // maps them: the same place in every process's piece.
-                    firstMapping = candidateOfOrdinal(entry.firstOrdinal, firstMapping);
-                    const uint64_t offset = uint64_t{entry.firstOrdinal} * page;
-                    const uint64_t address = region.start() + index * page;
-                    Piece& piece = pieceFor(sharedObjectId(entry.set, firstMapping), address, offset);
-                    piece.runs->add(offset, run.kind);
-                    addTotals(piece.totals, htTotalsForPageKind(run.kind, page, false));
-                    ++piece.pages;
-                    continue;
-                }
+            const PageSet* entry = identified ? &pages_[ordinal] : nullptr;
+            if (entry != nullptr && entry->set != 0)
+                firstMapping = candidateOfOrdinal(entry->firstOrdinal, firstMapping);
+            // The stretch of pages from here that go to one place, taken
+            // whole: the region's own, or one object's consecutive pages.
+            const uint32_t length = identified ? stretchOfPages(ordinal, run.count - i, firstMapping) : run.count - i;
+            const uint64_t bytes = uint64_t{length} * page;
+            if (entry != nullptr && entry->set != 0) {
+                // The object's pages lie in the order the first process
+                // maps them: the same place in every process's piece.
+                const uint64_t offset = uint64_t{entry->firstOrdinal} * page;
+                const uint64_t address = region.start() + index * page;
+                Piece& piece = pieceFor(sharedObjectId(entry->set, firstMapping), address, offset);
+                piece.runs->addRun(offset, bytes, run.kind);
+                addTotals(piece.totals, htTotalsForPageKind(run.kind, bytes, false));
+                piece.pages += length;
+            } else {
+                own.addRun(region.offset() + index * page, bytes, run.kind);
             }
-            own.add(region.offset() + index * page, run.kind);
+            if (identified) ordinal += length;
+            i += length;
         }
     }
     own.flush();

@@ -66,6 +66,10 @@ private:
     void registerPages();
     void cutRegions();
     void cutRegion(const Candidate& candidate, std::vector<std::shared_ptr<HTMemoryRegion>>& pieces);
+    // How many pages from the one numbered `ordinal` (at most `limit`) go
+    // where it goes: pages one process alone maps, or the next pages of
+    // the same object, laid out after it in the region `firstMapping`.
+    uint32_t stretchOfPages(uint32_t ordinal, uint32_t limit, uint32_t firstMapping) const;
     // The candidate whose pages got the number; `hint` is tried first.
     uint32_t candidateOfOrdinal(uint32_t ordinal, uint32_t hint) const;
 

@@ -25,24 +25,30 @@ class HTSharedPageResolverTest : public HTAnalysisTest {
 protected:
     ~HTSharedPageResolverTest() override { HTHeft::setSharingAnalysisDisabled(false); }
 
-    // A private anonymous mapping of `identities.size()` written pages at
-    // kStart; a page's identity is 0 when only its process maps it.
-    void addForkedProcess(int32_t pid, const std::vector<uint64_t>& identities)
+    // Private anonymous mappings of `identities.size()` written pages from
+    // kStart, `regionPages` pages a mapping (all in one when 0), with a page
+    // of gap between them; a page's identity is 0 when only its process
+    // maps it.
+    void addForkedProcess(int32_t pid, const std::vector<uint64_t>& identities, size_t regionPages = 0)
     {
         HTFakePlatform::Process& process = platform_->addProcess(pid, kParent, "worker");
-        HTFakePlatform::Region region;
-        region.start = kStart;
-        region.size = identities.size() * kPage;
-        region.info.protection = VM_PROT_READ | VM_PROT_WRITE;
-        region.info.share_mode = SM_COW;
-        region.info.ref_count = 2;
-        region.info.pages_resident = static_cast<uint32_t>(identities.size());
-        region.info.pages_dirtied = static_cast<uint32_t>(identities.size());
-        region.info.object_id_full = 0x4000000000000000 | static_cast<uint64_t>(pid);
-        process.regions.push_back(region);
-        for (size_t i = 0; i < identities.size(); ++i) {
-            process.dispositions[kStart + i * kPage] = kDirtyPage;
-            if (identities[i] != 0) process.pageIdentities[kStart + i * kPage] = identities[i];
+        if (regionPages == 0) regionPages = identities.size();
+        for (size_t first = 0; first < identities.size(); first += regionPages) {
+            const size_t pages = std::min(regionPages, identities.size() - first);
+            HTFakePlatform::Region region;
+            region.start = kStart + first / regionPages * (regionPages + 1) * kPage;
+            region.size = pages * kPage;
+            region.info.protection = VM_PROT_READ | VM_PROT_WRITE;
+            region.info.share_mode = SM_COW;
+            region.info.ref_count = 2;
+            region.info.pages_resident = static_cast<uint32_t>(pages);
+            region.info.pages_dirtied = static_cast<uint32_t>(pages);
+            region.info.object_id_full = 0x4000000000000000 | static_cast<uint64_t>(pid) << 8 | first;
+            process.regions.push_back(region);
+            for (size_t i = 0; i < pages; ++i) {
+                process.dispositions[region.start + i * kPage] = kDirtyPage;
+                if (identities[first + i] != 0) process.pageIdentities[region.start + i * kPage] = identities[first + i];
+            }
         }
     }
 
@@ -117,6 +123,21 @@ TEST_F(HTSharedPageResolverTest, PagesCountOnceAndShowWithExactlyTheirMappers)
     EXPECT_EQ(regions[1]->start(), kStart);
     EXPECT_EQ(regions[1]->sharedPageList(), nullptr);
     EXPECT_EQ(regions[0]->sharedPageList(), nullptr);
+}
+
+TEST_F(HTSharedPageResolverTest, PagesMappedInAnotherOrderCountOnce)
+{
+    setBreakdown(true);
+    // The child maps the parent's shared pages in another order, and runs
+    // of them across the parent's two mappings: 2 and 4 lie apart in the
+    // parent, 3 and 6 at the end of one of its mappings and the start of
+    // the next. The parent's 1 and 5 are its own.
+    addForkedProcess(kParent, {1, 2, 5, 3, 6, 4}, 4);
+    addForkedProcess(kFirstChild, {2, 4, 3, 6});
+    HTHeft::ProcessList processes = created({kParent, kFirstChild});
+    auto heft = gathered(processes);
+    EXPECT_EQ(summaryDirty(*heft), 6 * kPage);
+    EXPECT_EQ(*heft->pidToHeft().find(kFirstChild), 4 * kPage);
 }
 
 TEST_F(HTSharedPageResolverTest, WithoutIdentitiesEachProcessKeepsItsOwnCopy)
