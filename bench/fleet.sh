@@ -71,7 +71,8 @@ if [[ ! -e $work/ready ]]; then
     exit 1
 fi
 fleet=$(wc -l < "$work/pids")
-all=$(ls -d /proc/[0-9]* | wc -l)
+# Processes may come and go while they are counted.
+all=$({ ls -d /proc/[0-9]* 2> /dev/null || true; } | wc -l)
 echo "fleet: $fleet processes ($all on the machine), swap $([[ $swap == 1 ]] && echo on || echo off)"
 
 # Best of $runs wall-clock times of a command, in nanoseconds.
