@@ -115,12 +115,11 @@ std::string temporaryFile(const std::string& bytes, int& fd)
     return pattern;
 }
 
+// A handle whose directory is open, as the platform opens it around a read.
 std::shared_ptr<HTLinuxTaskPort> openTask(pid_t pid)
 {
-    std::string directory = "/proc/" + std::to_string(pid);
-    int dirfd = ::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (dirfd < 0) return nullptr;
-    return std::make_shared<HTLinuxTaskPort>(pid, dirfd);
+    auto task = std::make_shared<HTLinuxTaskPort>(pid);
+    return task->openDirectory() ? task : nullptr;
 }
 
 std::vector<HTPlatformImage> listImages(HTElfImageReader& reader, HTLinuxTaskPort& task)

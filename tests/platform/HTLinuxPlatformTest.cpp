@@ -264,12 +264,26 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(task.get());
     ASSERT_NE(linuxTask, nullptr);
     EXPECT_EQ(linuxTask->pid(), ::getpid());
-    // The directory descriptor reads the process's files.
-    EXPECT_EQ(::faccessat(linuxTask->procDirFd(), "smaps", R_OK, 0), 0);
-    int dirFd = linuxTask->procDirFd();
-    task.reset();
-    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle closes its descriptors";
+    // Between calls the handle holds no descriptor; opened, its directory
+    // reads the process's files, and it closes what it opened.
+    EXPECT_EQ(linuxTask->procDirFd(), -1);
+    int dirFd = -1;
+    {
+        HTLinuxTaskPort::DirectoryUse directory(*linuxTask);
+        dirFd = directory.fd();
+        EXPECT_EQ(::faccessat(dirFd, "smaps", R_OK, 0), 0);
+    }
+    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle keeps its directory open";
 
+    // A handle on a process of the same pid that started at another time
+    // (the pid recycled since) opens nothing.
+    ASSERT_TRUE(linuxTask->startTime());
+    HTLinuxTaskPort recycled(::getpid(), *linuxTask->startTime() + 1);
+    errno = 0;
+    EXPECT_FALSE(recycled.openDirectory());
+    EXPECT_EQ(errno, ESRCH);
+
+    task.reset();
     EXPECT_NE(platform.task_for_pid(0, &task), KERN_SUCCESS);
     EXPECT_EQ(task, nullptr);
 

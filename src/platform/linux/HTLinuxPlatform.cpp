@@ -195,12 +195,23 @@ thread_local HTLastPagemapRead lastPagemapRead;
 kern_return_t readPagemap(HTLinuxTaskPort& task, int pagemap, uint64_t firstPage, size_t count, uint64_t* entries)
 {
     ssize_t bytes = htPreadFully(pagemap, entries, count * sizeof(uint64_t), firstPage * sizeof(uint64_t));
-    if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
-    const size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
-    if (read < count) {
-        if (processHasExited(task.procDirFd())) return KERN_INVALID_ARGUMENT;
-        std::fill(entries + read, entries + count, uint64_t{0});
+    const size_t read = bytes < 0 ? 0 : static_cast<size_t>(bytes) / sizeof(uint64_t);
+    kern_return_t result = KERN_SUCCESS;
+    if (bytes < 0) {
+        result = meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+    } else if (read < count) {
+        HTLinuxTaskPort::DirectoryUse directory(task);
+        if (directory.fd() < 0)
+            result = meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+        else if (processHasExited(directory.fd()))
+            result = KERN_INVALID_ARGUMENT;
     }
+    // A failed read ends the walk: its pagemap is let go at once.
+    if (result != KERN_SUCCESS) {
+        task.closePagemap();
+        return result;
+    }
+    std::fill(entries + read, entries + count, uint64_t{0});
     return KERN_SUCCESS;
 }
 
@@ -560,18 +571,17 @@ kern_return_t HTLinuxPlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskP
     // The kernel is not a process with an address space of its own.
     if (pid <= 0 || task == nullptr) return KERN_INVALID_ARGUMENT;
 
-    int dirfd = openProcessFile(pid, "", O_DIRECTORY);
-    if (dirfd < 0) return HT_KERN_ERRNO_BASE | errno;
+    // The handle learns the process's start time here, and closes its
+    // directory again before it is handed out.
+    auto handle = std::make_shared<HTLinuxTaskPort>(pid);
+    HTLinuxTaskPort::DirectoryUse directory(*handle);
+    if (directory.fd() < 0) return HT_KERN_ERRNO_BASE | errno;
     // Opening smaps runs the kernel's ptrace read check: the same right
     // every later read of the process's memory needs.
-    int smaps = ::openat(dirfd, "smaps", O_RDONLY | O_CLOEXEC);
-    if (smaps < 0) {
-        int error = errno == ENOENT ? ESRCH : errno;
-        ::close(dirfd);
-        return HT_KERN_ERRNO_BASE | error;
-    }
+    int smaps = ::openat(directory.fd(), "smaps", O_RDONLY | O_CLOEXEC);
+    if (smaps < 0) return HT_KERN_ERRNO_BASE | (errno == ENOENT ? ESRCH : errno);
     ::close(smaps);
-    *task = std::make_shared<HTLinuxTaskPort>(pid, dirfd);
+    *task = std::move(handle);
     return KERN_SUCCESS;
 }
 
@@ -612,18 +622,20 @@ kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
     // Reused by every walk on this thread; it keeps the size of the largest
     // smaps read so far (megabytes for a big process).
     thread_local HTProcBuffer smaps;
+    HTLinuxTaskPort::DirectoryUse directory(task);
     // Once a new read fails, what was read before no longer describes the
     // process.
-    if (!smaps.readFile(task.procDirFd(), "smaps")) {
+    if (directory.fd() < 0 || !smaps.readFile(directory.fd(), "smaps")) {
         int error = errno;
         task.clearVmas();
         return meansGone(error) ? MACH_SEND_INVALID_DEST : HT_KERN_ERRNO_BASE | error;
     }
     // A process that dies while its smaps is read ends the text early,
     // without an error, and a zombie's reads empty: either way the text
-    // does not describe the whole process. The descriptor stays bound to
-    // the process it was opened on, so a reused pid cannot pass for it.
-    if (processHasExited(task.procDirFd())) {
+    // does not describe the whole process. The directory was checked to be
+    // the process's own when it was opened, so a reused pid cannot pass for
+    // it.
+    if (processHasExited(directory.fd())) {
         task.clearVmas();
         return MACH_SEND_INVALID_DEST;
     }
@@ -841,7 +853,9 @@ std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path)
 bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
                                        const std::function<void(const HTPlatformImage&)>& callback)
 {
-    return imageReader_.forEachTaskImage(static_cast<HTLinuxTaskPort&>(task), callback);
+    auto& linuxTask = static_cast<HTLinuxTaskPort&>(task);
+    HTLinuxTaskPort::DirectoryUse directory(linuxTask);
+    return directory.fd() >= 0 && imageReader_.forEachTaskImage(linuxTask, callback);
 }
 
 void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)

@@ -41,7 +41,8 @@ public:
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
     uint64_t vm_kernel_page_size() override;
     // An HTLinuxTaskPort, once the process's memory maps can be opened (the
-    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno.
+    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno. The
+    // handle holds no descriptor until it is used.
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(const char* label, kern_return_t code) override;
