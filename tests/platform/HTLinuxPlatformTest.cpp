@@ -10,7 +10,6 @@
 #include <cstring>
 #include <fcntl.h>
 #include <string>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <utility>
 #include <vector>
@@ -235,25 +234,6 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
     ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child.pid()), &exit, WEXITED | WNOWAIT), 0);
     EXPECT_EQ(exit.si_code, CLD_EXITED);
     EXPECT_EQ(exit.si_status, 0) << "1: argument area, 2: task port, 4: record";
-}
-
-TEST(HTLinuxPlatform, RaisesTheDescriptorLimitToItsCeiling)
-{
-    // In a child, so that the test's own limit stays as it was.
-    HTTestChild child = HTTestChild::fork([] {
-        rlimit files{};
-        if (::getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_max < 2) return 2;
-        files.rlim_cur = files.rlim_max / 2;
-        if (::setrlimit(RLIMIT_NOFILE, &files) != 0) return 3;
-        HTLinuxPlatform platform;
-        rlimit raised{};
-        ::getrlimit(RLIMIT_NOFILE, &raised);
-        return raised.rlim_cur == files.rlim_max ? 0 : 1;
-    });
-    siginfo_t exit{};
-    ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child.pid()), &exit, WEXITED | WNOWAIT), 0);
-    EXPECT_EQ(exit.si_code, CLD_EXITED);
-    EXPECT_EQ(exit.si_status, 0);
 }
 
 TEST(HTLinuxPlatform, TaskPortOfTheTestItself)

@@ -24,7 +24,6 @@
 #include <elf.h>
 #include <fcntl.h>
 #include <string_view>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -223,14 +222,6 @@ HTLinuxPlatform::HTLinuxPlatform()
     if (procFd_ < 0) procErrno_ = errno;
     long ticks = ::sysconf(_SC_CLK_TCK);
     if (ticks > 0) clockTicks_ = ticks;
-    // Every process handle keeps its /proc directory (and, once walked, its
-    // pagemap) open until the report is out: thousands of processes need
-    // more descriptors than the usual soft limit of 1024.
-    rlimit files{};
-    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
-        files.rlim_cur = files.rlim_max;
-        ::setrlimit(RLIMIT_NOFILE, &files);
-    }
 }
 
 HTLinuxPlatform::~HTLinuxPlatform()
