@@ -303,10 +303,11 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
 // What the kernel charges `pid` that it cannot take back: the written and
 // swapped pages of all its mappings, and its page tables. `proportionally`
 // divides each page among the processes that map it, so that summed over a
-// set of processes each of their pages counts once.
-inline uint64_t kernelHeft(pid_t pid, bool proportionally = false)
+// set of processes each of their pages counts once. A non-zero `thread` is
+// read instead of the main thread (which reads empty once it has exited).
+inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
-    std::string base = "/proc/" + std::to_string(pid);
+    std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
     std::string rollup = readFile(base + "/smaps_rollup");
     std::string status = readFile(base + "/status");
     EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;

@@ -189,6 +189,26 @@ TEST_F(HTLiveProcessE2ETest, FileMappingsAndLibrariesAreNamedByPath)
     EXPECT_GT(number(libcText->value, "clean") + number(libcText->value, "dirty"), 0u);
 }
 
+TEST_F(HTLiveProcessE2ETest, ProcessWhoseMainThreadExitedIsMeasuredThroughALiveThread)
+{
+    constexpr uint64_t kWritten = 64 * kMiB;
+    LaidOutChild child({"leader-exit", std::to_string(kWritten)});
+    ASSERT_TRUE(child.ready());
+    const auto worker = static_cast<pid_t>(child.value(1));
+
+    rapidjson::Document report;
+    Outcome text = runForReport({child.pidString()}, report);
+    // The main thread's files read an empty address space; the worker's read
+    // the process's, and so do heft's.
+    expectHeftMatchesKernel(report, child.pid(), 0, worker);
+    const rapidjson::Value* process = processIn(report, child.pid());
+    ASSERT_NE(process, nullptr);
+    EXPECT_EQ(number(regionAt(*process, child.value(0)), "dirty"), kWritten);
+    // It is alive: neither a zombie nor gone.
+    EXPECT_EQ(member(*process, "warnings"), nullptr) << text.standardOutput;
+    EXPECT_EQ(member(*process, "errors"), nullptr) << text.standardOutput;
+}
+
 TEST_F(HTLiveProcessE2ETest, ManyProcessesUnderALowOpenFileLimit)
 {
     PreforkLayout layout;

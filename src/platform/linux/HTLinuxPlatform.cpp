@@ -4,6 +4,7 @@
 #include "platform/HTMachErrorText.h"
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/linux/HTLiveThread.h"
 #include "platform/linux/HTPageDisposition.h"
 #include "platform/linux/HTPageQueryChunk.h"
 #include "platform/linux/HTPreadFully.h"
@@ -83,16 +84,17 @@ void closeKeepingErrno(int fd)
     errno = savedErrno;
 }
 
-// Whether the process behind a /proc/PID descriptor has exited or is
-// exiting: it is gone (its files vanish), a zombie (its files read empty),
-// or on its way out, with its address space being torn down.
+// Whether the thread behind a /proc/PID or /proc/PID/task/TID descriptor
+// has exited or is exiting: it is gone (its files vanish), a zombie (its
+// files read empty), or on its way out, with its address space being torn
+// down. Asked of the thread whose files were read, which is the main one
+// unless that one exited before the others.
 bool processHasExited(int dirfd)
 {
     thread_local HTProcBuffer buffer;
     if (!buffer.readFile(dirfd, "stat", HTProcBuffer::End::ShortRead)) return errno == ESRCH || errno == ENOENT;
     std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
-    return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x' ||
-           (stat->flags & HT_PF_EXITING) != 0;
+    return !stat || stat->hasExited();
 }
 
 bool meansGone(int error)
@@ -257,6 +259,19 @@ bool HTLinuxPlatform::readProcessFile(int32_t pid, std::string_view suffix, HTPr
     return read;
 }
 
+bool HTLinuxPlatform::readLiveThreadFile(int32_t pid, const char* name, HTProcBuffer& buffer) const
+{
+    int process = openProcessFile(pid, "", O_DIRECTORY);
+    if (process < 0) return false;
+    int thread = htOpenLiveThreadDirectory(process);
+    closeKeepingErrno(process);
+    if (thread < 0) return false;
+    bool read = buffer.readFile(thread, name, HTProcBuffer::End::ShortRead);
+    closeKeepingErrno(thread);
+    if (!read && errno == ENOENT) errno = ESRCH;
+    return read;
+}
+
 uint64_t HTLinuxPlatform::bootTime()
 {
     std::call_once(bootTimeOnce_, [this] {
@@ -307,6 +322,18 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
         errno = ESRCH;
         return false;
     }
+    // A main thread that exited before the others stays a zombie while they
+    // carry on: the process is alive, and a live thread says what it is
+    // doing and where its stack is.
+    char state = stat->state;
+    uint64_t startstack = stat->startstack;
+    thread_local HTProcBuffer threadBuffer;
+    if (stat->isZombie() && readLiveThreadFile(pid, "stat", threadBuffer)) {
+        if (std::optional<HTProcStat> thread = htParseProcStat(threadBuffer.view())) {
+            state = thread->state;
+            startstack = thread->startstack;
+        }
+    }
 
     info = proc_bsdinfo{};
     if (ownerKnown) {
@@ -316,10 +343,10 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
     // A 64-bit address space puts the stack above 4 GiB; a 32-bit process
     // (ia32 or x32) has none above it. Only when the stack is hidden from
     // heft does the executable's ELF class decide.
-    bool is64bit = stat->startstack != 0 ? stat->startstack > UINT32_MAX : executableIs64bit(procFd_, pid);
+    bool is64bit = startstack != 0 ? startstack > UINT32_MAX : executableIs64bit(procFd_, pid);
 
     info.pbi_flags = is64bit ? PROC_FLAG_LP64 : 0;
-    info.pbi_status = htProcStatusForState(stat->state);
+    info.pbi_status = htProcStatusForState(state);
     info.pbi_pid = static_cast<uint32_t>(stat->pid);
     info.pbi_ppid = static_cast<uint32_t>(stat->ppid);
     copyName(info.pbi_comm, sizeof(info.pbi_comm), stat->comm);
@@ -623,9 +650,8 @@ kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
     }
     // A process that dies while its smaps is read ends the text early,
     // without an error, and a zombie's reads empty: either way the text
-    // does not describe the whole process. The directory was checked to be
-    // the process's own when it was opened, so a reused pid cannot pass for
-    // it.
+    // does not describe the whole process. The thread asked is the one
+    // whose smaps was read: a live one, when the main thread has exited.
     if (processHasExited(directory.fd())) {
         task.clearVmas();
         return MACH_SEND_INVALID_DEST;
@@ -767,6 +793,10 @@ bool HTLinuxPlatform::readStatus(int32_t pid, HTProcStatus& status)
     thread_local HTProcBuffer buffer;
     if (!readProcessFile(pid, "/status", buffer)) return false;
     status = htParseProcStatus(buffer.view());
+    // A main thread that exited before the others has no memory lines in
+    // its status, a live thread has them.
+    if (!status.hasMemoryFigures() && readLiveThreadFile(pid, "status", buffer))
+        status = htParseProcStatus(buffer.view());
     // A zombie's status has no memory lines: its address space is gone.
     if (!status.hasMemoryFigures()) {
         errno = ESRCH;

@@ -1,5 +1,6 @@
 #include "platform/linux/HTLinuxTaskPort.h"
 
+#include "platform/linux/HTLiveThread.h"
 #include "platform/linux/HTPagemapScan.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
@@ -53,6 +54,16 @@ bool HTLinuxTaskPort::openDirectory()
     }
     startTime_ = stat->starttime;
     procDirFd_ = process;
+    // A main thread that has exited reads an empty address space: a live
+    // thread reads the process's. With none left the process is a zombie,
+    // and reads through its own directory say so.
+    if (stat->hasExited()) {
+        int thread = htOpenLiveThreadDirectory(process);
+        if (thread >= 0) {
+            ::close(process);
+            procDirFd_ = thread;
+        }
+    }
     return true;
 }
 

@@ -21,6 +21,12 @@
 // opened on, so once its start time matches, nothing read through it can
 // belong to another.
 //
+// The directory is /proc/PID, or, when the main thread has exited while
+// other threads carry on, /proc/PID/task/TID of a live thread: the main
+// thread then stays a zombie until the last one ends, and its own files
+// read an empty address space, while every thread's files read the one
+// they share.
+//
 // It also keeps what the address-space calls learnt of the process: the
 // mappings of its smaps, parsed once per walk and then searched, and the
 // descriptor of its pagemap while a walk is under way. A handle is used by
