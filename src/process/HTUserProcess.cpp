@@ -11,6 +11,7 @@
 #include "process/HTImageEnumerator.h"
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdio>
 #include <cstring>
@@ -81,6 +82,17 @@ uint64_t mixIdentity(uint64_t id, uint64_t salt) { return htMix(id ^ (salt * 0x9
 // strerror_r comes in two flavours; both give the text here.
 [[maybe_unused]] const char* errnoText(int result, const char* buffer) { return result == 0 ? buffer : "Unknown error"; }
 [[maybe_unused]] const char* errnoText(const char* result, const char*) { return result; }
+
+// Running out of file descriptors stops every process alike: it is said once
+// a run, with its cure, rather than once per process.
+constexpr const char* kOutOfDescriptors = "Too many open files: raise the open-file limit (ulimit -n)";
+std::atomic<bool> outOfDescriptorsSaid{false};
+
+// The errno a platform call's failure carries; 0 for a kernel code.
+int errnoOf(kern_return_t code)
+{
+    return (code & ~0xffff) == HT_KERN_ERRNO_BASE ? code & 0xffff : 0;
+}
 
 // The ledger template, read once per run by whichever process asks first.
 struct LedgerTemplate {
@@ -203,6 +215,7 @@ bool HTUserProcess::_populateTask()
     kern_return_t result = platform().task_for_pid(pid(), &task_);
     if (result == KERN_SUCCESS) return true;
     task_.reset();
+    if (_saidOutOfDescriptors(errnoOf(result))) return false;
     platform().mach_error("task_for_pid", result);
     char message[512];
     std::snprintf(message, sizeof(message), "task_for_pid [%d] %s", pid(),
@@ -251,6 +264,11 @@ void HTUserProcess::_forgetLedgerTemplate()
 {
     std::lock_guard<std::mutex> guard(ledgerTemplateLock);
     ledgerTemplateState = LedgerTemplate{};
+}
+
+void HTUserProcess::_forgetOutOfDescriptors()
+{
+    outOfDescriptorsSaid = false;
 }
 
 void HTUserProcess::_gatherLedgers()
@@ -375,8 +393,18 @@ void HTUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     const char* errorText = errnoText(strerror_r(error, text, sizeof(text)), text);
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), errorText);
-    std::fprintf(stderr, "%s\n", message);
+    if (!_saidOutOfDescriptors(error)) std::fprintf(stderr, "%s\n", message);
     warnings().push_back(message);
+}
+
+bool HTUserProcess::_saidOutOfDescriptors(int error)
+{
+    if (error != EMFILE && error != ENFILE) return false;
+    if (!outOfDescriptorsSaid.exchange(true)) {
+        std::fprintf(stderr, "%s\n", kOutOfDescriptors);
+        _addGlobalError(kOutOfDescriptors);
+    }
+    return true;
 }
 
 // --- the address-space walk --------------------------------------------------------
@@ -406,8 +434,10 @@ uint64_t HTUserProcess::_lastNonSharedCacheRegion()
 
 void HTUserProcess::_bailOutOfWalk(const char* label, kern_return_t code)
 {
-    platform().mach_error(label, code);
-    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString().c_str());
+    if (!_saidOutOfDescriptors(errnoOf(code))) {
+        platform().mach_error(label, code);
+        std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString().c_str());
+    }
     _processMachVMError(code, MACH_SEND_INVALID_DEST);
 }
 
@@ -592,7 +622,7 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
             kern_return_t result =
                 platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
             if (result != KERN_SUCCESS) {
-                platform().mach_error("mach_vm_page_range_query", result);
+                if (!_saidOutOfDescriptors(errnoOf(result))) platform().mach_error("mach_vm_page_range_query", result);
                 _processMachVMError(result, KERN_INVALID_ARGUMENT);
                 return false;
             }

@@ -108,6 +108,9 @@ protected:
     // The ledger template is read once per run; this makes the next process
     // read it again (for a kernel scripted anew).
     static void _forgetLedgerTemplate();
+    // Running out of descriptors is said once per run; this lets the next
+    // run say it again.
+    static void _forgetOutOfDescriptors();
 
     // The platform code whose shared region the process maps.
     virtual int _platformCode();
@@ -166,6 +169,10 @@ protected:
     void _processMachVMError(kern_return_t code, kern_return_t expectedOnExit);
     // Records a warning built from errno, and writes it to standard error.
     void _addErrnoWarningWithDescription(const std::string& description);
+    // Whether `error` means heft ran out of file descriptors, which is then
+    // said (the first time in a run) with the cure, on standard error and
+    // among the run's errors: the callers leave out their own lines there.
+    static bool _saidOutOfDescriptors(int error);
 
     // --- hooks -------------------------------------------------------------
     virtual void _gatherImageData();

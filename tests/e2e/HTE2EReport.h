@@ -132,12 +132,14 @@ inline void expectTextRowShows(const std::string& report, const std::string& cat
 // back from it, read right after heft ran while the process sat still.
 // `cleanedSince` is how much of the count writeback may have cleaned in
 // between (dirty file pages); anonymous memory of a blocked process stays as
-// it is, so for it the two must agree exactly.
-inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0)
+// it is, so for it the two must agree exactly. The kernel's figures are read
+// through `thread` when it is given.
+inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0,
+                                    pid_t thread = 0)
 {
     const rapidjson::Value* process = processIn(report, pid);
     ASSERT_NE(process, nullptr) << "pid " << pid;
-    uint64_t kernel = kernelHeft(pid);
+    uint64_t kernel = kernelHeft(pid, false, thread);
     EXPECT_PRED3(between, number(*process, "heft"), kernel, kernel + cleanedSince) << "pid " << pid;
 }
 

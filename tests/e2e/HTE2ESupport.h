@@ -11,6 +11,7 @@
 #include <signal.h>
 #include <sys/mman.h>
 #include <sys/prctl.h>
+#include <sys/resource.h>
 #include <sys/swap.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -69,8 +70,9 @@ inline constexpr unsigned kRunLimitSeconds = 180;
 
 // Runs `program` with `arguments` (arguments[0] is the name the program sees
 // itself called by), capturing both streams in memory files, which unlike
-// pipes never fill up and stall the program.
-inline Outcome runProgram(const char* program, std::vector<std::string> arguments)
+// pipes never fill up and stall the program. A non-zero `openFiles` is the
+// program's open-file limit, soft and hard, so that it cannot raise it.
+inline Outcome runProgram(const char* program, std::vector<std::string> arguments, rlim_t openFiles = 0)
 {
     Outcome outcome;
     const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
@@ -79,6 +81,11 @@ inline Outcome runProgram(const char* program, std::vector<std::string> argument
     if (child == 0) {
         dup2(streams[0], STDOUT_FILENO);
         dup2(streams[1], STDERR_FILENO);
+        // The program gets the streams and nothing else of the test's: under
+        // a limit, every descriptor it may open is its own.
+        const rlimit files{openFiles, openFiles};
+        close_range(3, ~0U, 0);
+        if (openFiles != 0 && setrlimit(RLIMIT_NOFILE, &files) != 0) _exit(126);
         alarm(kRunLimitSeconds);
         execve(program, argv.data(), environ);
         _exit(127);
@@ -296,10 +303,11 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
 // What the kernel charges `pid` that it cannot take back: the written and
 // swapped pages of all its mappings, and its page tables. `proportionally`
 // divides each page among the processes that map it, so that summed over a
-// set of processes each of their pages counts once.
-inline uint64_t kernelHeft(pid_t pid, bool proportionally = false)
+// set of processes each of their pages counts once. A non-zero `thread` is
+// read instead of the main thread (which reads empty once it has exited).
+inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
-    std::string base = "/proc/" + std::to_string(pid);
+    std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
     std::string rollup = readFile(base + "/smaps_rollup");
     std::string status = readFile(base + "/status");
     EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;

@@ -189,6 +189,52 @@ TEST_F(HTLiveProcessE2ETest, FileMappingsAndLibrariesAreNamedByPath)
     EXPECT_GT(number(libcText->value, "clean") + number(libcText->value, "dirty"), 0u);
 }
 
+TEST_F(HTLiveProcessE2ETest, ProcessWhoseMainThreadExitedIsMeasuredThroughALiveThread)
+{
+    constexpr uint64_t kWritten = 64 * kMiB;
+    LaidOutChild child({"leader-exit", std::to_string(kWritten)});
+    ASSERT_TRUE(child.ready());
+    const auto worker = static_cast<pid_t>(child.value(1));
+
+    rapidjson::Document report;
+    Outcome text = runForReport({child.pidString()}, report);
+    // The main thread's files read an empty address space; the worker's read
+    // the process's, and so do heft's.
+    expectHeftMatchesKernel(report, child.pid(), 0, worker);
+    const rapidjson::Value* process = processIn(report, child.pid());
+    ASSERT_NE(process, nullptr);
+    EXPECT_EQ(number(regionAt(*process, child.value(0)), "dirty"), kWritten);
+    // It is alive: neither a zombie nor gone.
+    EXPECT_EQ(member(*process, "warnings"), nullptr) << text.standardOutput;
+    EXPECT_EQ(member(*process, "errors"), nullptr) << text.standardOutput;
+}
+
+TEST_F(HTLiveProcessE2ETest, ManyProcessesUnderALowOpenFileLimit)
+{
+    PreforkLayout layout;
+    layout.children = 300;
+    layout.shared = layout.children * kMiB / 16;
+    layout.slice = kMiB / 16;
+    layout.own = layout.after = kMiB;
+    LaidOutFamily family(layout);
+    ASSERT_EQ(family.children().size(), static_cast<size_t>(layout.children));
+    std::vector<std::string> arguments = {"heft", "-j", directory_.file("many.json")};
+    for (pid_t pid : family.all()) arguments.push_back(std::to_string(pid));
+
+    // Far more processes than heft may open files, a limit it cannot raise:
+    // it measures every one all the same.
+    Outcome outcome = runProgram(kHeftBinary, arguments, 64);
+    EXPECT_EQ(outcome.status, 0) << outcome.standardError;
+    EXPECT_EQ(outcome.standardError.find("open files"), std::string::npos) << outcome.standardError;
+    rapidjson::Document report;
+    ASSERT_TRUE(loadReport(directory_.file("many.json"), report));
+    for (pid_t pid : family.all()) {
+        const rapidjson::Value* process = processIn(report, pid);
+        ASSERT_NE(process, nullptr) << "pid " << pid;
+        EXPECT_EQ(member(*process, "errors"), nullptr) << "pid " << pid;
+    }
+}
+
 TEST_F(HTLiveProcessE2ETest, ProcessesExitingDuringTheRunLeaveAWholeReport)
 {
     if (geteuid() != 0) GTEST_SKIP() << "-a needs root";

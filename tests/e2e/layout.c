@@ -9,12 +9,15 @@
  * the first three addresses, mlock's errno, the fourth address and madvise's
  * errno; "file PATH SIZE" maps PATH shared, writes it and prints its address;
  * "prefork" lays out a family (below); "churn" forks short-lived children for
- * ever.
+ * ever; "leader-exit SIZE" leaves a worker thread holding SIZE written bytes
+ * after the main thread has exited, and prints their address and the
+ * worker's thread id.
  */
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
 #include <poll.h>
+#include <pthread.h>
 #include <signal.h>
 #include <stdio.h>
 #include <stdlib.h>
@@ -140,6 +143,33 @@ static void prefork(size_t shared, int count, size_t slice, size_t own, size_t a
     printf("\n");
 }
 
+/* The state letter of this process's main thread, from its stat line. */
+static char mainThreadState(void)
+{
+    char path[64], line[512];
+    snprintf(path, sizeof(path), "/proc/%d/stat", (int)getpid());
+    int fd = open(path, O_RDONLY);
+    ssize_t length = fd < 0 ? -1 : read(fd, line, sizeof(line) - 1);
+    if (fd >= 0) close(fd);
+    if (length <= 0) return '?';
+    line[length] = '\0';
+    char* end = strrchr(line, ')');
+    return end != NULL && end[1] == ' ' ? end[2] : '?';
+}
+
+/* The worker of "leader-exit": writes its memory, waits until the main thread
+ * has exited (the kernel keeps it as a zombie while the process lives on),
+ * then prints the memory's address and its own thread id, and stays. */
+static void* leaderExitWorker(void* size)
+{
+    char* pages = mapWritten((size_t)size);
+    while (mainThreadState() != 'Z') usleep(1000);
+    printf("%lu %d\n", (unsigned long)pages, (int)gettid());
+    fflush(stdout);
+    for (;;) pause();
+    return NULL;
+}
+
 int main(int argc, char** argv)
 {
     page = (size_t)sysconf(_SC_PAGESIZE);
@@ -165,6 +195,10 @@ int main(int argc, char** argv)
         printf("%lu\n", (unsigned long)pages);
     } else if (strcmp(mode, "prefork") == 0 && argc == 10) {
         prefork(size[0], (int)size[1], size[2], size[3], size[4], size[5], argv[8], argv[9]);
+    } else if (strcmp(mode, "leader-exit") == 0 && argc == 3) {
+        pthread_t worker;
+        if (pthread_create(&worker, NULL, leaderExitWorker, (void*)size[0]) != 0) return 3;
+        pthread_exit(NULL);
     } else if (strcmp(mode, "churn") == 0) {
         printf("0\n");
         fflush(stdout);

@@ -1,6 +1,7 @@
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTLinuxTaskPort.h"
 #include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTProcStatParser.h"
 #include "platform/HTTestChildren.h"
 
 #include <gtest/gtest.h>
@@ -10,8 +11,9 @@
 #include <cstring>
 #include <fcntl.h>
 #include <string>
-#include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/syscall.h>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -32,6 +34,19 @@ std::vector<int32_t> listAll(HTPlatform& platform)
     EXPECT_LE(count, bound + 20);
     pids.resize(static_cast<size_t>(std::max(count, 0)));
     return pids;
+}
+
+// Waits until the main thread of `pid` is a zombie; false after a second.
+bool waitForMainThreadExit(int32_t pid)
+{
+    HTProcBuffer stat;
+    const std::string path = "/proc/" + std::to_string(pid) + "/stat";
+    for (int tries = 0; tries < 1000; ::usleep(1000), ++tries) {
+        std::optional<HTProcStat> parsed;
+        if (stat.readFile(AT_FDCWD, path.c_str())) parsed = htParseProcStat(stat.view());
+        if (parsed && parsed->state == 'Z') return true;
+    }
+    return false;
 }
 
 bool contains(const std::vector<int32_t>& pids, int32_t pid)
@@ -89,13 +104,20 @@ TEST(HTLinuxPlatform, RecordOfTheTestItselfAndOfTheKernel)
     EXPECT_EQ(field(kernel.pbi_name, sizeof(kernel.pbi_name)), "kernel");
 }
 
-TEST(HTLinuxPlatform, ChildThroughStoppedZombieAndGone)
+TEST(HTLinuxPlatform, ChildThroughStoppedLeaderExitedZombieAndGone)
 {
     HTLinuxPlatform platform;
-    // The child stops itself, then exits once continued; waiting for each
-    // state makes every check below independent of timing.
+    // The child stops itself; once continued its main thread exits while
+    // another carries on, until the child is killed. Waiting for each state
+    // makes every check below independent of timing.
     HTTestChild child = HTTestChild::fork([] {
         ::raise(SIGSTOP);
+        std::thread([] {
+            for (;;) ::pause();
+        }).detach();
+        // The bare system call ends this thread alone, with no unwinding
+        // back through the test.
+        ::syscall(SYS_exit, 0);
         return 0;
     });
     ASSERT_TRUE(child.valid());
@@ -112,9 +134,20 @@ TEST(HTLinuxPlatform, ChildThroughStoppedZombieAndGone)
     EXPECT_EQ(platform.task_for_pid(child.pid(), &task), KERN_SUCCESS);
     task.reset();
 
+    // The main thread's stat says zombie, but the process lives, and the
+    // live thread has its memory figures.
     ::kill(child.pid(), SIGCONT);
-    ASSERT_TRUE(child.waitForZombie());
+    ASSERT_TRUE(waitForMainThreadExit(child.pid()));
     proc_bsdshortinfo shortInfo{};
+    ASSERT_EQ(platform.proc_pidinfo(child.pid(), PROC_PIDT_SHORTBSDINFO, 1, &shortInfo, sizeof(shortInfo)),
+              (int)sizeof(shortInfo));
+    EXPECT_NE(shortInfo.pbsi_status, SZOMB);
+    rusage_info_v4 usage{};
+    EXPECT_EQ(platform.proc_pid_rusage(child.pid(), RUSAGE_INFO_V4, &usage), 0);
+    EXPECT_GT(usage.ri_phys_heft, 0u);
+
+    ::kill(child.pid(), SIGKILL);
+    ASSERT_TRUE(child.waitForZombie());
     ASSERT_EQ(platform.proc_pidinfo(child.pid(), PROC_PIDT_SHORTBSDINFO, 1, &shortInfo, sizeof(shortInfo)),
               (int)sizeof(shortInfo));
     EXPECT_EQ(shortInfo.pbsi_status, SZOMB);
@@ -237,25 +270,6 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
     EXPECT_EQ(exit.si_status, 0) << "1: argument area, 2: task port, 4: record";
 }
 
-TEST(HTLinuxPlatform, RaisesTheDescriptorLimitToItsCeiling)
-{
-    // In a child, so that the test's own limit stays as it was.
-    HTTestChild child = HTTestChild::fork([] {
-        rlimit files{};
-        if (::getrlimit(RLIMIT_NOFILE, &files) != 0 || files.rlim_max < 2) return 2;
-        files.rlim_cur = files.rlim_max / 2;
-        if (::setrlimit(RLIMIT_NOFILE, &files) != 0) return 3;
-        HTLinuxPlatform platform;
-        rlimit raised{};
-        ::getrlimit(RLIMIT_NOFILE, &raised);
-        return raised.rlim_cur == files.rlim_max ? 0 : 1;
-    });
-    siginfo_t exit{};
-    ASSERT_EQ(::waitid(P_PID, static_cast<id_t>(child.pid()), &exit, WEXITED | WNOWAIT), 0);
-    EXPECT_EQ(exit.si_code, CLD_EXITED);
-    EXPECT_EQ(exit.si_status, 0);
-}
-
 TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
 {
     HTLinuxPlatform platform;
@@ -264,12 +278,26 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(task.get());
     ASSERT_NE(linuxTask, nullptr);
     EXPECT_EQ(linuxTask->pid(), ::getpid());
-    // The directory descriptor reads the process's files.
-    EXPECT_EQ(::faccessat(linuxTask->procDirFd(), "smaps", R_OK, 0), 0);
-    int dirFd = linuxTask->procDirFd();
-    task.reset();
-    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle closes its descriptors";
+    // Between calls the handle holds no descriptor; opened, its directory
+    // reads the process's files, and it closes what it opened.
+    EXPECT_EQ(linuxTask->procDirFd(), -1);
+    int dirFd = -1;
+    {
+        HTLinuxTaskPort::DirectoryUse directory(*linuxTask);
+        dirFd = directory.fd();
+        EXPECT_EQ(::faccessat(dirFd, "smaps", R_OK, 0), 0);
+    }
+    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle keeps its directory open";
 
+    // A handle on a process of the same pid that started at another time
+    // (the pid recycled since) opens nothing.
+    ASSERT_TRUE(linuxTask->startTime());
+    HTLinuxTaskPort recycled(::getpid(), *linuxTask->startTime() + 1);
+    errno = 0;
+    EXPECT_FALSE(recycled.openDirectory());
+    EXPECT_EQ(errno, ESRCH);
+
+    task.reset();
     EXPECT_NE(platform.task_for_pid(0, &task), KERN_SUCCESS);
     EXPECT_EQ(task, nullptr);
 

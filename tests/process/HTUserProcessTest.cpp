@@ -327,6 +327,18 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     EXPECT_TRUE(running->warnings().empty());
     EXPECT_EQ(running->errors(), std::vector<std::string>{"target [500]: process is gone"});
     EXPECT_EQ(failing->errors(), std::vector<std::string>{"target [500]: failure"});
+
+    // Out of descriptors, at the walk or at the task port: said once in the
+    // run, with the cure, instead of once per process.
+    const std::string outOfDescriptors = "Too many open files: raise the open-file limit (ulimit -n)";
+    script.regionFailureCode = HT_KERN_ERRNO_BASE | EMFILE;
+    testing::internal::CaptureStderr();
+    auto walked = gathered();
+    script.taskResult = HT_KERN_ERRNO_BASE | ENFILE;
+    EXPECT_FALSE(std::make_shared<HTUserProcess>(platform_)->initWithBsdInfo(script.info));
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), outOfDescriptors + "\n");
+    EXPECT_EQ(HTProcess::globalErrors(), std::vector<std::string>{outOfDescriptors});
+    EXPECT_EQ(walked->errors(), std::vector<std::string>{"target [500]: Too many open files"});
 }
 
 // --- sub-ranges ----------------------------------------------------------------

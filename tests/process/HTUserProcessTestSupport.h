@@ -18,6 +18,7 @@ inline constexpr int32_t kPid = 500;
 class HTUserProcessProbe : public HTUserProcess {
 public:
     using HTUserProcess::_forgetLedgerTemplate;
+    using HTUserProcess::_forgetOutOfDescriptors;
 };
 
 // A live process that maps the shared library cache of a 64-bit ARM system:
@@ -31,13 +32,15 @@ protected:
 };
 
 // Processes scripted on a fake platform. The breakdown switch, the sharing
-// switch, the ledger template and the global errors are program-wide, so
-// every test starts and ends with them in their default state.
+// switch, the ledger template, the global errors and whether running out of
+// descriptors was said are program-wide, so every test starts and ends with
+// them in their default state.
 class HTUserProcessTest : public ::testing::Test {
 protected:
     HTUserProcessTest() : platform_(std::make_shared<HTFakePlatform>())
     {
         HTUserProcessProbe::_forgetLedgerTemplate();
+        HTUserProcessProbe::_forgetOutOfDescriptors();
         setBreakdown(false);
     }
     ~HTUserProcessTest() override
@@ -45,6 +48,7 @@ protected:
         HTHeft::setSharingAnalysisDisabled(false);
         HTProcess::_clearGlobalErrors();
         HTUserProcessProbe::_forgetLedgerTemplate();
+        HTUserProcessProbe::_forgetOutOfDescriptors();
         HTFakePlatform unset;
         HTHeft::setBreakDownPhysHeft(unset, false);
     }

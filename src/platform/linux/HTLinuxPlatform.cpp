@@ -4,6 +4,7 @@
 #include "platform/HTMachErrorText.h"
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTLinuxTaskPort.h"
+#include "platform/linux/HTLiveThread.h"
 #include "platform/linux/HTPageDisposition.h"
 #include "platform/linux/HTPageQueryChunk.h"
 #include "platform/linux/HTPreadFully.h"
@@ -24,7 +25,6 @@
 #include <elf.h>
 #include <fcntl.h>
 #include <string_view>
-#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -84,16 +84,17 @@ void closeKeepingErrno(int fd)
     errno = savedErrno;
 }
 
-// Whether the process behind a /proc/PID descriptor has exited or is
-// exiting: it is gone (its files vanish), a zombie (its files read empty),
-// or on its way out, with its address space being torn down.
+// Whether the thread behind a /proc/PID or /proc/PID/task/TID descriptor
+// has exited or is exiting: it is gone (its files vanish), a zombie (its
+// files read empty), or on its way out, with its address space being torn
+// down. Asked of the thread whose files were read, which is the main one
+// unless that one exited before the others.
 bool processHasExited(int dirfd)
 {
     thread_local HTProcBuffer buffer;
     if (!buffer.readFile(dirfd, "stat", HTProcBuffer::End::ShortRead)) return errno == ESRCH || errno == ENOENT;
     std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
-    return !stat || stat->state == 'Z' || stat->state == 'X' || stat->state == 'x' ||
-           (stat->flags & HT_PF_EXITING) != 0;
+    return !stat || stat->hasExited();
 }
 
 bool meansGone(int error)
@@ -195,12 +196,23 @@ thread_local HTLastPagemapRead lastPagemapRead;
 kern_return_t readPagemap(HTLinuxTaskPort& task, int pagemap, uint64_t firstPage, size_t count, uint64_t* entries)
 {
     ssize_t bytes = htPreadFully(pagemap, entries, count * sizeof(uint64_t), firstPage * sizeof(uint64_t));
-    if (bytes < 0) return meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
-    const size_t read = static_cast<size_t>(bytes) / sizeof(uint64_t);
-    if (read < count) {
-        if (processHasExited(task.procDirFd())) return KERN_INVALID_ARGUMENT;
-        std::fill(entries + read, entries + count, uint64_t{0});
+    const size_t read = bytes < 0 ? 0 : static_cast<size_t>(bytes) / sizeof(uint64_t);
+    kern_return_t result = KERN_SUCCESS;
+    if (bytes < 0) {
+        result = meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+    } else if (read < count) {
+        HTLinuxTaskPort::DirectoryUse directory(task);
+        if (directory.fd() < 0)
+            result = meansGone(errno) ? KERN_INVALID_ARGUMENT : HT_KERN_ERRNO_BASE | errno;
+        else if (processHasExited(directory.fd()))
+            result = KERN_INVALID_ARGUMENT;
     }
+    // A failed read ends the walk: its pagemap is let go at once.
+    if (result != KERN_SUCCESS) {
+        task.closePagemap();
+        return result;
+    }
+    std::fill(entries + read, entries + count, uint64_t{0});
     return KERN_SUCCESS;
 }
 
@@ -212,14 +224,6 @@ HTLinuxPlatform::HTLinuxPlatform()
     if (procFd_ < 0) procErrno_ = errno;
     long ticks = ::sysconf(_SC_CLK_TCK);
     if (ticks > 0) clockTicks_ = ticks;
-    // Every process handle keeps its /proc directory (and, once walked, its
-    // pagemap) open until the report is out: thousands of processes need
-    // more descriptors than the usual soft limit of 1024.
-    rlimit files{};
-    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
-        files.rlim_cur = files.rlim_max;
-        ::setrlimit(RLIMIT_NOFILE, &files);
-    }
 }
 
 HTLinuxPlatform::~HTLinuxPlatform()
@@ -251,6 +255,19 @@ bool HTLinuxPlatform::readProcessFile(int32_t pid, std::string_view suffix, HTPr
     if (fd < 0) return false;
     bool read = buffer.readDescriptor(fd, HTProcBuffer::End::ShortRead);
     closeKeepingErrno(fd);
+    if (!read && errno == ENOENT) errno = ESRCH;
+    return read;
+}
+
+bool HTLinuxPlatform::readLiveThreadFile(int32_t pid, const char* name, HTProcBuffer& buffer) const
+{
+    int process = openProcessFile(pid, "", O_DIRECTORY);
+    if (process < 0) return false;
+    int thread = htOpenLiveThreadDirectory(process);
+    closeKeepingErrno(process);
+    if (thread < 0) return false;
+    bool read = buffer.readFile(thread, name, HTProcBuffer::End::ShortRead);
+    closeKeepingErrno(thread);
     if (!read && errno == ENOENT) errno = ESRCH;
     return read;
 }
@@ -305,6 +322,18 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
         errno = ESRCH;
         return false;
     }
+    // A main thread that exited before the others stays a zombie while they
+    // carry on: the process is alive, and a live thread says what it is
+    // doing and where its stack is.
+    char state = stat->state;
+    uint64_t startstack = stat->startstack;
+    thread_local HTProcBuffer threadBuffer;
+    if (stat->isZombie() && readLiveThreadFile(pid, "stat", threadBuffer)) {
+        if (std::optional<HTProcStat> thread = htParseProcStat(threadBuffer.view())) {
+            state = thread->state;
+            startstack = thread->startstack;
+        }
+    }
 
     info = proc_bsdinfo{};
     if (ownerKnown) {
@@ -314,10 +343,10 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
     // A 64-bit address space puts the stack above 4 GiB; a 32-bit process
     // (ia32 or x32) has none above it. Only when the stack is hidden from
     // heft does the executable's ELF class decide.
-    bool is64bit = stat->startstack != 0 ? stat->startstack > UINT32_MAX : executableIs64bit(procFd_, pid);
+    bool is64bit = startstack != 0 ? startstack > UINT32_MAX : executableIs64bit(procFd_, pid);
 
     info.pbi_flags = is64bit ? PROC_FLAG_LP64 : 0;
-    info.pbi_status = htProcStatusForState(stat->state);
+    info.pbi_status = htProcStatusForState(state);
     info.pbi_pid = static_cast<uint32_t>(stat->pid);
     info.pbi_ppid = static_cast<uint32_t>(stat->ppid);
     copyName(info.pbi_comm, sizeof(info.pbi_comm), stat->comm);
@@ -560,18 +589,17 @@ kern_return_t HTLinuxPlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskP
     // The kernel is not a process with an address space of its own.
     if (pid <= 0 || task == nullptr) return KERN_INVALID_ARGUMENT;
 
-    int dirfd = openProcessFile(pid, "", O_DIRECTORY);
-    if (dirfd < 0) return HT_KERN_ERRNO_BASE | errno;
+    // The handle learns the process's start time here, and closes its
+    // directory again before it is handed out.
+    auto handle = std::make_shared<HTLinuxTaskPort>(pid);
+    HTLinuxTaskPort::DirectoryUse directory(*handle);
+    if (directory.fd() < 0) return HT_KERN_ERRNO_BASE | errno;
     // Opening smaps runs the kernel's ptrace read check: the same right
     // every later read of the process's memory needs.
-    int smaps = ::openat(dirfd, "smaps", O_RDONLY | O_CLOEXEC);
-    if (smaps < 0) {
-        int error = errno == ENOENT ? ESRCH : errno;
-        ::close(dirfd);
-        return HT_KERN_ERRNO_BASE | error;
-    }
+    int smaps = ::openat(directory.fd(), "smaps", O_RDONLY | O_CLOEXEC);
+    if (smaps < 0) return HT_KERN_ERRNO_BASE | (errno == ENOENT ? ESRCH : errno);
     ::close(smaps);
-    *task = std::make_shared<HTLinuxTaskPort>(pid, dirfd);
+    *task = std::move(handle);
     return KERN_SUCCESS;
 }
 
@@ -612,18 +640,19 @@ kern_return_t HTLinuxPlatform::loadVmas(HTLinuxTaskPort& task, bool refresh)
     // Reused by every walk on this thread; it keeps the size of the largest
     // smaps read so far (megabytes for a big process).
     thread_local HTProcBuffer smaps;
+    HTLinuxTaskPort::DirectoryUse directory(task);
     // Once a new read fails, what was read before no longer describes the
     // process.
-    if (!smaps.readFile(task.procDirFd(), "smaps")) {
+    if (directory.fd() < 0 || !smaps.readFile(directory.fd(), "smaps")) {
         int error = errno;
         task.clearVmas();
         return meansGone(error) ? MACH_SEND_INVALID_DEST : HT_KERN_ERRNO_BASE | error;
     }
     // A process that dies while its smaps is read ends the text early,
     // without an error, and a zombie's reads empty: either way the text
-    // does not describe the whole process. The descriptor stays bound to
-    // the process it was opened on, so a reused pid cannot pass for it.
-    if (processHasExited(task.procDirFd())) {
+    // does not describe the whole process. The thread asked is the one
+    // whose smaps was read: a live one, when the main thread has exited.
+    if (processHasExited(directory.fd())) {
         task.clearVmas();
         return MACH_SEND_INVALID_DEST;
     }
@@ -765,6 +794,10 @@ bool HTLinuxPlatform::readStatus(int32_t pid, HTProcStatus& status)
     thread_local HTProcBuffer buffer;
     if (!readProcessFile(pid, "/status", buffer)) return false;
     status = htParseProcStatus(buffer.view());
+    // A main thread that exited before the others has no memory lines in
+    // its status, a live thread has them.
+    if (!status.hasMemoryFigures() && readLiveThreadFile(pid, "status", buffer))
+        status = htParseProcStatus(buffer.view());
     // A zombie's status has no memory lines: its address space is gone.
     if (!status.hasMemoryFigures()) {
         errno = ESRCH;
@@ -850,13 +883,14 @@ bool HTLinuxPlatform::forEachTaskImage(HTTaskPort& task, uint32_t,
     // The images are found among the mappings of the process's smaps, and
     // the walk of its address space that follows takes the same reading:
     // one pass of the kernel over the process's page tables serves both.
+    HTLinuxTaskPort::DirectoryUse directory(*linuxTask);
     kern_return_t loaded = loadVmas(*linuxTask, true);
     if (loaded != KERN_SUCCESS) {
         errno = loaded == MACH_SEND_INVALID_DEST ? ESRCH : loaded & ~HT_KERN_ERRNO_BASE;
         return false;
     }
     linuxTask->keepVmasForNextWalk();
-    imageReader_.forEachTaskImage(linuxTask->procDirFd(), linuxTask->vmas(), callback);
+    imageReader_.forEachTaskImage(directory.fd(), linuxTask->vmas(), callback);
     return true;
 }
 

@@ -41,7 +41,8 @@ public:
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
     uint64_t vm_kernel_page_size() override;
     // An HTLinuxTaskPort, once the process's memory maps can be opened (the
-    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno.
+    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno. The
+    // handle holds no descriptor until it is used.
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(const char* label, kern_return_t code) override;
@@ -102,6 +103,10 @@ private:
     // Reads one of the small files of /proc/PID whole (stat, status,
     // cmdline); false with errno, ESRCH when the process is gone.
     bool readProcessFile(int32_t pid, std::string_view suffix, HTProcBuffer& buffer) const;
+    // Reads the small file `name` of a live thread of the process, for one
+    // whose main thread has exited; false with errno, ESRCH when no thread
+    // lives.
+    bool readLiveThreadFile(int32_t pid, const char* name, HTProcBuffer& buffer) const;
     // The record of a process (or of the kernel for pid 0); false with
     // errno, ESRCH for a process that is gone or a kernel thread.
     bool readBsdInfo(int32_t pid, proc_bsdinfo& info);
@@ -111,7 +116,8 @@ private:
     // yet. KERN_SUCCESS, MACH_SEND_INVALID_DEST for a process that is gone
     // or a zombie, else HT_KERN_ERRNO_BASE | errno.
     kern_return_t loadVmas(HTLinuxTaskPort& task, bool refresh);
-    // Reads the memory figures of /proc/PID/status; false with errno.
+    // Reads the memory figures of /proc/PID/status, or of a live thread's
+    // when the main thread has exited; false with errno, ESRCH for a zombie.
     bool readStatus(int32_t pid, HTProcStatus& status);
     // The identities of the pages [from, to) of the task's mapping at
     // `index` into `identities`.

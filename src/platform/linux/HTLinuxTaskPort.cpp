@@ -1,23 +1,94 @@
 #include "platform/linux/HTLinuxTaskPort.h"
 
+#include "platform/linux/HTLiveThread.h"
 #include "platform/linux/HTPagemapScan.h"
+#include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTProcStatParser.h"
 
 #include <algorithm>
+#include <cerrno>
+#include <charconv>
 #include <fcntl.h>
 #include <unistd.h>
 
 namespace {
 enum : uint8_t { kNotAsked, kNoZeroPage, kZeroPage, kUnknown };
-}
 
-HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, int procDirFd) : pid_(pid), procDirFd_(procDirFd)
+void closeKeepingErrno(int fd)
+{
+    int savedErrno = errno;
+    ::close(fd);
+    errno = savedErrno;
+}
+}  // namespace
+
+HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, std::optional<uint64_t> startTime) : pid_(pid), startTime_(startTime)
 {
 }
 
 HTLinuxTaskPort::~HTLinuxTaskPort()
 {
-    if (pagemapFd_ >= 0) ::close(pagemapFd_);
-    if (procDirFd_ >= 0) ::close(procDirFd_);
+    closePagemap();
+    closeDirectory();
+}
+
+bool HTLinuxTaskPort::openDirectory()
+{
+    if (procDirFd_ >= 0) return true;
+    char path[32] = "/proc/";
+    *std::to_chars(path + 6, path + sizeof(path) - 1, pid_).ptr = '\0';
+    int process = ::open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+    if (process < 0) {
+        if (errno == ENOENT) errno = ESRCH;
+        return false;
+    }
+    thread_local HTProcBuffer buffer;
+    const bool read = buffer.readFile(process, "stat", HTProcBuffer::End::ShortRead);
+    std::optional<HTProcStat> stat = read ? htParseProcStat(buffer.view()) : std::nullopt;
+    if (!stat || (startTime_ && stat->starttime != *startTime_)) {
+        // Gone, or the pid names another process now.
+        int error = read || errno == ENOENT ? ESRCH : errno;
+        ::close(process);
+        errno = error;
+        return false;
+    }
+    startTime_ = stat->starttime;
+    procDirFd_ = process;
+    // A main thread that has exited reads an empty address space: a live
+    // thread reads the process's. With none left the process is a zombie,
+    // and reads through its own directory say so.
+    if (stat->hasExited()) {
+        int thread = htOpenLiveThreadDirectory(process);
+        if (thread >= 0) {
+            ::close(process);
+            procDirFd_ = thread;
+        }
+    }
+    return true;
+}
+
+void HTLinuxTaskPort::closeDirectory()
+{
+    if (procDirFd_ >= 0) closeKeepingErrno(procDirFd_);
+    procDirFd_ = -1;
+}
+
+HTLinuxTaskPort::DirectoryUse::DirectoryUse(HTLinuxTaskPort& task) : task_(task)
+{
+    if (task.procDirFd_ >= 0) return;
+    opened_ = task.openDirectory();
+    if (!opened_) error_ = errno;
+}
+
+HTLinuxTaskPort::DirectoryUse::~DirectoryUse()
+{
+    if (opened_) task_.closeDirectory();
+}
+
+int HTLinuxTaskPort::DirectoryUse::fd() const
+{
+    if (task_.procDirFd_ < 0) errno = error_;
+    return task_.procDirFd_;
 }
 
 void HTLinuxTaskPort::parseVmas(std::string_view smaps)
@@ -62,13 +133,16 @@ const HTSmapsEntry* HTLinuxTaskPort::vmaContaining(uint64_t address) const
 
 int HTLinuxTaskPort::pagemapFd()
 {
-    if (pagemapFd_ < 0) pagemapFd_ = ::openat(procDirFd_, "pagemap", O_RDONLY | O_CLOEXEC);
+    if (pagemapFd_ >= 0) return pagemapFd_;
+    DirectoryUse directory(*this);
+    if (directory.fd() < 0) return -1;
+    pagemapFd_ = ::openat(directory.fd(), "pagemap", O_RDONLY | O_CLOEXEC);
     return pagemapFd_;
 }
 
 void HTLinuxTaskPort::closePagemap()
 {
-    if (pagemapFd_ >= 0) ::close(pagemapFd_);
+    if (pagemapFd_ >= 0) closeKeepingErrno(pagemapFd_);
     pagemapFd_ = -1;
 }
 

@@ -9,25 +9,67 @@
 #include <utility>
 #include <vector>
 
-// A handle on a live Linux process: its /proc/PID directory, through which
-// every file of the process is read with openat. The directory stands for
-// the process itself, not its number: once the process is gone nothing
-// can be opened through it, even when the pid is recycled. The handle owns
-// the descriptor.
+// A handle on a live Linux process, named by its pid and its start time
+// (field 22 of its stat line, in clock ticks after boot).
+//
+// The handle holds no descriptor of the process between calls: a run over
+// thousands of processes cannot keep one open for each. Every call that
+// reads the process opens its directory anew (a DirectoryUse) and first
+// reads the start time through it, so that a recycled pid is never read as
+// the process: for another process to have the same pid, the pid space
+// must have wrapped around since this one started, and the other's start
+// time then differs, since no machine creates pid_max processes within one
+// clock tick. A directory descriptor stays bound to the process it was
+// opened on, so once its start time matches, nothing read through it can
+// belong to another.
+//
+// The directory is /proc/PID, or, when the main thread has exited while
+// other threads carry on, /proc/PID/task/TID of a live thread: the main
+// thread then stays a zombie until the last one ends, and its own files
+// read an empty address space, while every thread's files read the one
+// they share.
 //
 // It also keeps what the address-space calls learnt of the process: the
 // mappings of its smaps, parsed once per walk and then searched, and the
-// descriptor of its pagemap. A handle is used by one thread at a time.
+// descriptor of its pagemap while a walk is under way. A handle is used by
+// one thread at a time.
 class HTLinuxTaskPort : public HTTaskPort {
 public:
-    // Takes ownership of the descriptor.
-    HTLinuxTaskPort(int32_t pid, int procDirFd);
+    // A handle on the process `pid` that started at `startTime`; without
+    // one, the first opening of the directory learns it.
+    explicit HTLinuxTaskPort(int32_t pid, std::optional<uint64_t> startTime = std::nullopt);
     ~HTLinuxTaskPort() override;
     HTLinuxTaskPort(const HTLinuxTaskPort&) = delete;
     HTLinuxTaskPort& operator=(const HTLinuxTaskPort&) = delete;
 
     int32_t pid() const override { return pid_; }
+    std::optional<uint64_t> startTime() const { return startTime_; }
+
+    // Opens the directory through which the process is read, unless one is
+    // open. The first opening learns the start time, every later one checks
+    // it. False with errno: ESRCH when the process is gone or its pid now
+    // names another one.
+    bool openDirectory();
+    void closeDirectory();
+    // The open directory; -1 when none is.
     int procDirFd() const { return procDirFd_; }
+
+    // Keeps the directory open for its own lifetime, opening it unless it
+    // is open already, and then closes what it opened.
+    class DirectoryUse {
+    public:
+        explicit DirectoryUse(HTLinuxTaskPort& task);
+        ~DirectoryUse();
+        DirectoryUse(const DirectoryUse&) = delete;
+        DirectoryUse& operator=(const DirectoryUse&) = delete;
+        // The directory; -1 with errno set when it could not be opened.
+        int fd() const;
+
+    private:
+        HTLinuxTaskPort& task_;
+        bool opened_ = false;
+        int error_ = 0;
+    };
 
     // The mappings of the last parse, in address order.
     bool hasParsedVmas() const { return hasParsedVmas_; }
@@ -67,7 +109,8 @@ public:
 
 private:
     int32_t pid_;
-    int procDirFd_;
+    std::optional<uint64_t> startTime_;
+    int procDirFd_ = -1;
     int pagemapFd_ = -1;
     bool hasParsedVmas_ = false;
     bool keptForNextWalk_ = false;

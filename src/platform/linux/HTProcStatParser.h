@@ -32,6 +32,10 @@ struct HTProcStat {
     uint64_t startstack = 0;
 
     bool isKernelThread() const { return (flags & HT_PF_KTHREAD) != 0; }
+    // A zombie, or a task being reaped.
+    bool isZombie() const { return state == 'Z' || state == 'X' || state == 'x'; }
+    // A zombie, or on its way out, letting go of its address space.
+    bool hasExited() const { return isZombie() || (flags & HT_PF_EXITING) != 0; }
 };
 
 // Parses a stat line; nullopt when the text is empty, cut short before the
