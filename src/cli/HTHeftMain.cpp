@@ -1,6 +1,7 @@
 #include "cli/HTHeftMain.h"
 
 #include "analysis/HTHeft.h"
+#include "base/HTNoticeLog.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
 #include "output/HTOutputFormatterJSON.h"
@@ -52,6 +53,9 @@ void gather(HTHeft& heft, HTPlatform& platform)
     // Cancelling restores SIGINT's default action: a second Ctrl-C while
     // printing ends the program at once.
     if (source) source->cancel();
+    // What befell the processes while they were set up and read, each
+    // story once.
+    HTNoticeLog::standardError().flush(stderr);
 }
 
 // The run itself; `stage` says what it is doing, for a message if memory
@@ -75,6 +79,8 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
 
     stage = "listing the processes";
     auto targets = args->targetProcessesAndError(platform, &error);
+    // With nothing to gather, what befell the processes is said now.
+    if (!targets || targets->empty()) HTNoticeLog::standardError().flush(stderr);
     if (!targets) {
         if (error.description) std::fprintf(stderr, "%s\n", error.description->c_str());
         printUsage();

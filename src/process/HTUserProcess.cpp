@@ -3,6 +3,7 @@
 #include "analysis/HTHeft.h"
 #include "base/HTAssert.h"
 #include "base/HTMix.h"
+#include "base/HTNoticeLog.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
@@ -22,6 +23,16 @@ namespace {
 
 constexpr const char* kModule = "HTUserProcess";
 constexpr const char* kOwnedVmObjectsSetting = "vm.get_owned_vmobjects";
+constexpr const char* kBailOutNotice = "bailing out for process %s; data may be incomplete!";
+
+// What standard error says of processes that went away while heft read
+// them. On a busy machine that is nothing unusual, and the report already
+// marks each one: one line names them all.
+constexpr const char* kExitedNotice =
+    "%s: exited while being read; the report shows what was read, marked \"(process exited)\"";
+constexpr const char* kZombieNotice =
+    "%s: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report";
+constexpr const char* kGoneBeforeOpenNotice = "%s: exited before it could be opened; not measured";
 // Room for 16 more owned-object records each time the list is asked for,
 // for objects created between two asks.
 constexpr size_t kOwnedVmObjectsHeadroom = 16 * sizeof(HTOwnedVmObject);
@@ -203,7 +214,11 @@ bool HTUserProcess::_populateTask()
     kern_return_t result = platform().task_for_pid(pid(), &task_);
     if (result == KERN_SUCCESS) return true;
     task_.reset();
-    platform().mach_error("task_for_pid", result);
+    if (result == (HT_KERN_ERRNO_BASE | ESRCH))
+        HTNoticeLog::standardError().add(kGoneBeforeOpenNotice, pid(), displayString());
+    else
+        HTNoticeLog::standardError().add("%s: could not be opened: " + platform().mach_error_string(result), pid(),
+                                         displayString());
     char message[512];
     std::snprintf(message, sizeof(message), "task_for_pid [%d] %s", pid(),
                   platform().mach_error_string(result).c_str());
@@ -341,31 +356,43 @@ std::optional<HTOwnedVmObjectMap> HTUserProcess::_gatherOwnedVmObjects()
 
 // --- diagnostics -------------------------------------------------------------------
 
-void HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
+HTUserProcess::HTCallFailure HTUserProcess::_failureIfGone()
 {
-    const char* suffix = "";
-    bool asWarning = false;
-    if (code == expectedOnExit && _isAlive()) {
-        proc_bsdshortinfo info{};
-        errno = 0;
-        int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
-        if (filled == static_cast<int>(sizeof(info))) {
-            if (info.pbsi_status == SZOMB) {
-                suffix = " (zombie)";
-                asWarning = true;
-            }
-        } else if (filled <= 0 && errno == ESRCH) {
-            suffix = " (process exited)";
-            asWarning = true;
-        }
+    if (!_isAlive()) return HTCallFailure::Failed;
+    proc_bsdshortinfo info{};
+    errno = 0;
+    int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
+    if (filled == static_cast<int>(sizeof(info))) {
+        return info.pbsi_status == SZOMB ? HTCallFailure::Zombie : HTCallFailure::Failed;
     }
+    return filled <= 0 && errno == ESRCH ? HTCallFailure::Exited : HTCallFailure::Failed;
+}
+
+HTUserProcess::HTCallFailure HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
+{
+    const HTCallFailure failure = code == expectedOnExit ? _failureIfGone() : HTCallFailure::Failed;
+    const char* suffix = failure == HTCallFailure::Zombie   ? " (zombie)"
+                         : failure == HTCallFailure::Exited ? " (process exited)"
+                                                            : "";
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s%s", displayString().c_str(),
                   platform().mach_error_string(code).c_str(), suffix);
-    if (asWarning)
+    if (failure != HTCallFailure::Failed)
         warnings().push_back(message);
     else
         addError(message);
+    return failure;
+}
+
+void HTUserProcess::_addFailureNotice(HTCallFailure failure, const std::string& failedText)
+{
+    HTNoticeLog& notices = HTNoticeLog::standardError();
+    if (failure == HTCallFailure::Exited)
+        notices.add(kExitedNotice, pid(), displayString());
+    else if (failure == HTCallFailure::Zombie)
+        notices.add(kZombieNotice, pid(), displayString());
+    else
+        notices.add(failedText, pid(), displayString());
 }
 
 void HTUserProcess::_addErrnoWarningWithDescription(const std::string& description)
@@ -373,10 +400,16 @@ void HTUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     const int error = errno;
     char text[256];
     const char* errorText = errnoText(strerror_r(error, text, sizeof(text)), text);
+    // A process that is gone is the common case on a busy machine: said in
+    // words, and on standard error in the one line of such processes.
+    const HTCallFailure failure = error == ESRCH ? _failureIfGone() : HTCallFailure::Failed;
+    const char* reason = failure == HTCallFailure::Exited   ? "process exited"
+                         : failure == HTCallFailure::Zombie ? "zombie"
+                                                            : errorText;
     char message[1024];
-    std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), errorText);
-    std::fprintf(stderr, "%s\n", message);
+    std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), reason);
     warnings().push_back(message);
+    _addFailureNotice(failure, "%s: " + description + " - " + errorText);
 }
 
 // --- the address-space walk --------------------------------------------------------
@@ -404,11 +437,11 @@ uint64_t HTUserProcess::_lastNonSharedCacheRegion()
     }
 }
 
-void HTUserProcess::_bailOutOfWalk(const char* label, kern_return_t code)
+void HTUserProcess::_bailOutOfWalk(kern_return_t code)
 {
-    platform().mach_error(label, code);
-    std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString().c_str());
-    _processMachVMError(code, MACH_SEND_INVALID_DEST);
+    const HTCallFailure failure = _processMachVMError(code, MACH_SEND_INVALID_DEST);
+    _addFailureNotice(failure, std::string(kBailOutNotice) + " (its memory map could not be read: " +
+                                   platform().mach_error_string(code) + ")");
 }
 
 void HTUserProcess::enumerateRegions(const RegionCallback& callback)
@@ -434,7 +467,7 @@ void HTUserProcess::enumerateRegions(const RegionCallback& callback)
             kern_return_t result = platform().mach_vm_region(task, &found, &size, &basic, &count);
             if (result == KERN_INVALID_ADDRESS) return;
             if (result != KERN_SUCCESS) {
-                _bailOutOfWalk("mach_vm_region", result);
+                _bailOutOfWalk(result);
                 return;
             }
             start = std::max(found, address);
@@ -462,7 +495,7 @@ void HTUserProcess::enumerateRegions(const RegionCallback& callback)
         kern_return_t result = platform().mach_vm_region_recurse(task, &found, &size, &depth, &info, &count);
         if (result == KERN_INVALID_ADDRESS) return;
         if (result != KERN_SUCCESS) {
-            _bailOutOfWalk("mach_vm_region_recurse", result);
+            _bailOutOfWalk(result);
             return;
         }
         // An older kernel's shorter record has no full object id.
@@ -592,8 +625,9 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
             kern_return_t result =
                 platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
             if (result != KERN_SUCCESS) {
-                platform().mach_error("mach_vm_page_range_query", result);
-                _processMachVMError(result, KERN_INVALID_ARGUMENT);
+                _addFailureNotice(_processMachVMError(result, KERN_INVALID_ARGUMENT),
+                                  "%s: its pages could not be read (" + platform().mach_error_string(result) +
+                                      "); data may be incomplete");
                 return false;
             }
             block(dispositions, 0, std::min(count, wanted), (address - start) / page);
@@ -843,8 +877,9 @@ void HTUserProcess::_gatherMemoryData()
         if (start >= sharedRegionBase_ && start - sharedRegionBase_ < sharedRegionSize_) {
             if (hidden) return false;
             if (!_addRegionsToArray(regions, start, size, info, enumerator)) {
-                std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
-                             displayString().c_str());
+                // The failed page query has told of a process that went
+                // away; one still there bails out as the walk does.
+                if (!errors().empty()) HTNoticeLog::standardError().add(kBailOutNotice, pid(), displayString());
                 return true;
             }
             return false;

@@ -1,4 +1,6 @@
 #include "cli/HTHeftMain.h"
+
+#include "base/HTNoticeLog.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
@@ -23,6 +25,7 @@ protected:
     void SetUp() override
     {
         HTProcess::_clearGlobalErrors();
+        HTNoticeLog::standardError().clear();
         platform_ = std::make_shared<HTFakePlatform>();
         platform_->ownPid = 500;
         platform_->addProcess(1, 0, "init", "/sbin/init");

@@ -214,10 +214,9 @@ TEST_F(HTUserProcessTest, OwnedObjectListGrowingBetweenAsksIsReadWhole)
 
     // A failure other than "not there" is a warning.
     script.ownedVmObjectsErrno = EPERM;
-    testing::internal::CaptureStderr();
     auto failed = gathered();
     std::string expected = std::string("target [500]: vm.get_owned_vmobjects - ") + std::strerror(EPERM);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), expected + "\n");
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{expected});
     EXPECT_EQ(failed->warnings(), std::vector<std::string>{expected});
 }
 
@@ -292,6 +291,13 @@ TEST_F(HTUserProcessTest, HeldFakeRegionWithRoomLeftIsAppendedWithoutAddress)
     for (const auto& region : plain->memoryRegions()) EXPECT_NE(region->name(), "page table");
 }
 
+namespace {
+
+constexpr const char* kExitedNotice =
+    ": exited while being read; the report shows what was read, marked \"(process exited)\"";
+
+}  // namespace
+
 TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses)
 {
     HTFakePlatform::Process& script = addTarget();
@@ -301,32 +307,41 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     // The process exits during the walk: what was read stays, with a warning.
     auto process = created();
     script.exited = true;
-    testing::internal::CaptureStderr();
     process->gatherData();
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              "bailing out for process target [500]; data may be incomplete!\n");
-    EXPECT_EQ(platform_->machErrors.back(), "mach_vm_region_recurse: process is gone");
     EXPECT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->errors().empty());
     EXPECT_EQ(process->warnings(), std::vector<std::string>{"target [500]: process is gone (process exited)"});
-
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{std::string("target [500]") + kExitedNotice});
     script.exited = false;
-    script.info.pbi_status = SZOMB;
-    testing::internal::CaptureStderr();
-    auto zombie = gathered();
-    testing::internal::GetCapturedStderr();
-    EXPECT_EQ(zombie->warnings(), std::vector<std::string>{"target [500]: process is gone (zombie)"});
 
-    // A running process, or another code: an error.
-    script.info.pbi_status = SRUN;
-    testing::internal::CaptureStderr();
-    auto running = gathered();
-    script.regionFailureCode = KERN_FAILURE;
-    auto failing = gathered();
-    testing::internal::GetCapturedStderr();
-    EXPECT_TRUE(running->warnings().empty());
-    EXPECT_EQ(running->errors(), std::vector<std::string>{"target [500]: process is gone"});
-    EXPECT_EQ(failing->errors(), std::vector<std::string>{"target [500]: failure"});
+    // The process as the kernel describes it after the failure, the code the
+    // walk met, and what the process and standard error then say.
+    struct Case {
+        uint32_t status;
+        uint32_t flags;
+        kern_return_t code;
+        std::vector<std::string> warnings, errors;
+        std::string notice;
+    };
+    const std::string bailOut = "bailing out for process target [500]; data may be incomplete! ";
+    const Case cases[] = {
+        {SZOMB, 0, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (zombie)"}, {},
+         "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report"},
+        // A running process, or another code: an error.
+        {SRUN, 0, MACH_SEND_INVALID_DEST, {}, {"target [500]: process is gone"},
+         bailOut + "(its memory map could not be read: process is gone)"},
+        {SRUN, 0, KERN_FAILURE, {}, {"target [500]: failure"},
+         bailOut + "(its memory map could not be read: failure)"},
+    };
+    for (const Case& test : cases) {
+        script.info.pbi_status = test.status;
+        script.info.pbi_flags = PROC_FLAG_LP64 | test.flags;
+        script.regionFailureCode = test.code;
+        auto failed = gathered();
+        EXPECT_EQ(failed->warnings(), test.warnings) << test.notice;
+        EXPECT_EQ(failed->errors(), test.errors) << test.notice;
+        EXPECT_EQ(takeNotices(), std::vector<std::string>{test.notice});
+    }
 }
 
 // --- sub-ranges ----------------------------------------------------------------

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "analysis/HTHeft.h"
+#include "base/HTNoticeLog.h"
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTUserProcess.h"
@@ -31,19 +32,22 @@ protected:
 };
 
 // Processes scripted on a fake platform. The breakdown switch, the sharing
-// switch, the ledger template and the global errors are program-wide, so
-// every test starts and ends with them in their default state.
+// switch, the ledger template, the global errors and the notices for
+// standard error are program-wide, so every test starts and ends with them
+// in their default state.
 class HTUserProcessTest : public ::testing::Test {
 protected:
     HTUserProcessTest() : platform_(std::make_shared<HTFakePlatform>())
     {
         HTUserProcessProbe::_forgetLedgerTemplate();
+        HTNoticeLog::standardError().clear();
         setBreakdown(false);
     }
     ~HTUserProcessTest() override
     {
         HTHeft::setSharingAnalysisDisabled(false);
         HTProcess::_clearGlobalErrors();
+        HTNoticeLog::standardError().clear();
         HTUserProcessProbe::_forgetLedgerTemplate();
         HTFakePlatform unset;
         HTHeft::setBreakDownPhysHeft(unset, false);
@@ -87,6 +91,14 @@ protected:
         region.info.object_id_full = objectId != 0 ? objectId : 0x4000000000000000 | start;
         region.info.object_id = static_cast<uint32_t>(region.info.object_id_full);
         return region;
+    }
+
+    // The notices for standard error so far; the log is emptied.
+    static std::vector<std::string> takeNotices()
+    {
+        std::vector<std::string> lines = HTNoticeLog::standardError().lines();
+        HTNoticeLog::standardError().clear();
+        return lines;
     }
 
     std::shared_ptr<HTFakePlatform> platform_;
