@@ -363,7 +363,10 @@ HTUserProcess::HTCallFailure HTUserProcess::_failureIfGone()
     errno = 0;
     int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
     if (filled == static_cast<int>(sizeof(info))) {
-        return info.pbsi_status == SZOMB ? HTCallFailure::Zombie : HTCallFailure::Failed;
+        if (info.pbsi_status == SZOMB) return HTCallFailure::Zombie;
+        // A process whose exit is under way has lost its memory already.
+        if (info.pbsi_flags & PROC_FLAG_INEXIT) return HTCallFailure::Exited;
+        return HTCallFailure::Failed;
     }
     return filled <= 0 && errno == ESRCH ? HTCallFailure::Exited : HTCallFailure::Failed;
 }

@@ -327,10 +327,13 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     const Case cases[] = {
         {SZOMB, 0, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (zombie)"}, {},
          "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report"},
+        // Killed, not yet a zombie: its memory is going already.
+        {SRUN, PROC_FLAG_INEXIT, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (process exited)"}, {},
+         std::string("target [500]") + kExitedNotice},
         // A running process, or another code: an error.
         {SRUN, 0, MACH_SEND_INVALID_DEST, {}, {"target [500]: process is gone"},
          bailOut + "(its memory map could not be read: process is gone)"},
-        {SRUN, 0, KERN_FAILURE, {}, {"target [500]: failure"},
+        {SRUN, PROC_FLAG_INEXIT, KERN_FAILURE, {}, {"target [500]: failure"},
          bailOut + "(its memory map could not be read: failure)"},
     };
     for (const Case& test : cases) {

@@ -318,6 +318,8 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
 
     info.pbi_flags = is64bit ? PROC_FLAG_LP64 : 0;
     info.pbi_status = htProcStatusForState(stat->state);
+    // Killed or exiting, not yet a zombie: its memory may be gone already.
+    if ((stat->flags & HT_PF_EXITING) != 0 && info.pbi_status != SZOMB) info.pbi_flags |= PROC_FLAG_INEXIT;
     info.pbi_pid = static_cast<uint32_t>(stat->pid);
     info.pbi_ppid = static_cast<uint32_t>(stat->ppid);
     copyName(info.pbi_comm, sizeof(info.pbi_comm), stat->comm);
