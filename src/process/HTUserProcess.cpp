@@ -380,10 +380,14 @@ HTUserProcess::HTCallFailure HTUserProcess::_processMachVMError(kern_return_t co
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s%s", displayString().c_str(),
                   platform().mach_error_string(code).c_str(), suffix);
-    if (failure != HTCallFailure::Failed)
-        warnings().push_back(message);
-    else
-        addError(message);
+    // Once a process has gone, every later call fails alike.
+    if (failure != HTCallFailure::Failed) {
+        if (std::find(warnings().begin(), warnings().end(), message) == warnings().end())
+            warnings().push_back(message);
+    } else {
+        const std::vector<std::string> recorded = errors();
+        if (std::find(recorded.begin(), recorded.end(), message) == recorded.end()) addError(message);
+    }
     return failure;
 }
 

@@ -164,7 +164,8 @@ protected:
     // What a failed kernel call says of the process.
     enum class HTCallFailure { Failed, Exited, Zombie };
     // Records a failed kernel call as an error, or as a warning when the
-    // process has exited or is a zombie and `expectedOnExit` was returned.
+    // process has exited or is a zombie and `expectedOnExit` was returned;
+    // a text the process already carries is not added again.
     HTCallFailure _processMachVMError(kern_return_t code, kern_return_t expectedOnExit);
     // Exited or Zombie when the kernel says now that the process is gone,
     // Failed while it is still there.

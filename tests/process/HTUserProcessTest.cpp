@@ -345,6 +345,21 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
         EXPECT_EQ(failed->errors(), test.errors) << test.notice;
         EXPECT_EQ(takeNotices(), std::vector<std::string>{test.notice});
     }
+
+    // Gone once its regions were read: the page query of every region
+    // fails, and the process says so once.
+    setBreakdown(true);
+    script.regionFailureIndex.reset();
+    script.regions = {anonymous(0x10000, 2), anonymous(0x20000, 2)};
+    for (auto& region : script.regions) {
+        region.info.share_mode = SM_COW;
+        region.info.pages_resident = region.info.pages_dirtied = 1;
+    }
+    auto gone = created();
+    script.exited = true;
+    gone->gatherData();
+    EXPECT_EQ(gone->warnings(), std::vector<std::string>{"target [500]: invalid argument (process exited)"});
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{std::string("target [500]") + kExitedNotice});
 }
 
 // --- sub-ranges ----------------------------------------------------------------
