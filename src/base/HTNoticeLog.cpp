@@ -6,14 +6,9 @@ void HTNoticeLog::add(const std::string& text, int32_t pid, const std::string& p
     notices_[text].emplace(pid, process);
 }
 
-std::vector<std::string> HTNoticeLog::lines() const
+std::vector<std::string> HTNoticeLog::take()
 {
     std::lock_guard<std::mutex> guard(lock_);
-    return _lines();
-}
-
-std::vector<std::string> HTNoticeLog::_lines() const
-{
     std::vector<std::string> lines;
     for (const auto& [text, processes] : notices_) {
         std::string named;
@@ -33,20 +28,8 @@ std::vector<std::string> HTNoticeLog::_lines() const
         if (processes.size() > 1) line += " (" + std::to_string(processes.size()) + " processes)";
         lines.push_back(std::move(line));
     }
+    notices_.clear();
     return lines;
-}
-
-void HTNoticeLog::flush(FILE* stream)
-{
-    std::lock_guard<std::mutex> guard(lock_);
-    for (const std::string& line : _lines()) std::fprintf(stream, "%s\n", line.c_str());
-    notices_.clear();
-}
-
-void HTNoticeLog::clear()
-{
-    std::lock_guard<std::mutex> guard(lock_);
-    notices_.clear();
 }
 
 HTNoticeLog& HTNoticeLog::standardError()

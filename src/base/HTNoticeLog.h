@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <cstdio>
 #include <map>
 #include <mutex>
 #include <string>
@@ -24,22 +23,15 @@ public:
     // a notice added twice for one process is told once.
     void add(const std::string& text, int32_t pid, const std::string& process);
 
-    // One line a notice. About one process: the text with it. About several:
-    // the text with the first kNamedProcesses of them, "and N more" when
-    // there are others, then " (N processes)".
-    std::vector<std::string> lines() const;
-
-    // Writes the lines, each with a line feed, and empties the log.
-    void flush(FILE* stream);
-    void clear();
+    // One line a notice, and the log emptied. About one process: the text
+    // with it. About several: the text with the first kNamedProcesses of
+    // them, "and N more" when there are others, then " (N processes)".
+    std::vector<std::string> take();
 
     // The run's log for standard error.
     static HTNoticeLog& standardError();
 
 private:
-    // The lines, with the lock held.
-    std::vector<std::string> _lines() const;
-
-    mutable std::mutex lock_;
+    std::mutex lock_;
     std::map<std::string, std::map<int32_t, std::string>> notices_;
 };

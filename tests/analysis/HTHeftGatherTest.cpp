@@ -182,7 +182,7 @@ TEST_F(HTHeftGatherTest, ProcessesReadSideBySideShareOneLineOnStandardError)
     // Seven processes exit while threads read them side by side; one more
     // cannot be opened at all. Each story is told once, naming the
     // processes in pid order whichever thread read them.
-    HTNoticeLog::standardError().clear();
+    HTNoticeLog::standardError().take();
     HTHeft::ProcessList processes;
     for (int32_t pid = 501; pid <= 507; ++pid) {
         HTFakePlatform::Process& script = platform_->addProcess(pid, 1, "worker");
@@ -197,12 +197,11 @@ TEST_F(HTHeftGatherTest, ProcessesReadSideBySideShareOneLineOnStandardError)
     EXPECT_FALSE(HTUserProcess(platform_).initWithBsdInfo(locked.info));
     gathered(processes);
 
-    EXPECT_EQ(HTNoticeLog::standardError().lines(),
+    EXPECT_EQ(HTNoticeLog::standardError().take(),
               (std::vector<std::string>{std::string("locked [600]: could not be opened: ") + std::strerror(EPERM),
                                         "worker [501], worker [502], worker [503], worker [504], worker [505] and 2 "
                                         "more: exited while being read; the report shows what was read, marked "
                                         "\"(process exited)\" (7 processes)"}));
-    HTNoticeLog::standardError().clear();
 }
 
 }  // namespace

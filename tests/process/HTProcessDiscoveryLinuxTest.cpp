@@ -213,12 +213,11 @@ TEST_F(HTProcessDiscoveryLinux, ProcessGoneBeforeItsTaskOpensIsAGlobalError)
     int32_t pid = child.pid();
     child.reap();
 
-    HTNoticeLog::standardError().clear();
+    HTNoticeLog::standardError().take();
     EXPECT_EQ(HTProcess::processWithBsdInfo(platform_, info), nullptr);
-    EXPECT_EQ(HTNoticeLog::standardError().lines(),
+    EXPECT_EQ(HTNoticeLog::standardError().take(),
               std::vector<std::string>{std::string(info.pbi_name) + " [" + std::to_string(pid) +
                                        "]: exited before it could be opened; not measured"});
-    HTNoticeLog::standardError().clear();
     EXPECT_EQ(HTProcess::globalErrors(),
               std::vector<std::string>{"task_for_pid [" + std::to_string(pid) + "] " + std::strerror(ESRCH)});
 }

@@ -40,14 +40,14 @@ protected:
     HTUserProcessTest() : platform_(std::make_shared<HTFakePlatform>())
     {
         HTUserProcessProbe::_forgetLedgerTemplate();
-        HTNoticeLog::standardError().clear();
+        HTNoticeLog::standardError().take();
         setBreakdown(false);
     }
     ~HTUserProcessTest() override
     {
         HTHeft::setSharingAnalysisDisabled(false);
         HTProcess::_clearGlobalErrors();
-        HTNoticeLog::standardError().clear();
+        HTNoticeLog::standardError().take();
         HTUserProcessProbe::_forgetLedgerTemplate();
         HTFakePlatform unset;
         HTHeft::setBreakDownPhysHeft(unset, false);
@@ -94,12 +94,7 @@ protected:
     }
 
     // The notices for standard error so far; the log is emptied.
-    static std::vector<std::string> takeNotices()
-    {
-        std::vector<std::string> lines = HTNoticeLog::standardError().lines();
-        HTNoticeLog::standardError().clear();
-        return lines;
-    }
+    static std::vector<std::string> takeNotices() { return HTNoticeLog::standardError().take(); }
 
     std::shared_ptr<HTFakePlatform> platform_;
 };
