@@ -1,10 +1,12 @@
 #include "cli/HTHeftMain.h"
 
 #include "analysis/HTHeft.h"
+#include "base/HTNoticeLog.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
 #include "output/HTOutputFormatterJSON.h"
 #include "output/HTOutputFormatterText.h"
+#include "output/HTTerminalText.h"
 #include "platform/HTSignalSource.h"
 
 #include <cerrno>
@@ -40,6 +42,15 @@ std::shared_ptr<HTOutputFormatterJSON> openJSONFormatter(const HTHeftArgs& args,
     return formatter;
 }
 
+// Writes what befell the processes while they were set up and read, each
+// story once. Their names come from the processes themselves and are
+// escaped as in the report.
+void tellNotices()
+{
+    for (const std::string& line : HTNoticeLog::standardError().take())
+        std::fprintf(stderr, "%s\n", htTerminalSafe(line).c_str());
+}
+
 // Gathers every target; with standard output redirected, SIGINT stops the
 // gathering early and the report of what was gathered still follows.
 void gather(HTHeft& heft, HTPlatform& platform)
@@ -52,6 +63,7 @@ void gather(HTHeft& heft, HTPlatform& platform)
     // Cancelling restores SIGINT's default action: a second Ctrl-C while
     // printing ends the program at once.
     if (source) source->cancel();
+    tellNotices();
 }
 
 // The run itself; `stage` says what it is doing, for a message if memory
@@ -75,6 +87,8 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
 
     stage = "listing the processes";
     auto targets = args->targetProcessesAndError(platform, &error);
+    // With nothing to gather, what befell the processes is said now.
+    if (!targets || targets->empty()) tellNotices();
     if (!targets) {
         if (error.description) std::fprintf(stderr, "%s\n", error.description->c_str());
         printUsage();

@@ -22,6 +22,8 @@ inline constexpr int PROC_PIDT_SHORTBSDINFO = 13;
 
 // pbi_flags bits.
 inline constexpr uint32_t PROC_FLAG_SYSTEM = 0x1;
+// Exiting: the process is on its way out and its memory is being freed.
+inline constexpr uint32_t PROC_FLAG_INEXIT = 0x4;
 inline constexpr uint32_t PROC_FLAG_LP64 = 0x10;
 
 // pbi_status / pbsi_status values.

@@ -89,11 +89,13 @@ bool HTProcess::initWithBsdInfo(const proc_bsdinfo& info)
 {
     pid_ = static_cast<int32_t>(info.pbi_pid);
     is64bit_ = (info.pbi_flags & PROC_FLAG_LP64) != 0;
-    if (!_populateTask()) return false;
+    // Named first, so that a process that cannot be opened is named in what
+    // is said about it.
     name_ = _nameForBsdInfo(*platform_, info);
     char display[512];
     std::snprintf(display, sizeof(display), "%s [%d]", name_.c_str(), pid_);
     displayString_ = display;
+    if (!_populateTask()) return false;
     pageSize_ = _gatherPageSize();
     return true;
 }

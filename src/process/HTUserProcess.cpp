@@ -3,6 +3,7 @@
 #include "analysis/HTHeft.h"
 #include "base/HTAssert.h"
 #include "base/HTMix.h"
+#include "base/HTNoticeLog.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
@@ -23,6 +24,16 @@ namespace {
 
 constexpr const char* kModule = "HTUserProcess";
 constexpr const char* kOwnedVmObjectsSetting = "vm.get_owned_vmobjects";
+constexpr const char* kBailOutNotice = "bailing out for process %s; data may be incomplete!";
+
+// What standard error says of processes that went away while heft read
+// them. On a busy machine that is nothing unusual, and the report already
+// marks each one: one line names them all.
+constexpr const char* kExitedNotice =
+    "%s: exited while being read; the report shows what was read, marked \"(process exited)\"";
+constexpr const char* kZombieNotice =
+    "%s: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report";
+constexpr const char* kGoneBeforeOpenNotice = "%s: exited before it could be opened; not measured";
 // Room for 16 more owned-object records each time the list is asked for,
 // for objects created between two asks.
 constexpr size_t kOwnedVmObjectsHeadroom = 16 * sizeof(HTOwnedVmObject);
@@ -216,7 +227,11 @@ bool HTUserProcess::_populateTask()
     if (result == KERN_SUCCESS) return true;
     task_.reset();
     if (_saidOutOfDescriptors(errnoOf(result))) return false;
-    platform().mach_error("task_for_pid", result);
+    if (result == (HT_KERN_ERRNO_BASE | ESRCH))
+        HTNoticeLog::standardError().add(kGoneBeforeOpenNotice, pid(), displayString());
+    else
+        HTNoticeLog::standardError().add("%s: could not be opened: " + platform().mach_error_string(result), pid(),
+                                         displayString());
     char message[512];
     std::snprintf(message, sizeof(message), "task_for_pid [%d] %s", pid(),
                   platform().mach_error_string(result).c_str());
@@ -359,31 +374,50 @@ std::optional<HTOwnedVmObjectMap> HTUserProcess::_gatherOwnedVmObjects()
 
 // --- diagnostics -------------------------------------------------------------------
 
-void HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
+HTUserProcess::HTCallFailure HTUserProcess::_failureIfGone()
 {
-    const char* suffix = "";
-    bool asWarning = false;
-    if (code == expectedOnExit && _isAlive()) {
-        proc_bsdshortinfo info{};
-        errno = 0;
-        int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
-        if (filled == static_cast<int>(sizeof(info))) {
-            if (info.pbsi_status == SZOMB) {
-                suffix = " (zombie)";
-                asWarning = true;
-            }
-        } else if (filled <= 0 && errno == ESRCH) {
-            suffix = " (process exited)";
-            asWarning = true;
-        }
+    if (!_isAlive()) return HTCallFailure::Failed;
+    proc_bsdshortinfo info{};
+    errno = 0;
+    int filled = platform().proc_pidinfo(pid(), PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info));
+    if (filled == static_cast<int>(sizeof(info))) {
+        if (info.pbsi_status == SZOMB) return HTCallFailure::Zombie;
+        // A process whose exit is under way has lost its memory already.
+        if (info.pbsi_flags & PROC_FLAG_INEXIT) return HTCallFailure::Exited;
+        return HTCallFailure::Failed;
     }
+    return filled <= 0 && errno == ESRCH ? HTCallFailure::Exited : HTCallFailure::Failed;
+}
+
+HTUserProcess::HTCallFailure HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
+{
+    const HTCallFailure failure = code == expectedOnExit ? _failureIfGone() : HTCallFailure::Failed;
+    const char* suffix = failure == HTCallFailure::Zombie   ? " (zombie)"
+                         : failure == HTCallFailure::Exited ? " (process exited)"
+                                                            : "";
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s%s", displayString().c_str(),
                   platform().mach_error_string(code).c_str(), suffix);
-    if (asWarning)
-        warnings().push_back(message);
+    // Once a process has gone, every later call fails alike.
+    if (failure != HTCallFailure::Failed) {
+        if (std::find(warnings().begin(), warnings().end(), message) == warnings().end())
+            warnings().push_back(message);
+    } else {
+        const std::vector<std::string> recorded = errors();
+        if (std::find(recorded.begin(), recorded.end(), message) == recorded.end()) addError(message);
+    }
+    return failure;
+}
+
+void HTUserProcess::_addFailureNotice(HTCallFailure failure, const std::string& failedText)
+{
+    HTNoticeLog& notices = HTNoticeLog::standardError();
+    if (failure == HTCallFailure::Exited)
+        notices.add(kExitedNotice, pid(), displayString());
+    else if (failure == HTCallFailure::Zombie)
+        notices.add(kZombieNotice, pid(), displayString());
     else
-        addError(message);
+        notices.add(failedText, pid(), displayString());
 }
 
 void HTUserProcess::_addErrnoWarningWithDescription(const std::string& description)
@@ -391,10 +425,16 @@ void HTUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     const int error = errno;
     char text[256];
     const char* errorText = errnoText(strerror_r(error, text, sizeof(text)), text);
+    // A process that is gone is the common case on a busy machine: said in
+    // words, and on standard error in the one line of such processes.
+    const HTCallFailure failure = error == ESRCH ? _failureIfGone() : HTCallFailure::Failed;
+    const char* reason = failure == HTCallFailure::Exited   ? "process exited"
+                         : failure == HTCallFailure::Zombie ? "zombie"
+                                                            : errorText;
     char message[1024];
-    std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), errorText);
-    if (!_saidOutOfDescriptors(error)) std::fprintf(stderr, "%s\n", message);
+    std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), reason);
     warnings().push_back(message);
+    if (!_saidOutOfDescriptors(error)) _addFailureNotice(failure, "%s: " + description + " - " + errorText);
 }
 
 bool HTUserProcess::_saidOutOfDescriptors(int error)
@@ -432,13 +472,12 @@ uint64_t HTUserProcess::_lastNonSharedCacheRegion()
     }
 }
 
-void HTUserProcess::_bailOutOfWalk(const char* label, kern_return_t code)
+void HTUserProcess::_bailOutOfWalk(kern_return_t code)
 {
-    if (!_saidOutOfDescriptors(errnoOf(code))) {
-        platform().mach_error(label, code);
-        std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n", displayString().c_str());
-    }
-    _processMachVMError(code, MACH_SEND_INVALID_DEST);
+    const HTCallFailure failure = _processMachVMError(code, MACH_SEND_INVALID_DEST);
+    if (!_saidOutOfDescriptors(errnoOf(code)))
+        _addFailureNotice(failure, std::string(kBailOutNotice) + " (its memory map could not be read: " +
+                                       platform().mach_error_string(code) + ")");
 }
 
 void HTUserProcess::enumerateRegions(const RegionCallback& callback)
@@ -464,7 +503,7 @@ void HTUserProcess::enumerateRegions(const RegionCallback& callback)
             kern_return_t result = platform().mach_vm_region(task, &found, &size, &basic, &count);
             if (result == KERN_INVALID_ADDRESS) return;
             if (result != KERN_SUCCESS) {
-                _bailOutOfWalk("mach_vm_region", result);
+                _bailOutOfWalk(result);
                 return;
             }
             start = std::max(found, address);
@@ -492,7 +531,7 @@ void HTUserProcess::enumerateRegions(const RegionCallback& callback)
         kern_return_t result = platform().mach_vm_region_recurse(task, &found, &size, &depth, &info, &count);
         if (result == KERN_INVALID_ADDRESS) return;
         if (result != KERN_SUCCESS) {
-            _bailOutOfWalk("mach_vm_region_recurse", result);
+            _bailOutOfWalk(result);
             return;
         }
         // An older kernel's shorter record has no full object id.
@@ -622,8 +661,10 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
             kern_return_t result =
                 platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
             if (result != KERN_SUCCESS) {
-                if (!_saidOutOfDescriptors(errnoOf(result))) platform().mach_error("mach_vm_page_range_query", result);
-                _processMachVMError(result, KERN_INVALID_ARGUMENT);
+                const HTCallFailure failure = _processMachVMError(result, KERN_INVALID_ARGUMENT);
+                if (!_saidOutOfDescriptors(errnoOf(result)))
+                    _addFailureNotice(failure, "%s: its pages could not be read (" +
+                                                   platform().mach_error_string(result) + "); data may be incomplete");
                 return false;
             }
             block(dispositions, 0, std::min(count, wanted), (address - start) / page);
@@ -873,8 +914,9 @@ void HTUserProcess::_gatherMemoryData()
         if (start >= sharedRegionBase_ && start - sharedRegionBase_ < sharedRegionSize_) {
             if (hidden) return false;
             if (!_addRegionsToArray(regions, start, size, info, enumerator)) {
-                std::fprintf(stderr, "bailing out for process %s; data may be incomplete!\n",
-                             displayString().c_str());
+                // The failed page query has told of a process that went
+                // away; one still there bails out as the walk does.
+                if (!errors().empty()) HTNoticeLog::standardError().add(kBailOutNotice, pid(), displayString());
                 return true;
             }
             return false;

@@ -164,10 +164,20 @@ protected:
     // their own, which it returns; null when the mapping holds no copies.
     std::shared_ptr<HTMemoryRegion> _splitCopiedPages(HTMemoryRegion& region, const vm_region_submap_info_64& info);
 
+    // What a failed kernel call says of the process.
+    enum class HTCallFailure { Failed, Exited, Zombie };
     // Records a failed kernel call as an error, or as a warning when the
-    // process has exited or is a zombie and `expectedOnExit` was returned.
-    void _processMachVMError(kern_return_t code, kern_return_t expectedOnExit);
-    // Records a warning built from errno, and writes it to standard error.
+    // process has exited or is a zombie and `expectedOnExit` was returned;
+    // a text the process already carries is not added again.
+    HTCallFailure _processMachVMError(kern_return_t code, kern_return_t expectedOnExit);
+    // Exited or Zombie when the kernel says now that the process is gone,
+    // Failed while it is still there.
+    HTCallFailure _failureIfGone();
+    // Tells standard error of a failed kernel call: the one shared notice of
+    // processes that went away, or `failedText` (with "%s" for the process)
+    // for one that is still there.
+    void _addFailureNotice(HTCallFailure failure, const std::string& failedText);
+    // Records a warning built from errno, with a notice for standard error.
     void _addErrnoWarningWithDescription(const std::string& description);
     // Whether `error` means heft ran out of file descriptors, which is then
     // said (the first time in a run) with the cure, on standard error and
@@ -190,7 +200,7 @@ protected:
 
 private:
     // Reports a failed region look-up and ends the walk's data there.
-    void _bailOutOfWalk(const char* label, kern_return_t code);
+    void _bailOutOfWalk(kern_return_t code);
 
     std::shared_ptr<HTTaskPort> task_;
     uint64_t sharedRegionBase_ = 0;

@@ -2,8 +2,10 @@
 // threads and deliver real signals; they also run under ThreadSanitizer.
 
 #include "analysis/HTHeftTestSupport.h"
+#include "base/HTNoticeLog.h"
 #include "platform/HTSignalSource.h"
 #include "platform/HTWorkQueue.h"
+#include "process/HTUserProcess.h"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -11,6 +13,7 @@
 #include <atomic>
 #include <chrono>
 #include <csignal>
+#include <cstring>
 #include <mutex>
 #include <pthread.h>
 #include <set>
@@ -172,6 +175,33 @@ TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
     EXPECT_THAT(*log, ::testing::Contains(::testing::HasSubstr(HTHeft::kEarlyExitError)));
     EXPECT_THAT(*log, ::testing::Contains(::testing::HasSubstr("hadErrors")));
     EXPECT_EQ(log->back(), "X end");
+}
+
+TEST_F(HTHeftGatherTest, ProcessesReadSideBySideShareOneLineOnStandardError)
+{
+    // Seven processes exit while threads read them side by side; one more
+    // cannot be opened at all. Each story is told once, naming the
+    // processes in pid order whichever thread read them.
+    HTNoticeLog::standardError().take();
+    HTHeft::ProcessList processes;
+    for (int32_t pid = 501; pid <= 507; ++pid) {
+        HTFakePlatform::Process& script = platform_->addProcess(pid, 1, "worker");
+        script.regionFailureIndex = 0;
+        auto process = std::make_shared<HTUserProcess>(platform_);
+        ASSERT_TRUE(process->initWithBsdInfo(script.info));
+        script.exited = true;
+        processes.push_back(process);
+    }
+    HTFakePlatform::Process& locked = platform_->addProcess(600, 1, "locked");
+    locked.taskResult = HT_KERN_ERRNO_BASE | EPERM;
+    EXPECT_FALSE(HTUserProcess(platform_).initWithBsdInfo(locked.info));
+    gathered(processes);
+
+    EXPECT_EQ(HTNoticeLog::standardError().take(),
+              (std::vector<std::string>{std::string("locked [600]: could not be opened: ") + std::strerror(EPERM),
+                                        "worker [501], worker [502], worker [503], worker [504], worker [505] and 2 "
+                                        "more: exited while being read; the report shows what was read, marked "
+                                        "\"(process exited)\" (7 processes)"}));
 }
 
 }  // namespace

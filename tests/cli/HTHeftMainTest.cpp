@@ -1,4 +1,6 @@
 #include "cli/HTHeftMain.h"
+
+#include "base/HTNoticeLog.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
@@ -23,6 +25,7 @@ protected:
     void SetUp() override
     {
         HTProcess::_clearGlobalErrors();
+        HTNoticeLog::standardError().take();
         platform_ = std::make_shared<HTFakePlatform>();
         platform_->ownPid = 500;
         platform_->addProcess(1, 0, "init", "/sbin/init");
@@ -103,6 +106,18 @@ TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRoot)
     result = run({"-a", "-f", "bad"});
     EXPECT_EQ(result.status, 1);
     EXPECT_EQ(result.standardError.rfind("Unrecognized argument to -f", 0), 0u) << result.standardError;
+}
+
+TEST_F(HTHeftMainTest, WhatBefellTheProcessesFollowsTheGatheringEscaped)
+{
+    // A zombie whose name would split the line and drive the terminal.
+    HTFakePlatform::Process& zombie = platform_->addProcess(43, 1, "evil\n\x1B[7m");
+    zombie.info.pbi_status = SZOMB;
+    zombie.regionFailureIndex = 0;
+    Run result = run({"43"});
+    EXPECT_EQ(result.status, 0);
+    EXPECT_EQ(result.standardError, "evil\\n\\x1B[7m [43]: had exited and was not yet reaped (a zombie) when read; "
+                                    "marked \"(zombie)\" in the report\n");
 }
 
 }  // namespace

@@ -1,3 +1,4 @@
+#include "base/HTNoticeLog.h"
 #include "platform/HTTestChildren.h"
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTLinuxTaskPort.h"
@@ -212,10 +213,11 @@ TEST_F(HTProcessDiscoveryLinux, ProcessGoneBeforeItsTaskOpensIsAGlobalError)
     int32_t pid = child.pid();
     child.reap();
 
-    testing::internal::CaptureStderr();
+    HTNoticeLog::standardError().take();
     EXPECT_EQ(HTProcess::processWithBsdInfo(platform_, info), nullptr);
-    std::string stderrText = testing::internal::GetCapturedStderr();
-    EXPECT_EQ(stderrText, std::string("task_for_pid: ") + std::strerror(ESRCH) + " (0xe000003)\n");
+    EXPECT_EQ(HTNoticeLog::standardError().take(),
+              std::vector<std::string>{std::string(info.pbi_name) + " [" + std::to_string(pid) +
+                                       "]: exited before it could be opened; not measured"});
     EXPECT_EQ(HTProcess::globalErrors(),
               std::vector<std::string>{"task_for_pid [" + std::to_string(pid) + "] " + std::strerror(ESRCH)});
 }

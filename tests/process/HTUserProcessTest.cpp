@@ -214,10 +214,9 @@ TEST_F(HTUserProcessTest, OwnedObjectListGrowingBetweenAsksIsReadWhole)
 
     // A failure other than "not there" is a warning.
     script.ownedVmObjectsErrno = EPERM;
-    testing::internal::CaptureStderr();
     auto failed = gathered();
     std::string expected = std::string("target [500]: vm.get_owned_vmobjects - ") + std::strerror(EPERM);
-    EXPECT_EQ(testing::internal::GetCapturedStderr(), expected + "\n");
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{expected});
     EXPECT_EQ(failed->warnings(), std::vector<std::string>{expected});
 }
 
@@ -292,6 +291,13 @@ TEST_F(HTUserProcessTest, HeldFakeRegionWithRoomLeftIsAppendedWithoutAddress)
     for (const auto& region : plain->memoryRegions()) EXPECT_NE(region->name(), "page table");
 }
 
+namespace {
+
+constexpr const char* kExitedNotice =
+    ": exited while being read; the report shows what was read, marked \"(process exited)\"";
+
+}  // namespace
+
 TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses)
 {
     HTFakePlatform::Process& script = addTarget();
@@ -301,36 +307,50 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     // The process exits during the walk: what was read stays, with a warning.
     auto process = created();
     script.exited = true;
-    testing::internal::CaptureStderr();
     process->gatherData();
-    EXPECT_EQ(testing::internal::GetCapturedStderr(),
-              "bailing out for process target [500]; data may be incomplete!\n");
-    EXPECT_EQ(platform_->machErrors.back(), "mach_vm_region_recurse: process is gone");
     EXPECT_EQ(process->memoryRegions().size(), 1u);
     EXPECT_TRUE(process->errors().empty());
     EXPECT_EQ(process->warnings(), std::vector<std::string>{"target [500]: process is gone (process exited)"});
-
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{std::string("target [500]") + kExitedNotice});
     script.exited = false;
-    script.info.pbi_status = SZOMB;
-    testing::internal::CaptureStderr();
-    auto zombie = gathered();
-    testing::internal::GetCapturedStderr();
-    EXPECT_EQ(zombie->warnings(), std::vector<std::string>{"target [500]: process is gone (zombie)"});
 
-    // A running process, or another code: an error.
-    script.info.pbi_status = SRUN;
-    testing::internal::CaptureStderr();
-    auto running = gathered();
-    script.regionFailureCode = KERN_FAILURE;
-    auto failing = gathered();
-    testing::internal::GetCapturedStderr();
-    EXPECT_TRUE(running->warnings().empty());
-    EXPECT_EQ(running->errors(), std::vector<std::string>{"target [500]: process is gone"});
-    EXPECT_EQ(failing->errors(), std::vector<std::string>{"target [500]: failure"});
+    // The process as the kernel describes it after the failure, the code the
+    // walk met, and what the process and standard error then say.
+    struct Case {
+        uint32_t status;
+        uint32_t flags;
+        kern_return_t code;
+        std::vector<std::string> warnings, errors;
+        std::string notice;
+    };
+    const std::string bailOut = "bailing out for process target [500]; data may be incomplete! ";
+    const Case cases[] = {
+        {SZOMB, 0, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (zombie)"}, {},
+         "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report"},
+        // Killed, not yet a zombie: its memory is going already.
+        {SRUN, PROC_FLAG_INEXIT, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (process exited)"}, {},
+         std::string("target [500]") + kExitedNotice},
+        // A running process, or another code: an error.
+        {SRUN, 0, MACH_SEND_INVALID_DEST, {}, {"target [500]: process is gone"},
+         bailOut + "(its memory map could not be read: process is gone)"},
+        {SRUN, PROC_FLAG_INEXIT, KERN_FAILURE, {}, {"target [500]: failure"},
+         bailOut + "(its memory map could not be read: failure)"},
+    };
+    for (const Case& test : cases) {
+        script.info.pbi_status = test.status;
+        script.info.pbi_flags = PROC_FLAG_LP64 | test.flags;
+        script.regionFailureCode = test.code;
+        auto failed = gathered();
+        EXPECT_EQ(failed->warnings(), test.warnings) << test.notice;
+        EXPECT_EQ(failed->errors(), test.errors) << test.notice;
+        EXPECT_EQ(takeNotices(), std::vector<std::string>{test.notice});
+    }
 
     // Out of descriptors, at the walk or at the task port: said once in the
     // run, with the cure, instead of once per process.
     const std::string outOfDescriptors = "Too many open files: raise the open-file limit (ulimit -n)";
+    script.info.pbi_status = SRUN;
+    script.info.pbi_flags = PROC_FLAG_LP64;
     script.regionFailureCode = HT_KERN_ERRNO_BASE | EMFILE;
     testing::internal::CaptureStderr();
     auto walked = gathered();
@@ -339,6 +359,23 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     EXPECT_EQ(testing::internal::GetCapturedStderr(), outOfDescriptors + "\n");
     EXPECT_EQ(HTProcess::globalErrors(), std::vector<std::string>{outOfDescriptors});
     EXPECT_EQ(walked->errors(), std::vector<std::string>{"target [500]: Too many open files"});
+    EXPECT_TRUE(takeNotices().empty());
+    script.taskResult = KERN_SUCCESS;
+
+    // Gone once its regions were read: the page query of every region
+    // fails, and the process says so once.
+    setBreakdown(true);
+    script.regionFailureIndex.reset();
+    script.regions = {anonymous(0x10000, 2), anonymous(0x20000, 2)};
+    for (auto& region : script.regions) {
+        region.info.share_mode = SM_COW;
+        region.info.pages_resident = region.info.pages_dirtied = 1;
+    }
+    auto gone = created();
+    script.exited = true;
+    gone->gatherData();
+    EXPECT_EQ(gone->warnings(), std::vector<std::string>{"target [500]: invalid argument (process exited)"});
+    EXPECT_EQ(takeNotices(), std::vector<std::string>{std::string("target [500]") + kExitedNotice});
 }
 
 // --- sub-ranges ----------------------------------------------------------------

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "analysis/HTHeft.h"
+#include "base/HTNoticeLog.h"
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTUserProcess.h"
@@ -32,21 +33,23 @@ protected:
 };
 
 // Processes scripted on a fake platform. The breakdown switch, the sharing
-// switch, the ledger template, the global errors and whether running out of
-// descriptors was said are program-wide, so every test starts and ends with
-// them in their default state.
+// switch, the ledger template, the global errors, whether running out of
+// descriptors was said and the notices for standard error are program-wide,
+// so every test starts and ends with them in their default state.
 class HTUserProcessTest : public ::testing::Test {
 protected:
     HTUserProcessTest() : platform_(std::make_shared<HTFakePlatform>())
     {
         HTUserProcessProbe::_forgetLedgerTemplate();
         HTUserProcessProbe::_forgetOutOfDescriptors();
+        HTNoticeLog::standardError().take();
         setBreakdown(false);
     }
     ~HTUserProcessTest() override
     {
         HTHeft::setSharingAnalysisDisabled(false);
         HTProcess::_clearGlobalErrors();
+        HTNoticeLog::standardError().take();
         HTUserProcessProbe::_forgetLedgerTemplate();
         HTUserProcessProbe::_forgetOutOfDescriptors();
         HTFakePlatform unset;
@@ -92,6 +95,9 @@ protected:
         region.info.object_id = static_cast<uint32_t>(region.info.object_id_full);
         return region;
     }
+
+    // The notices for standard error so far; the log is emptied.
+    static std::vector<std::string> takeNotices() { return HTNoticeLog::standardError().take(); }
 
     std::shared_ptr<HTFakePlatform> platform_;
 };

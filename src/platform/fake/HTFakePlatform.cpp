@@ -277,7 +277,8 @@ kern_return_t HTFakePlatform::mach_vm_page_range_query(HTTaskPort& task, uint64_
         pageQueries.emplace_back(address, size);
     }
     Process* found = process(task.pid());
-    if (found == nullptr) return KERN_INVALID_ARGUMENT;
+    // The answer of a process that is gone, as on Linux.
+    if (found == nullptr || found->exited) return KERN_INVALID_ARGUMENT;
     if (found->pageQueryFailureAddress && *found->pageQueryFailureAddress >= address &&
         *found->pageQueryFailureAddress - address < size)
         return found->pageQueryFailureCode;
@@ -309,7 +310,7 @@ void HTFakePlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t en
     Process* found = process(task.pid());
     // A process that is gone, or whose page queries are to fail, cannot be
     // scanned either: nothing is skipped and the query meets the failure.
-    if (found == nullptr || found->pageQueryFailureAddress) {
+    if (found == nullptr || found->exited || found->pageQueryFailureAddress) {
         runs.assign(1, HTPageRun{start, end, 0});
         return;
     }

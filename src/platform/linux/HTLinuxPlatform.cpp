@@ -327,11 +327,13 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
     // doing and where its stack is.
     char state = stat->state;
     uint64_t startstack = stat->startstack;
+    auto taskFlags = stat->flags;
     thread_local HTProcBuffer threadBuffer;
     if (stat->isZombie() && readLiveThreadFile(pid, "stat", threadBuffer)) {
         if (std::optional<HTProcStat> thread = htParseProcStat(threadBuffer.view())) {
             state = thread->state;
             startstack = thread->startstack;
+            taskFlags = thread->flags;
         }
     }
 
@@ -347,6 +349,10 @@ bool HTLinuxPlatform::readBsdInfo(int32_t pid, proc_bsdinfo& info)
 
     info.pbi_flags = is64bit ? PROC_FLAG_LP64 : 0;
     info.pbi_status = htProcStatusForState(state);
+    // Killed or exiting, not yet a zombie: its memory may be gone already.
+    // (The main thread of a process whose other threads live on is exiting
+    // too: the flags are those of the thread that speaks for it.)
+    if ((taskFlags & HT_PF_EXITING) != 0 && info.pbi_status != SZOMB) info.pbi_flags |= PROC_FLAG_INEXIT;
     info.pbi_pid = static_cast<uint32_t>(stat->pid);
     info.pbi_ppid = static_cast<uint32_t>(stat->ppid);
     copyName(info.pbi_comm, sizeof(info.pbi_comm), stat->comm);
