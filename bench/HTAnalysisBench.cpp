@@ -47,10 +47,7 @@ uint64_t mix(uint64_t value)
 // memory with the top bit set, private anonymous memory with the top two
 // bits 01.
 uint64_t fileId(uint64_t file) { return 0x8000000000000000ull | (mix(file + 1) >> 1); }
-uint64_t anonymousId(uint64_t pid, uint64_t index)
-{
-    return 0x4000000000000000ull | (mix((pid << 20) | index) >> 2);
-}
+uint64_t anonymousId(uint64_t pid, uint64_t index) { return 0x4000000000000000ull | (mix((pid << 20) | index) >> 2); }
 
 class NullFormatter : public HTOutputFormatter {
 public:
@@ -85,18 +82,27 @@ void addLibrary(std::vector<HTScriptedRegion>& script, uint64_t library, uint64_
 {
     const std::string name = "lib" + std::to_string(library) + ".so";
     const uint64_t textPages = 16 + mix(library) % 240;
-    HTScriptedRegion text{.objectId = fileId(library), .size = textPages * kPage,
-                          .clean = (textPages / 2) * kPage, .shareMode = SM_COW, .segment = HTSegmentText,
-                          .name = std::string("mapped file"), .detailedName = name};
+    HTScriptedRegion text{.objectId = fileId(library),
+                          .size = textPages * kPage,
+                          .clean = (textPages / 2) * kPage,
+                          .shareMode = SM_COW,
+                          .segment = HTSegmentText,
+                          .name = std::string("mapped file"),
+                          .detailedName = name};
     script.push_back(text);
 
     // The data segment: copy-on-write, touched by most processes.
     const uint64_t dataPages = 1 + mix(library * 7) % 8;
     const uint64_t touched = mix(pid * 131 + library) % 4 == 0 ? 0 : 1 + mix(pid + library) % dataPages;
-    HTScriptedRegion data{.objectId = fileId(library), .offset = textPages * kPage, .size = dataPages * kPage,
-                          .dirty = touched * kPage, .clean = (dataPages - touched) * kPage,
-                          .shareMode = SM_COW, .segment = HTSegmentOther,
-                          .name = std::string("mapped file"), .detailedName = name};
+    HTScriptedRegion data{.objectId = fileId(library),
+                          .offset = textPages * kPage,
+                          .size = dataPages * kPage,
+                          .dirty = touched * kPage,
+                          .clean = (dataPages - touched) * kPage,
+                          .shareMode = SM_COW,
+                          .segment = HTSegmentOther,
+                          .name = std::string("mapped file"),
+                          .detailedName = name};
     script.push_back(data);
 
     if (withLinkedit) {
@@ -113,23 +119,29 @@ std::vector<HTScriptedRegion> scriptForProcess(uint64_t pid)
 {
     std::vector<HTScriptedRegion> script;
     script.reserve(kRegionsPerProcess);
-    for (uint64_t library = 0; library < kCommonLibraries; ++library)
-        addLibrary(script, library, pid, library < 10);
+    for (uint64_t library = 0; library < kCommonLibraries; ++library) addLibrary(script, library, pid, library < 10);
     for (uint64_t i = 0; i < 15; ++i)
         addLibrary(script, kCommonLibraries + mix(pid * 1000 + i) % kRareLibraries, pid, false);
 
     for (uint64_t i = 0; i < 5; ++i) {
         const uint64_t segment = 1000000 + (pid / kSharedMemoryGroupSize) * 8 + i;
-        script.push_back(HTScriptedRegion{.objectId = fileId(segment), .size = 16 * kPage, .dirty = 8 * kPage,
-                                          .clean = 8 * kPage, .shareMode = SM_SHARED,
+        script.push_back(HTScriptedRegion{.objectId = fileId(segment),
+                                          .size = 16 * kPage,
+                                          .dirty = 8 * kPage,
+                                          .clean = 8 * kPage,
+                                          .shareMode = SM_SHARED,
                                           .name = std::string("shared memory"),
                                           .detailedName = "/dev/shm/seg" + std::to_string(segment)});
     }
     for (uint64_t i = 0; i < 5; ++i) {
         const uint64_t piece = mix(pid * 17 + i) % kSharedCachePieces;
-        script.push_back(HTScriptedRegion{.objectId = 7, .size = 32 * kPage, .clean = 16 * kPage,
-                                          .shareMode = SM_COW, .name = std::string("shared cache"),
-                                          .inSharedCache = true, .start = 0x7f0000000000ull + piece * 32 * kPage});
+        script.push_back(HTScriptedRegion{.objectId = 7,
+                                          .size = 32 * kPage,
+                                          .clean = 16 * kPage,
+                                          .shareMode = SM_COW,
+                                          .name = std::string("shared cache"),
+                                          .inSharedCache = true,
+                                          .start = 0x7f0000000000ull + piece * 32 * kPage});
     }
 
     static const char* const kPrivateNames[] = {"VM_ALLOCATE", "sbrk", "stack", "named anonymous"};
@@ -137,9 +149,12 @@ std::vector<HTScriptedRegion> scriptForProcess(uint64_t pid)
         const uint64_t pages = 1 + mix(pid * 4096 + i) % 64;
         const uint64_t dirty = mix(pid + i * 3) % (pages + 1);
         const uint64_t swapped = mix(pid + i * 5) % 8 == 0 ? (pages - dirty) / 2 : 0;
-        script.push_back(HTScriptedRegion{.objectId = anonymousId(pid, i), .size = pages * kPage,
-                                          .dirty = dirty * kPage, .swapped = swapped * kPage,
-                                          .clean = (pages - dirty - swapped) * kPage, .shareMode = SM_PRIVATE,
+        script.push_back(HTScriptedRegion{.objectId = anonymousId(pid, i),
+                                          .size = pages * kPage,
+                                          .dirty = dirty * kPage,
+                                          .swapped = swapped * kPage,
+                                          .clean = (pages - dirty - swapped) * kPage,
+                                          .shareMode = SM_PRIVATE,
                                           .name = std::string(kPrivateNames[i % 4])});
     }
     return script;

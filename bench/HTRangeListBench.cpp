@@ -26,9 +26,8 @@ const HTMemoryTotals kDirtyPage{kPage, 0, 0, 0, 0, 0};
 void countInsertions(benchmark::State& state, int64_t insertions)
 {
     state.SetItemsProcessed(state.iterations() * insertions);
-    state.counters["per_insert"] = benchmark::Counter(static_cast<double>(insertions),
-                                                      benchmark::Counter::kIsIterationInvariantRate |
-                                                          benchmark::Counter::kInvert);
+    state.counters["per_insert"] = benchmark::Counter(
+        static_cast<double>(insertions), benchmark::Counter::kIsIterationInvariantRate | benchmark::Counter::kInvert);
 }
 
 // Page-sized ranges one page apart stay separate spans.

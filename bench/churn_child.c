@@ -125,8 +125,7 @@ int main(int argc, char** argv)
             ++started;
         }
         addNanoseconds(&next, 1000000000L / rate);
-        while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &next, NULL) == EINTR && !stopping) {
-        }
+        while (clock_nanosleep(CLOCK_MONOTONIC, TIMER_ABSTIME, &next, NULL) == EINTR && !stopping) {}
     }
 
     if (killed > 0) waitpid(killed, NULL, 0);

@@ -65,10 +65,7 @@ void HTHeft::setBreakDownPhysHeft(HTPlatform& platform, bool enabled)
     breakDownPhysHeftState.store(SwitchUnknown, std::memory_order_relaxed);
 }
 
-bool HTHeft::isSharingAnalysisDisabled()
-{
-    return sharingAnalysisDisabled.load(std::memory_order_relaxed);
-}
+bool HTHeft::isSharingAnalysisDisabled() { return sharingAnalysisDisabled.load(std::memory_order_relaxed); }
 
 void HTHeft::setSharingAnalysisDisabled(bool disabled)
 {
@@ -301,8 +298,7 @@ HTHeft::ProcessList HTHeft::_notHiddenProcesses() const
 HTHeft::ProcessList HTHeft::_processesBySortingPidDesc(const ProcessList& processes)
 {
     ProcessList sorted = processes;
-    std::stable_sort(sorted.begin(), sorted.end(),
-                     [](const auto& a, const auto& b) { return a->pid() > b->pid(); });
+    std::stable_sort(sorted.begin(), sorted.end(), [](const auto& a, const auto& b) { return a->pid() > b->pid(); });
     return sorted;
 }
 
@@ -602,14 +598,14 @@ void HTHeft::printOutputVerbose(bool verbose, bool summarize)
             for (const auto& group : *groups) {
                 static const ObjectSet kNoObjects;
                 const ObjectSet* objects = sharing->processGroupToObjects().find(*group);
-                const GroupTable& table = tableForGroup(*group, objects ? *objects : kNoObjects, *process,
-                                                        summarize, commonTables, scratchTable);
+                const GroupTable& table = tableForGroup(*group, objects ? *objects : kNoObjects, *process, summarize,
+                                                        commonTables, scratchTable);
                 for (const auto& formatter : outputFormatters_) {
                     if (group->count() == 1)
                         formatter->printProcessCategories(table.categories, table.total);
                     else
-                        formatter->printSharedCategories(table.categories, *group, *process,
-                                                         table.hasProcessView, table.total);
+                        formatter->printSharedCategories(table.categories, *group, *process, table.hasProcessView,
+                                                         table.total);
                 }
             }
         } else {

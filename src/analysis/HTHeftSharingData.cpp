@@ -21,8 +21,8 @@ const HTProcessGroupObjectMap::ObjectSet* HTProcessGroupObjectMap::find(const HT
     return found == index_.end() ? nullptr : &entries_[found->second].second;
 }
 
-HTProcessGroupObjectMap::ObjectSet& HTProcessGroupObjectMap::objectsForGroup(
-    const std::shared_ptr<HTProcessGroup>& group)
+HTProcessGroupObjectMap::ObjectSet&
+HTProcessGroupObjectMap::objectsForGroup(const std::shared_ptr<HTProcessGroup>& group)
 {
     auto [found, inserted] = index_.emplace(group.get(), entries_.size());
     if (inserted) entries_.emplace_back(group, ObjectSet{});

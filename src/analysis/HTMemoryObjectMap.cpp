@@ -10,10 +10,7 @@ namespace {
 constexpr size_t kMinimumSlots = 16;
 
 // Slots for `entries` objects at a load of at most three quarters.
-size_t slotCountFor(size_t entries)
-{
-    return std::bit_ceil(std::max(kMinimumSlots, entries + entries / 3 + 1));
-}
+size_t slotCountFor(size_t entries) { return std::bit_ceil(std::max(kMinimumSlots, entries + entries / 3 + 1)); }
 
 }  // namespace
 

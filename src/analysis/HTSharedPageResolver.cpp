@@ -9,12 +9,10 @@
 
 #include <algorithm>
 #include <array>
-#include <utility>
 #include <unordered_map>
+#include <utility>
 
 namespace {
-
-constexpr const char* kModule = "HTSharedPageResolver";
 
 // Objects of pages shared after a fork have identities of their own: the
 // top two bits 00 keep them apart from files (1x) and anonymous memory (01).
@@ -163,8 +161,9 @@ uint32_t HTSharedPageResolver::candidateOfOrdinal(uint32_t ordinal, uint32_t hin
     if (hint < candidates_.size() && candidates_[hint].firstOrdinal <= ordinal &&
         (hint + 1 == candidates_.size() || ordinal < candidates_[hint + 1].firstOrdinal))
         return hint;
-    auto after = std::upper_bound(candidates_.begin(), candidates_.end(), ordinal,
-                                  [](uint32_t value, const Candidate& candidate) { return value < candidate.firstOrdinal; });
+    auto after =
+        std::upper_bound(candidates_.begin(), candidates_.end(), ordinal,
+                         [](uint32_t value, const Candidate& candidate) { return value < candidate.firstOrdinal; });
     return static_cast<uint32_t>(after - candidates_.begin()) - 1;
 }
 

@@ -6,8 +6,8 @@
 
 // Stops the program when `condition` is false, naming the module and the
 // condition as the design states it (which may differ from the C++ text).
-#define HT_ASSERT(module, condition, text)                                   \
-    do {                                                                     \
+#define HT_ASSERT(module, condition, text)                                      \
+    do {                                                                        \
         if (!(condition)) htAssertFailed((module), (text), __FILE__, __LINE__); \
     } while (0)
 

@@ -13,7 +13,9 @@ struct HTError {
 
     HTError() = default;
     HTError(std::string errorDomain, int64_t errorCode, std::optional<std::string> text = std::nullopt)
-        : domain(std::move(errorDomain)), code(errorCode), description(std::move(text)) {}
+        : domain(std::move(errorDomain)), code(errorCode), description(std::move(text))
+    {
+    }
 };
 
 inline constexpr const char* HTHeftErrorDomain = "HTHeftError";

@@ -11,13 +11,13 @@
 // pages take longer than the work done on them, and a huge page takes the
 // fault of 512. Blocks below a huge page come from the ordinary heap; a
 // kernel without transparent huge pages gives small pages, as before.
-template <typename T>
+template<typename T>
 class HTHugePageAllocator {
 public:
     using value_type = T;
 
     HTHugePageAllocator() = default;
-    template <typename U>
+    template<typename U>
     HTHugePageAllocator(const HTHugePageAllocator<U>&) noexcept
     {
     }
@@ -42,7 +42,7 @@ public:
             ::munmap(block, mappedSize(bytes));
     }
 
-    template <typename U>
+    template<typename U>
     bool operator==(const HTHugePageAllocator<U>&) const noexcept
     {
         return true;

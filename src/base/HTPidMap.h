@@ -11,7 +11,7 @@
 // keeps the key's original position; erasing is O(n) and rare. Most maps
 // hold a few pids (the processes mapping one object), so a small map is
 // searched in place and only a larger one gets a hash index.
-template <typename Value>
+template<typename Value>
 class HTPidMap {
 public:
     using Entry = std::pair<int32_t, Value>;
@@ -65,7 +65,11 @@ public:
 
     size_t size() const { return entries_.size(); }
     bool empty() const { return entries_.empty(); }
-    void clear() { entries_.clear(); index_.clear(); }
+    void clear()
+    {
+        entries_.clear();
+        index_.clear();
+    }
 
     typename std::vector<Entry>::const_iterator begin() const { return entries_.begin(); }
     typename std::vector<Entry>::const_iterator end() const { return entries_.end(); }

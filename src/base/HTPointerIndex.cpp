@@ -10,10 +10,7 @@ namespace {
 constexpr size_t kMinimumSlots = 16;
 
 // Slots for `count` pointers at a load of at most three quarters.
-size_t slotCountFor(size_t count)
-{
-    return std::bit_ceil(std::max(kMinimumSlots, count + count / 3 + 1));
-}
+size_t slotCountFor(size_t count) { return std::bit_ceil(std::max(kMinimumSlots, count + count / 3 + 1)); }
 
 }  // namespace
 

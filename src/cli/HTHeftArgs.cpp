@@ -78,8 +78,8 @@ void resetOptionParser()
 
 const std::vector<std::string>& HTHeftArgs::sortColumns()
 {
-    static const std::vector<std::string> columns = {"Dirty",   "Swapped", "Clean",   "Reclaimable",
-                                                     "Wired",   "Regions", "Category"};
+    static const std::vector<std::string> columns = {"Dirty", "Swapped", "Clean",   "Reclaimable",
+                                                     "Wired", "Regions", "Category"};
     return columns;
 }
 
@@ -140,20 +140,35 @@ std::unique_ptr<HTHeftArgs> HTHeftArgs::initWithArgc(int argc, char** argv, HTEr
 bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
 {
     switch (option) {
-    case 'a': targetAll_ = true; break;
-    case 'j': JSONOutputFile_ = argument; break;
-    case 'h': return fail(error, HTHeftErrorCodeHelp);
-    case 't': targetChildren_ = true; break;
-    case 'p': potentialTargetProcesses_.add(argument); break;
-    case 'x': excludedPidsOrProcesses_.add(argument); break;
-    case 's': skipIdleExitClean_ = true; break;
+    case 'a':
+        targetAll_ = true;
+        break;
+    case 'j':
+        JSONOutputFile_ = argument;
+        break;
+    case 'h':
+        return fail(error, HTHeftErrorCodeHelp);
+    case 't':
+        targetChildren_ = true;
+        break;
+    case 'p':
+        potentialTargetProcesses_.add(argument);
+        break;
+    case 'x':
+        excludedPidsOrProcesses_.add(argument);
+        break;
+    case 's':
+        skipIdleExitClean_ = true;
+        break;
     case 'v':
         // The full listing replaces the summary; no option brings it back.
         spanlistLikeOutput_ = true;
         summarize_ = false;
         break;
-    case 'f': return _applyFormat(argument, error);
-    case OptionSort: return _applySort(argument, error);
+    case 'f':
+        return _applyFormat(argument, error);
+    case OptionSort:
+        return _applySort(argument, error);
     case 'y':
         std::fprintf(stderr, "WARNING: -y/--summary options are deprecated because summary is the default mode\n");
         break;
@@ -164,10 +179,18 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
         shouldGetPhysHeftBreakdown_ = false;
         didSetShouldGetPhysHeftBreakdown_ = true;
         break;
-    case 'w': textOptions_ |= HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide; break;
-    case OptionSwapped: textOptions_ |= HTTextOptionSwapped; break;
-    case OptionWired: textOptions_ |= HTTextOptionWired; break;
-    case OptionUnmapped: searchForUnmapped_ = true; break;
+    case 'w':
+        textOptions_ |= HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide;
+        break;
+    case OptionSwapped:
+        textOptions_ |= HTTextOptionSwapped;
+        break;
+    case OptionWired:
+        textOptions_ |= HTTextOptionWired;
+        break;
+    case OptionUnmapped:
+        searchForUnmapped_ = true;
+        break;
     default:
         // An unknown option or a missing argument: getopt_long has already
         // said which.
@@ -221,8 +244,9 @@ void HTHeftArgs::_settleUnmapped()
     if (!searchForUnmapped_) return;
     if (!shouldGetPhysHeftBreakdown_) {
         // Owners of VM objects are only known in the breakdown mode.
-        std::fprintf(stderr, "WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' "
-                             "does not support unmapped owned VM objects\n");
+        std::fprintf(stderr,
+                     "WARNING: ignoring '--unmapped' because the requested analysis mode '--vmObjectDirty' "
+                     "does not support unmapped owned VM objects\n");
         searchForUnmapped_ = false;
     } else if (targetAll_) {
         // -a analyses every process anyway.
@@ -233,8 +257,8 @@ void HTHeftArgs::_settleUnmapped()
 
 // --- target selection -------------------------------------------------------
 
-std::optional<std::vector<std::shared_ptr<HTProcess>>> HTHeftArgs::targetProcessesAndError(
-    const std::shared_ptr<HTPlatform>& platform, HTError* error)
+std::optional<std::vector<std::shared_ptr<HTProcess>>>
+HTHeftArgs::targetProcessesAndError(const std::shared_ptr<HTPlatform>& platform, HTError* error)
 {
     if (error) *error = HTError();
     HTProcess::ProcessMap result;
@@ -318,8 +342,7 @@ HTProcess::ProcessMap HTHeftArgs::_hiddenProcessesForUnmapped(const std::shared_
     return std::move(*others);
 }
 
-void HTHeftArgs::_addTargetProcesses(const std::shared_ptr<HTPlatform>& platform,
-                                     HTProcess::ProcessMap& result) const
+void HTHeftArgs::_addTargetProcesses(const std::shared_ptr<HTPlatform>& platform, HTProcess::ProcessMap& result) const
 {
     for (const auto& [pid, name] : targetPids_) {
         if (auto process = HTProcess::processWithPid(platform, pid)) {

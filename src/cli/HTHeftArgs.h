@@ -17,15 +17,15 @@
 // Codes of the "HTHeftError" domain: command-line and target-selection
 // failures.
 enum : int64_t {
-    HTHeftErrorCodeCreation = 0,          // the arguments object could not be made
-    HTHeftErrorCodeHelp = 1,              // -h / --help: usage, status 0
-    HTHeftErrorCodeFormat = 2,            // bad -f / --format value
-    HTHeftErrorCodeSort = 3,              // bad --sort value
-    HTHeftErrorCodePid = 4,               // --pid value without digits
-    HTHeftErrorCodeOption = 5,            // unknown option or missing argument
-    HTHeftErrorCodeSnapfileMode = 6,      // snapfiles disagree on the analysis mode
-    HTHeftErrorCodeSnapfileOpen = 7,      // an existing file that is no snapfile and no process
-    HTHeftErrorCodeNoTarget = 8,          // nothing to analyse
+    HTHeftErrorCodeCreation = 0,      // the arguments object could not be made
+    HTHeftErrorCodeHelp = 1,          // -h / --help: usage, status 0
+    HTHeftErrorCodeFormat = 2,        // bad -f / --format value
+    HTHeftErrorCodeSort = 3,          // bad --sort value
+    HTHeftErrorCodePid = 4,           // --pid value without digits
+    HTHeftErrorCodeOption = 5,        // unknown option or missing argument
+    HTHeftErrorCodeSnapfileMode = 6,  // snapfiles disagree on the analysis mode
+    HTHeftErrorCodeSnapfileOpen = 7,  // an existing file that is no snapfile and no process
+    HTHeftErrorCodeNoTarget = 8,      // nothing to analyse
 };
 
 // Everything the command line says: which processes to analyse and which
@@ -54,8 +54,8 @@ public:
     // the exclusions, -t, -a, --unmapped and -s applied. nullopt and an error
     // when the command line names nothing to analyse; an empty list when
     // nothing could be opened. Updates targetPids and the mode fields.
-    std::optional<std::vector<std::shared_ptr<HTProcess>>> targetProcessesAndError(
-        const std::shared_ptr<HTPlatform>& platform, HTError* error);
+    std::optional<std::vector<std::shared_ptr<HTProcess>>>
+    targetProcessesAndError(const std::shared_ptr<HTPlatform>& platform, HTError* error);
 
     // --- fields ----------------------------------------------------------
     bool targetChildren() const { return targetChildren_; }

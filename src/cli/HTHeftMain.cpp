@@ -68,8 +68,7 @@ void gather(HTHeft& heft, HTPlatform& platform)
 
 // The run itself; `stage` says what it is doing, for a message if memory
 // runs out.
-int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone,
-            const char*& stage)
+int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone, const char*& stage)
 {
     stage = "reading the command line";
     HTError error;

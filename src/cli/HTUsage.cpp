@@ -17,8 +17,8 @@ void printUsage()
         "\t-p, --proc, --pid [proc/pid] \t\ttarget pid or process (or interpret for -p)",
         "\t-x, --exclude [proc/pid] \t\texclude pid or process",
         "\t-s, --skip \t\t\t\tskip processes that are idle-exit clean",
-        "\t-v \t\t\t\t\tprint all regions and spanlist-like output of address space layout (default output is "
-        "a summary)",
+        ("\t-v \t\t\t\t\tprint all regions and spanlist-like output of address space layout (default output is "
+         "a summary)"),
         "\t-f, --format (bytes|formatted|pages) \tchange size formatting preference (default: formatted)",
     };
     static const char* const linesAfterSort[] = {

@@ -15,7 +15,6 @@ public:
     int64_t value() const { return value_; }
 
     bool isContainer() const override { return false; }
-    HTAuxJSONValue jsonRepresentation() const override;
 
 private:
     bool aggregate_;

@@ -5,7 +5,7 @@
 
 void HTAuxDataMap::set(const std::string& key, Value value)
 {
-    HT_ASSERT("HTAuxData", value != nullptr, "value != nil");
+    HT_ASSERT("HTAuxData", value != nullptr, "value != nullptr");
     auto found = index_.find(key);
     if (found != index_.end()) {
         entries_[found->second].second = std::move(value);
@@ -19,14 +19,6 @@ HTAuxDataMap::Value HTAuxDataMap::find(const std::string& key) const
 {
     auto found = index_.find(key);
     return found == index_.end() ? nullptr : entries_[found->second].second;
-}
-
-HTAuxJSONValue HTAuxDataMap::jsonRepresentation() const
-{
-    HTAuxJSONValue::Members members;
-    members.reserve(entries_.size());
-    for (const auto& [key, value] : entries_) members.emplace_back(key, value->jsonRepresentation());
-    return HTAuxJSONValue::makeObject(std::move(members));
 }
 
 std::shared_ptr<HTAuxDataMap> HTAuxDataMap::mergeWithData(const std::shared_ptr<HTAuxDataMap>& other) const

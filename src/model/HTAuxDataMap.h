@@ -26,7 +26,6 @@ public:
     std::vector<Entry>::const_iterator end() const { return entries_.end(); }
 
     bool isContainer() const override { return true; }
-    HTAuxJSONValue jsonRepresentation() const override;
 
     // This map merged with `other` (which may be null): what may be added up
     // is added up, the rest drops out. Null when no key is left.

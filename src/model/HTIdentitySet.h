@@ -14,7 +14,7 @@
 //
 // Not for concurrent use, even to read: a look-up may bring the index up to
 // date.
-template <typename T>
+template<typename T>
 class HTIdentitySet {
 public:
     using const_iterator = typename std::vector<std::shared_ptr<T>>::const_iterator;

@@ -169,10 +169,14 @@ bool HTMemoryRegion::eligibleForSubrangesUsingPageSize(uint64_t pageSize) const
 std::optional<std::string> HTMemoryRegion::describeRegionType(uint32_t tag)
 {
     switch (tag) {
-    case 100: return "shared memory";
-    case 101: return "kernel-provided (vdso/vvar)";
-    case 102: return "named anonymous";
-    default: return std::nullopt;
+    case 100:
+        return "shared memory";
+    case 101:
+        return "kernel-provided (vdso/vvar)";
+    case 102:
+        return "named anonymous";
+    default:
+        return std::nullopt;
     }
 }
 

@@ -14,10 +14,10 @@ class HTMemoryObject;
 
 // Segment codes, shared by regions, images and categories.
 inline constexpr uint8_t HTSegmentNotSet = 0;
-inline constexpr uint8_t HTSegmentNoImage = 1;    // a region that no image covers
-inline constexpr uint8_t HTSegmentText = 2;       // "__TEXT..."
-inline constexpr uint8_t HTSegmentOther = 3;      // any other "__" segment
-inline constexpr uint8_t HTSegmentLinkEdit = 4;   // "__LINKEDIT..."
+inline constexpr uint8_t HTSegmentNoImage = 1;   // a region that no image covers
+inline constexpr uint8_t HTSegmentText = 2;      // "__TEXT..."
+inline constexpr uint8_t HTSegmentOther = 3;     // any other "__" segment
+inline constexpr uint8_t HTSegmentLinkEdit = 4;  // "__LINKEDIT..."
 
 // The VM tag of a fake region: memory the process owns without mapping it.
 inline constexpr uint32_t HTFakeRegionTag = 0xFFFFFFFF;

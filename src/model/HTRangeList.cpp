@@ -252,10 +252,9 @@ HTRangeListNode* HTRangeList::_nodeBefore(uint64_t alignedStart, uint64_t pageSi
 
 void HTRangeList::addRange(uint64_t location, uint64_t length, uint64_t pageSize, const HTMemoryTotals& memoryTotal)
 {
-    const HTRangeListNode added{location,          length,
-                                memoryTotal.clean, memoryTotal.dirty,
-                                memoryTotal.swapped, memoryTotal.reclaimable,
-                                memoryTotal.wired, nullptr};
+    const HTRangeListNode added{
+        location,          length, memoryTotal.clean, memoryTotal.dirty, memoryTotal.swapped, memoryTotal.reclaimable,
+        memoryTotal.wired, nullptr};
     HTRangeListTally tally;
     _addRange(added, pageSize, tally);
 }

@@ -6,11 +6,20 @@ HTMemoryTotals htTotalsForPageKind(HTPageKind kind, uint64_t bytes, bool wired)
 {
     HTMemoryTotals totals;
     switch (kind) {
-    case HTPageKind::Dirty: totals.dirty = bytes; break;
-    case HTPageKind::Swapped: totals.swapped = bytes; break;
-    case HTPageKind::Reclaimable: totals.reclaimable = bytes; break;
-    case HTPageKind::Clean: totals.clean = bytes; break;
-    case HTPageKind::None: break;
+    case HTPageKind::Dirty:
+        totals.dirty = bytes;
+        break;
+    case HTPageKind::Swapped:
+        totals.swapped = bytes;
+        break;
+    case HTPageKind::Reclaimable:
+        totals.reclaimable = bytes;
+        break;
+    case HTPageKind::Clean:
+        totals.clean = bytes;
+        break;
+    case HTPageKind::None:
+        break;
     }
     if (wired && kind != HTPageKind::None) totals.wired = bytes;
     return totals;

@@ -26,7 +26,7 @@ size_t wellFormedSequenceLength(const unsigned char* p, size_t left)
     const unsigned char lead = p[0];
     if (lead < 0x80) return 1;
     size_t length;
-    unsigned char low = 0x80;   // the range of the second byte
+    unsigned char low = 0x80;  // the range of the second byte
     unsigned char high = 0xBF;
     if (lead >= 0xC2 && lead <= 0xDF) {
         length = 2;

@@ -70,13 +70,11 @@ public:
     void endProcessHeader(const HTProcess& process) override {}
     void printProcessCategories(const HTCategoryMap& categories, const HTMemoryTotals& total) override;
     void printSharedCategories(const HTCategoryMap& categories, const HTProcessGroup& sharedWith,
-                               const HTProcess& forProcess, bool hasProcessView,
-                               const HTMemoryTotals& total) override;
+                               const HTProcess& forProcess, bool hasProcessView, const HTMemoryTotals& total) override;
     void printProcessAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
     void printProcessesWithWarnings(const ProcessList& processesWithWarnings, const ProcessList& processesWithErrors,
                                     const std::vector<std::string>& globalErrors) override;
-    void printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total,
-                                bool hadErrors) override;
+    void printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total, bool hadErrors) override;
     void printGlobalAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
     void end() override;
 

@@ -50,7 +50,7 @@ uint64_t pagesForSize(uint64_t bytes, uint64_t pageSize)
 // before b".
 using CategoryOrder = std::function<bool(const HTCategoryMap::Entry&, const HTCategoryMap::Entry&)>;
 
-template <typename Field>
+template<typename Field>
 CategoryOrder descendingBy(Field field)
 {
     return [field](const HTCategoryMap::Entry& a, const HTCategoryMap::Entry& b) {
@@ -77,8 +77,7 @@ CategoryOrder orderForSortColumn(const std::string& sort)
     }
     if (sort == "Swapped") return descendingBy([](const HTMemoryCategory& c) { return c.totalSwappedSize(); });
     if (sort == "Clean") return descendingBy([](const HTMemoryCategory& c) { return c.totalCleanSize(); });
-    if (sort == "Reclaimable")
-        return descendingBy([](const HTMemoryCategory& c) { return c.totalReclaimableSize(); });
+    if (sort == "Reclaimable") return descendingBy([](const HTMemoryCategory& c) { return c.totalReclaimableSize(); });
     if (sort == "Wired") return descendingBy([](const HTMemoryCategory& c) { return c.totalWiredSize(); });
     if (sort == "Regions") return descendingBy([](const HTMemoryCategory& c) { return c.totalRegions(); });
     if (sort == "Category") {
@@ -115,10 +114,14 @@ std::string HTOutputFormatterText::formattedStringForSize(uint64_t size) const
 size_t HTOutputFormatterText::formatSize(uint64_t size, char* out) const
 {
     switch (summaryFormat_) {
-    case HTTextFormatBytes: return htBytesText(size, out);
-    case HTTextFormatFormatted: return htHumanizedText(size, out);
-    case HTTextFormatPages: return htPagesText(pagesForSize(size, pageSize_), out);
-    default: HT_FATAL(kModule, "Unhandled summary format");
+    case HTTextFormatBytes:
+        return htBytesText(size, out);
+    case HTTextFormatFormatted:
+        return htHumanizedText(size, out);
+    case HTTextFormatPages:
+        return htPagesText(pagesForSize(size, pageSize_), out);
+    default:
+        HT_FATAL(kModule, "Unhandled summary format");
     }
 }
 
@@ -168,11 +171,8 @@ HTOutputFormatterText::ColumnWidths HTOutputFormatterText::columnWidths() const
     const bool narrow = summaryFormat_ == HTTextFormatFormatted;
     const int extra = narrow ? 11 : 14;
     return ColumnWidths{
-        narrow ? 7 : 11,
-        swappedColumnName_ ? extra : 0,
-        narrow ? 11 : 14,
-        narrow ? 13 : 14,
-        wiredColumnName_ ? extra : 0,
+        narrow ? 7 : 11,  swappedColumnName_ ? extra : 0, narrow ? 11 : 14,
+        narrow ? 13 : 14, wiredColumnName_ ? extra : 0,
     };
 }
 
@@ -232,8 +232,8 @@ void HTOutputFormatterText::printSizeRow(uint64_t dirty, uint64_t swapped, uint6
     if (wiredColumnName_) end = putSize(end, wired, w.wired);
     *end++ = ' ';
     char count[24];
-    end = putRightAligned(end, std::string_view(count, std::to_chars(count, count + sizeof(count), regions).ptr - count),
-                          10);
+    end = putRightAligned(
+        end, std::string_view(count, std::to_chars(count, count + sizeof(count), regions).ptr - count), 10);
     line_.append(figures, end);
     line_.append("    ");
     htAppendTerminalSafe(line_, name);
@@ -264,8 +264,8 @@ void HTOutputFormatterText::_printCategories(const HTCategoryMap& categories)
 void HTOutputFormatterText::_printTotalFooter(const HTMemoryTotals& total)
 {
     printDashRow();
-    printSizeRow(total.dirty + total.swapped, total.swapped, total.clean, total.reclaimable, total.wired,
-                 total.regions, "TOTAL", std::nullopt);
+    printSizeRow(total.dirty + total.swapped, total.swapped, total.clean, total.reclaimable, total.wired, total.regions,
+                 "TOTAL", std::nullopt);
 }
 
 void HTOutputFormatterText::_printPhysHeftBreakdownEnabled()

@@ -13,9 +13,9 @@
 class HTAuxDataMap;
 
 // Option bits of the text report.
-inline constexpr int64_t HTTextOptionWired = 1;     // show the wired column
-inline constexpr int64_t HTTextOptionSwapped = 2;   // show the swapped column
-inline constexpr int64_t HTTextOptionWide = 4;      // never shorten names
+inline constexpr int64_t HTTextOptionWired = 1;    // show the wired column
+inline constexpr int64_t HTTextOptionSwapped = 2;  // show the swapped column
+inline constexpr int64_t HTTextOptionWide = 4;     // never shorten names
 
 // How the text report writes a size.
 inline constexpr int64_t HTTextFormatBytes = 0;
@@ -62,13 +62,11 @@ public:
     void endProcessHeader(const HTProcess& process) override;
     void printProcessCategories(const HTCategoryMap& categories, const HTMemoryTotals& total) override;
     void printSharedCategories(const HTCategoryMap& categories, const HTProcessGroup& sharedWith,
-                               const HTProcess& forProcess, bool hasProcessView,
-                               const HTMemoryTotals& total) override;
+                               const HTProcess& forProcess, bool hasProcessView, const HTMemoryTotals& total) override;
     void printProcessAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
     void printProcessesWithWarnings(const ProcessList& processesWithWarnings, const ProcessList& processesWithErrors,
                                     const std::vector<std::string>& globalErrors) override;
-    void printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total,
-                                bool hadErrors) override;
+    void printSummaryCategories(const HTCategoryMap& categories, const HTMemoryTotals& total, bool hadErrors) override;
     void printGlobalAuxData(const std::shared_ptr<HTAuxDataMap>& auxData) override;
     void end() override;
 

@@ -41,10 +41,17 @@ size_t printableSequenceLength(std::string_view text)
 void appendEscape(std::string& out, uint8_t byte)
 {
     switch (byte) {
-    case '\n': out.append("\\n"); return;
-    case '\t': out.append("\\t"); return;
-    case '\r': out.append("\\r"); return;
-    default: break;
+    case '\n':
+        out.append("\\n");
+        return;
+    case '\t':
+        out.append("\\t");
+        return;
+    case '\r':
+        out.append("\\r");
+        return;
+    default:
+        break;
     }
     constexpr char kHex[] = "0123456789ABCDEF";
     const char escape[] = {'\\', 'x', kHex[byte >> 4], kHex[byte & 0xF]};

@@ -11,11 +11,17 @@ std::string htMachErrorString(kern_return_t code)
         return strerror_r(code & 0xffff, text, sizeof(text));
     }
     switch (code) {
-    case KERN_SUCCESS: return "success";
-    case KERN_INVALID_ADDRESS: return "invalid address";
-    case KERN_INVALID_ARGUMENT: return "invalid argument";
-    case KERN_FAILURE: return "failure";
-    case MACH_SEND_INVALID_DEST: return "process is gone";
-    default: return "unknown error";
+    case KERN_SUCCESS:
+        return "success";
+    case KERN_INVALID_ADDRESS:
+        return "invalid address";
+    case KERN_INVALID_ARGUMENT:
+        return "invalid argument";
+    case KERN_FAILURE:
+        return "failure";
+    case MACH_SEND_INVALID_DEST:
+        return "process is gone";
+    default:
+        return "unknown error";
     }
 }

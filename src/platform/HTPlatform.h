@@ -74,21 +74,31 @@ public:
     // VM_REGION_SUBMAP_INFO_COUNT_64 in and the words filled out.
     // KERN_INVALID_ADDRESS: no region at or above the address;
     // MACH_SEND_INVALID_DEST: the process has gone away.
-    virtual kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
-                                                 uint32_t* depth, vm_region_submap_info_64* info,
-                                                 uint32_t* count) { return KERN_FAILURE; }
+    virtual kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
+                                                 vm_region_submap_info_64* info, uint32_t* count)
+    {
+        return KERN_FAILURE;
+    }
     // The top-level region at or after *address (flavor
     // VM_REGION_BASIC_INFO_64).
     virtual kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
-                                         vm_region_basic_info_64* info, uint32_t* count) { return KERN_FAILURE; }
+                                         vm_region_basic_info_64* info, uint32_t* count)
+    {
+        return KERN_FAILURE;
+    }
     // VM_PURGABLE_GET_STATE of the object at the address.
-    virtual kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
-                                                   int32_t* state) { return KERN_FAILURE; }
+    virtual kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state)
+    {
+        return KERN_FAILURE;
+    }
     // One disposition per page of [address, address + size); *count is the
     // room in and the entries filled out. KERN_INVALID_ARGUMENT when the
     // process has gone away.
     virtual kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
-                                                   int32_t* dispositions, uint64_t* count) { return KERN_FAILURE; }
+                                                   int32_t* dispositions, uint64_t* count)
+    {
+        return KERN_FAILURE;
+    }
     // The runs of pages in [start, end) that may be resident or swapped out,
     // in address order, into `runs`; page-aligned bounds. A backend that
     // cannot tell answers the whole range. Page walks use it to step over
@@ -111,8 +121,10 @@ public:
     // identities in two processes are one page. Identities are below
     // HTMaxPageIdentity. KERN_INVALID_ARGUMENT when the process has gone
     // away.
-    virtual kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
-                                               uint64_t* identities) { return KERN_FAILURE; }
+    virtual kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages, uint64_t* identities)
+    {
+        return KERN_FAILURE;
+    }
     // The path of the file mapped at the address: the bytes written (not
     // terminated), 0 when none.
     virtual int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) { return 0; }
@@ -131,7 +143,10 @@ public:
     // Calls `callback` once per image of the task; false when the task's
     // image list cannot be opened.
     virtual bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
-                                  const std::function<void(const HTPlatformImage&)>& callback) { return false; }
+                                  const std::function<void(const HTPlatformImage&)>& callback)
+    {
+        return false;
+    }
     // The path with symbolic links resolved; nullopt when it cannot be.
     virtual std::optional<std::string> realpath(const std::string& path) { return std::nullopt; }
     // The platform's text for a VM tag, when it has one.

@@ -22,8 +22,7 @@ void setDisposition(int signo, void (*disposition)(int))
 
 }  // namespace
 
-HTSignalSource::HTSignalSource(int signo, std::function<void()> handler)
-    : signo_(signo), handler_(std::move(handler))
+HTSignalSource::HTSignalSource(int signo, std::function<void()> handler) : signo_(signo), handler_(std::move(handler))
 {
     sigemptyset(&previousMask_);
 }

@@ -4,10 +4,10 @@
 #include <cerrno>
 #include <pthread.h>
 #include <sys/resource.h>
-#include <system_error>
-#include <utility>
 #include <sys/syscall.h>
+#include <system_error>
 #include <unistd.h>
+#include <utility>
 
 namespace {
 

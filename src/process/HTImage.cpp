@@ -58,10 +58,7 @@ uint8_t HTImage::segmentForName(const std::string& name)
     return HTSegmentNotSet;
 }
 
-void HTImage::setName(const std::string& value)
-{
-    setName(std::make_shared<const std::string>(value));
-}
+void HTImage::setName(const std::string& value) { setName(std::make_shared<const std::string>(value)); }
 
 void HTImage::setName(std::shared_ptr<const std::string> value)
 {
@@ -70,10 +67,7 @@ void HTImage::setName(std::shared_ptr<const std::string> value)
     if (segment != HTSegmentNotSet) segment_ = segment;
 }
 
-void HTImage::setOwnerPath(const std::string& value)
-{
-    ownerPath_ = std::make_shared<const std::string>(value);
-}
+void HTImage::setOwnerPath(const std::string& value) { ownerPath_ = std::make_shared<const std::string>(value); }
 
 void HTImage::setOwnerPath(std::shared_ptr<const std::string> value)
 {
@@ -86,15 +80,14 @@ std::vector<std::shared_ptr<HTImage>> HTImage::gatherImages(HTPlatform& platform
     std::vector<std::shared_ptr<HTImage>> images;
     platform.forEachTaskImage(task, kImageListFlags, [&](const HTPlatformImage& image) {
         std::shared_ptr<const std::string> ownerPath;
-        bool inSharedRegion = image.baseAddress >= sharedRegionBase &&
-                              image.baseAddress - sharedRegionBase < sharedRegionSize;
+        bool inSharedRegion =
+            image.baseAddress >= sharedRegionBase && image.baseAddress - sharedRegionBase < sharedRegionSize;
         if (inSharedRegion) {
             const std::string* interned = HTStringTable::pathTable().internPath(image.path, image.baseAddress);
-            ownerPath = interned != nullptr ? sharedString(interned)
-                                            : std::make_shared<const std::string>(image.path);
+            ownerPath = interned != nullptr ? sharedString(interned) : std::make_shared<const std::string>(image.path);
         } else {
             std::optional<std::string> resolved = platform.realpath(image.path);
-            ownerPath = std::make_shared<const std::string>(resolved ? std::move(*resolved) : image.path);
+            ownerPath = std::make_shared<const std::string>(resolved ? *std::move(resolved) : image.path);
         }
         // The image's segments share one owner-path string.
         for (const HTPlatformImageSegment& segment : image.segments) {
@@ -106,7 +99,8 @@ std::vector<std::shared_ptr<HTImage>> HTImage::gatherImages(HTPlatform& platform
             images.push_back(std::move(record));
         }
     });
-    std::sort(images.begin(), images.end(),
-              [](const std::shared_ptr<HTImage>& a, const std::shared_ptr<HTImage>& b) { return a->start() < b->start(); });
+    std::sort(images.begin(), images.end(), [](const std::shared_ptr<HTImage>& a, const std::shared_ptr<HTImage>& b) {
+        return a->start() < b->start();
+    });
     return images;
 }

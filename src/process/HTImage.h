@@ -47,8 +47,7 @@ public:
     // other paths are resolved through symbolic links. Empty when the
     // platform cannot list the task's images.
     static std::vector<std::shared_ptr<HTImage>> gatherImages(HTPlatform& platform, HTTaskPort& task,
-                                                              uint64_t sharedRegionBase,
-                                                              uint64_t sharedRegionSize);
+                                                              uint64_t sharedRegionBase, uint64_t sharedRegionSize);
 
     // A string of the run's string tables, shared without being owned.
     static std::shared_ptr<const std::string> sharedString(const std::string* interned);

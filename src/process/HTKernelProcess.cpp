@@ -11,12 +11,6 @@ bool HTKernelProcess::initWithBsdInfo(const proc_bsdinfo& info)
     return true;
 }
 
-bool HTKernelProcess::_populateTask()
-{
-    return true;
-}
+bool HTKernelProcess::_populateTask() { return true; }
 
-bool HTKernelProcess::_isAlive()
-{
-    return true;
-}
+bool HTKernelProcess::_isAlive() { return true; }

@@ -74,10 +74,7 @@ std::optional<std::vector<proc_bsdinfo>> listAllProcesses(HTPlatform& platform)
 }
 
 // A fixed-size, possibly unterminated name field of a record.
-std::string boundedString(const char* field, size_t capacity)
-{
-    return std::string(field, strnlen(field, capacity));
-}
+std::string boundedString(const char* field, size_t capacity) { return std::string(field, strnlen(field, capacity)); }
 
 }  // namespace
 
@@ -181,8 +178,8 @@ std::string HTProcess::_nameForBsdInfoCommName(const proc_bsdinfo& info)
     return "Unknown";
 }
 
-std::optional<HTProcess::ProcessMap> HTProcess::allProcessesExcludingPids(
-    const std::shared_ptr<HTPlatform>& platform, const std::set<int32_t>& excludedPids)
+std::optional<HTProcess::ProcessMap> HTProcess::allProcessesExcludingPids(const std::shared_ptr<HTPlatform>& platform,
+                                                                          const std::set<int32_t>& excludedPids)
 {
     auto records = listAllProcesses(*platform);
     if (!records) return std::nullopt;
@@ -210,8 +207,9 @@ std::optional<HTProcess::ProcessMap> HTProcess::allProcessesExcludingPids(
     return processes;
 }
 
-std::optional<HTProcess::PidDescriptionMap> HTProcess::pidsForStringDescriptions(
-    HTPlatform& platform, const std::vector<std::string>& descriptions, std::vector<std::string>* errors)
+std::optional<HTProcess::PidDescriptionMap>
+HTProcess::pidsForStringDescriptions(HTPlatform& platform, const std::vector<std::string>& descriptions,
+                                     std::vector<std::string>* errors)
 {
     auto records = listAllProcesses(platform);
     if (!records) {
@@ -245,8 +243,7 @@ std::optional<HTProcess::PidDescriptionMap> HTProcess::pidsForStringDescriptions
     return pids;
 }
 
-std::optional<std::vector<int32_t>> HTProcess::childPidsForPids(HTPlatform& platform,
-                                                                const std::vector<int32_t>& pids)
+std::optional<std::vector<int32_t>> HTProcess::childPidsForPids(HTPlatform& platform, const std::vector<int32_t>& pids)
 {
     auto records = listAllProcesses(platform);
     if (!records) return std::nullopt;
@@ -261,8 +258,7 @@ std::optional<std::vector<int32_t>> HTProcess::childPidsForPids(HTPlatform& plat
         std::vector<int32_t> next;
         for (const auto& info : *records) {
             int32_t pid = static_cast<int32_t>(info.pbi_pid);
-            if (parents.count(static_cast<int32_t>(info.pbi_ppid)) && visited.insert(pid).second)
-                next.push_back(pid);
+            if (parents.count(static_cast<int32_t>(info.pbi_ppid)) && visited.insert(pid).second) next.push_back(pid);
         }
         result.insert(result.end(), frontier.begin(), frontier.end());
         frontier = std::move(next);
@@ -285,8 +281,7 @@ std::optional<int32_t> HTProcess::pidForText(const std::string& text)
     errno = 0;
     char* end = nullptr;
     long long value = std::strtoll(text.c_str(), &end, 10);
-    if (end == text.c_str() || *end != '\0' || errno == ERANGE || value < 0 || value > INT32_MAX)
-        return std::nullopt;
+    if (end == text.c_str() || *end != '\0' || errno == ERANGE || value < 0 || value > INT32_MAX) return std::nullopt;
     return static_cast<int32_t>(value);
 }
 

@@ -97,8 +97,7 @@ public:
     static std::optional<PidDescriptionMap> pidsForStringDescriptions(HTPlatform& platform,
                                                                       const std::vector<std::string>& descriptions,
                                                                       std::vector<std::string>* errors);
-    static std::optional<std::vector<int32_t>> childPidsForPids(HTPlatform& platform,
-                                                                const std::vector<int32_t>& pids);
+    static std::optional<std::vector<int32_t>> childPidsForPids(HTPlatform& platform, const std::vector<int32_t>& pids);
     static ProcessMap removeIdleExitCleanProcessesFrom(const ProcessMap& processes);
 
     // The program-wide list of errors not tied to one process. Written on

@@ -24,8 +24,7 @@ const std::string* HTStringTable::intern(std::string_view value, size_t firstSlo
         const std::string* held = slot.load(std::memory_order_acquire);
         if (held == nullptr) {
             if (candidate == nullptr) candidate = new std::string(value);
-            if (slot.compare_exchange_strong(held, candidate, std::memory_order_release,
-                                             std::memory_order_acquire)) {
+            if (slot.compare_exchange_strong(held, candidate, std::memory_order_release, std::memory_order_acquire)) {
                 return candidate;
             }
             // Another thread filled the slot first: `held` is its string,
@@ -48,10 +47,7 @@ const std::string* HTStringTable::internPath(std::string_view path, uint64_t bas
     return intern(path, pathSlotForAddress(baseAddress), PathProbeCount);
 }
 
-const std::string* HTStringTable::internSegmentName(std::string_view name)
-{
-    return intern(name, 0, slotCount_);
-}
+const std::string* HTStringTable::internSegmentName(std::string_view name) { return intern(name, 0, slotCount_); }
 
 HTStringTable& HTStringTable::pathTable()
 {

@@ -71,7 +71,7 @@ uint64_t roundUp(uint64_t value, uint64_t unit) { return (value + unit - 1) / un
 bool countsAsDirty(int32_t disposition)
 {
     return (disposition & VM_PAGE_QUERY_PAGE_DIRTY) ||
-           ((disposition & VM_PAGE_QUERY_PAGE_PRESENT) && !(disposition & VM_PAGE_QUERY_PAGE_EXTERNAL));
+        ((disposition & VM_PAGE_QUERY_PAGE_PRESENT) && !(disposition & VM_PAGE_QUERY_PAGE_EXTERNAL));
 }
 
 HTPageKind pageKind(int32_t disposition, int32_t purgeState)
@@ -91,7 +91,10 @@ HTPageKind pageKind(int32_t disposition, int32_t purgeState)
 uint64_t mixIdentity(uint64_t id, uint64_t salt) { return htMix(id ^ (salt * 0x9e3779b97f4a7c15ULL)); }
 
 // strerror_r comes in two flavours; both give the text here.
-[[maybe_unused]] const char* errnoText(int result, const char* buffer) { return result == 0 ? buffer : "Unknown error"; }
+[[maybe_unused]] const char* errnoText(int result, const char* buffer)
+{
+    return result == 0 ? buffer : "Unknown error";
+}
 [[maybe_unused]] const char* errnoText(const char* result, const char*) { return result; }
 
 // Running out of file descriptors stops every process alike: it is said once
@@ -100,10 +103,7 @@ constexpr const char* kOutOfDescriptors = "Too many open files: raise the open-f
 std::atomic<bool> outOfDescriptorsSaid{false};
 
 // The errno a platform call's failure carries; 0 for a kernel code.
-int errnoOf(kern_return_t code)
-{
-    return (code & ~0xffff) == HT_KERN_ERRNO_BASE ? code & 0xffff : 0;
-}
+int errnoOf(kern_return_t code) { return (code & ~0xffff) == HT_KERN_ERRNO_BASE ? code & 0xffff : 0; }
 
 // The ledger template, read once per run by whichever process asks first.
 struct LedgerTemplate {
@@ -239,19 +239,13 @@ bool HTUserProcess::_populateTask()
     return false;
 }
 
-bool HTUserProcess::_isAlive()
-{
-    return true;
-}
+bool HTUserProcess::_isAlive() { return true; }
 
 // A live process on Linux maps no shared library cache, whatever its
 // architecture: the Linux code's empty shared region keeps every mapping on
 // the ordinary path. The Mach codes stay for snapshots taken on a system
 // that has such a cache.
-int HTUserProcess::_platformCode()
-{
-    return HTPlatformLinux;
-}
+int HTUserProcess::_platformCode() { return HTPlatformLinux; }
 
 bool HTUserProcess::_setSharedRegionFromPlatform(int platformCode)
 {
@@ -281,10 +275,7 @@ void HTUserProcess::_forgetLedgerTemplate()
     ledgerTemplateState = LedgerTemplate{};
 }
 
-void HTUserProcess::_forgetOutOfDescriptors()
-{
-    outOfDescriptorsSaid = false;
-}
+void HTUserProcess::_forgetOutOfDescriptors() { outOfDescriptorsSaid = false; }
 
 void HTUserProcess::_gatherLedgers()
 {
@@ -351,8 +342,7 @@ std::optional<HTOwnedVmObjectMap> HTUserProcess::_gatherOwnedVmObjects()
         length += kOwnedVmObjectsHeadroom;
         buffer.resize(length);
         answered = length;
-        if (platform().sysctlbyname(kOwnedVmObjectsSetting, buffer.data(), &answered, &target, sizeof(target)) !=
-            0) {
+        if (platform().sysctlbyname(kOwnedVmObjectsSetting, buffer.data(), &answered, &target, sizeof(target)) != 0) {
             _addErrnoWarningWithDescription(kOwnedVmObjectsSetting);
             return std::nullopt;
         }
@@ -392,16 +382,15 @@ HTUserProcess::HTCallFailure HTUserProcess::_failureIfGone()
 HTUserProcess::HTCallFailure HTUserProcess::_processMachVMError(kern_return_t code, kern_return_t expectedOnExit)
 {
     const HTCallFailure failure = code == expectedOnExit ? _failureIfGone() : HTCallFailure::Failed;
-    const char* suffix = failure == HTCallFailure::Zombie   ? " (zombie)"
-                         : failure == HTCallFailure::Exited ? " (process exited)"
-                                                            : "";
+    const char* suffix = failure == HTCallFailure::Zombie ? " (zombie)"
+        : failure == HTCallFailure::Exited                ? " (process exited)"
+                                                          : "";
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s%s", displayString().c_str(),
                   platform().mach_error_string(code).c_str(), suffix);
     // Once a process has gone, every later call fails alike.
     if (failure != HTCallFailure::Failed) {
-        if (std::find(warnings().begin(), warnings().end(), message) == warnings().end())
-            warnings().push_back(message);
+        if (std::find(warnings().begin(), warnings().end(), message) == warnings().end()) warnings().push_back(message);
     } else {
         const std::vector<std::string> recorded = errors();
         if (std::find(recorded.begin(), recorded.end(), message) == recorded.end()) addError(message);
@@ -428,9 +417,9 @@ void HTUserProcess::_addErrnoWarningWithDescription(const std::string& descripti
     // A process that is gone is the common case on a busy machine: said in
     // words, and on standard error in the one line of such processes.
     const HTCallFailure failure = error == ESRCH ? _failureIfGone() : HTCallFailure::Failed;
-    const char* reason = failure == HTCallFailure::Exited   ? "process exited"
-                         : failure == HTCallFailure::Zombie ? "zombie"
-                                                            : errorText;
+    const char* reason = failure == HTCallFailure::Exited ? "process exited"
+        : failure == HTCallFailure::Zombie                ? "zombie"
+                                                          : errorText;
     char message[1024];
     std::snprintf(message, sizeof(message), "%s: %s - %s", displayString().c_str(), description.c_str(), reason);
     warnings().push_back(message);
@@ -476,8 +465,9 @@ void HTUserProcess::_bailOutOfWalk(kern_return_t code)
 {
     const HTCallFailure failure = _processMachVMError(code, MACH_SEND_INVALID_DEST);
     if (!_saidOutOfDescriptors(errnoOf(code)))
-        _addFailureNotice(failure, std::string(kBailOutNotice) + " (its memory map could not be read: " +
-                                       platform().mach_error_string(code) + ")");
+        _addFailureNotice(failure,
+                          std::string(kBailOutNotice) +
+                              " (its memory map could not be read: " + platform().mach_error_string(code) + ")");
 }
 
 void HTUserProcess::enumerateRegions(const RegionCallback& callback)
@@ -663,8 +653,9 @@ bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uin
             if (result != KERN_SUCCESS) {
                 const HTCallFailure failure = _processMachVMError(result, KERN_INVALID_ARGUMENT);
                 if (!_saidOutOfDescriptors(errnoOf(result)))
-                    _addFailureNotice(failure, "%s: its pages could not be read (" +
-                                                   platform().mach_error_string(result) + "); data may be incomplete");
+                    _addFailureNotice(failure,
+                                      "%s: its pages could not be read (" + platform().mach_error_string(result) +
+                                          "); data may be incomplete");
                 return false;
             }
             block(dispositions, 0, std::min(count, wanted), (address - start) / page);
@@ -800,8 +791,8 @@ void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageT
                 addUniformRun(first, filled, uniform);
                 return;
             }
-            const bool named = list && platform().sharedPageIdentities(*task_, from + first * page, filled,
-                                                                       identities) == KERN_SUCCESS;
+            const bool named = list &&
+                platform().sharedPageIdentities(*task_, from + first * page, filled, identities) == KERN_SUCCESS;
             for (uint64_t i = 0; i < filled; ++i) {
                 const HTPageKind kind = pageKind(dispositions[i], purgeState);
                 if (kind == HTPageKind::None) continue;
@@ -820,7 +811,7 @@ void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageT
 }
 
 std::shared_ptr<HTMemoryRegion> HTUserProcess::_splitCopiedPages(HTMemoryRegion& region,
-                                                                const vm_region_submap_info_64& info)
+                                                                 const vm_region_submap_info_64& info)
 {
     const uint64_t copied = pageSize() * info.pages_shared_now_private;
     const uint64_t swapped = region.swappedSize();
@@ -856,8 +847,8 @@ std::shared_ptr<HTMemoryRegion> HTUserProcess::_splitCopiedPages(HTMemoryRegion&
     return copies;
 }
 
-void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies,
-                                  const vm_region_submap_info_64& info, int32_t purgeState)
+void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies, const vm_region_submap_info_64& info,
+                                  int32_t purgeState)
 {
     const uint64_t page = pageSize();
     const bool hidden = hiddenFromDisplay();
@@ -866,8 +857,7 @@ void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies
     // Private memory that other processes map as well, after a fork, is
     // named page by page so that the analysis counts each page once.
     const bool mayShare = !sharingDisabled && !hidden && info.ref_count > 1 && info.share_mode == SM_COW &&
-                          (copies != nullptr || info.external_pager == 0) &&
-                          region.size() / page < HTSharedPageList::kNoIdentity;
+        (copies != nullptr || info.external_pager == 0) && region.size() / page < HTSharedPageList::kNoIdentity;
     const bool identify = mayShare && platform().canIdentifySharedPages();
     if (mayShare && !identify) sharedPagesUnidentified_ = true;
 
@@ -947,8 +937,8 @@ void HTUserProcess::_gatherMemoryData()
             // memory is not per region; what is resident and not reusable is
             // dirty there.
             const uint64_t dirtyPages = info.external_pager == 0 && !breakDown
-                                            ? (resident > reusable ? resident - reusable : 0)
-                                            : info.pages_dirtied;
+                ? (resident > reusable ? resident - reusable : 0)
+                : info.pages_dirtied;
             region->setDirtySize(page * dirtyPages);
             region->setReclaimableSize(page * reusable);
             region->setSwappedSize(page * static_cast<uint64_t>(info.pages_swapped_out));

@@ -60,8 +60,8 @@ public:
     // Receives the dispositions of one stretch of pages: one per page, or
     // null when every page has the disposition `uniform`; how many pages
     // there are, and the index of the first in the pages asked for.
-    using DispositionChunkCallback = std::function<void(const int32_t* dispositions, int32_t uniform, uint64_t count,
-                                                        uint64_t firstPage)>;
+    using DispositionChunkCallback =
+        std::function<void(const int32_t* dispositions, int32_t uniform, uint64_t count, uint64_t firstPage)>;
 
     // Page dispositions are queried in chunks of at most this many pages.
     static constexpr uint64_t kDispositionChunkPages = 4096;

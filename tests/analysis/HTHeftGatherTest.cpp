@@ -27,10 +27,7 @@ namespace {
 using namespace std::chrono_literals;
 using HTHeftGatherTest = HTAnalysisTest;
 
-int currentThreadNice()
-{
-    return getpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid)));
-}
+int currentThreadNice() { return getpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid))); }
 
 bool sigintBlockedHere()
 {

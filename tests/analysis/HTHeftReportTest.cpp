@@ -28,7 +28,9 @@ std::vector<std::string> linesStartingWith(const std::vector<std::string>& log, 
 
 TEST_F(HTHeftReportTest, OneProcessWithItsListing)
 {
-    HTScriptedRegion library{.objectId = 2, .clean = kPage, .name = std::string("lib"),
+    HTScriptedRegion library{.objectId = 2,
+                             .clean = kPage,
+                             .name = std::string("lib"),
                              .detailedName = std::string("a.so")};
     auto p10 = process(10, {dirtyPages(1, 2, "heap"), library});
     p10->setAuxData(auxWith(5));
@@ -53,21 +55,18 @@ TEST_F(HTHeftReportTest, TwoFormattersReceiveEachStageInTurn)
 
     const std::string heap = "[heap(d2 s0 c0 r0 w0 n1)] total d2 s0 c0 r0 w0 n1";
     const std::string shm = "[shm(d1 s0 c0 r0 w0 n2)] total d1 s0 c0 r0 w0 n2";
-    const std::string summary =
-        "summary [shm(d1 s0 c0 r0 w0 n2), heap(d2 s0 c0 r0 w0 n1)] total d3 s0 c0 r0 w0 n3";
-    EXPECT_THAT(*log, ElementsAre(
-        // Only X lists regions; the listing comes first, in heft order.
-        "X listing 10 regions=2", "X listing 20 regions=1",
-        "X header 10", "X heft 10 3", "X endHeader 10", "Y header 10", "Y heft 10 3", "Y endHeader 10",
-        "X private " + heap, "Y private " + heap,
-        "X shared {20,10} for 10 " + shm, "Y shared {20,10} for 10 " + shm,
-        "X aux none", "Y aux none",
-        "X header 20", "X heft 20 1", "X endHeader 20", "Y header 20", "Y heft 20 1", "Y endHeader 20",
-        // All of p20's memory is shared: no private table.
-        "X shared {20,10} for 20 " + shm, "Y shared {20,10} for 20 " + shm,
-        "X aux none", "Y aux none",
-        "X diagnostics warnings{} errors{}", "Y diagnostics warnings{} errors{}",
-        "X " + summary, "X globalAux none", "X end", "Y " + summary, "Y globalAux none", "Y end"));
+    const std::string summary = "summary [shm(d1 s0 c0 r0 w0 n2), heap(d2 s0 c0 r0 w0 n1)] total d3 s0 c0 r0 w0 n3";
+    EXPECT_THAT(*log,
+                ElementsAre(
+                    // Only X lists regions; the listing comes first, in heft order.
+                    "X listing 10 regions=2", "X listing 20 regions=1", "X header 10", "X heft 10 3", "X endHeader 10",
+                    "Y header 10", "Y heft 10 3", "Y endHeader 10", "X private " + heap, "Y private " + heap,
+                    "X shared {20,10} for 10 " + shm, "Y shared {20,10} for 10 " + shm, "X aux none", "Y aux none",
+                    "X header 20", "X heft 20 1", "X endHeader 20", "Y header 20", "Y heft 20 1", "Y endHeader 20",
+                    // All of p20's memory is shared: no private table.
+                    "X shared {20,10} for 20 " + shm, "Y shared {20,10} for 20 " + shm, "X aux none", "Y aux none",
+                    "X diagnostics warnings{} errors{}", "Y diagnostics warnings{} errors{}", "X " + summary,
+                    "X globalAux none", "X end", "Y " + summary, "Y globalAux none", "Y end"));
 }
 
 TEST_F(HTHeftReportTest, SharedTablesShowEachProcessItsOwnView)

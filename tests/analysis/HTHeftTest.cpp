@@ -17,10 +17,7 @@ HTMemoryObject* objectOf(const HTProcess& process, size_t region)
     return process.memoryRegions().at(region)->memoryObject().get();
 }
 
-std::string pidsOf(const HTProcessGroup& group)
-{
-    return HTRecordingFormatter::pids(group.processes());
-}
+std::string pidsOf(const HTProcessGroup& group) { return HTRecordingFormatter::pids(group.processes()); }
 
 TEST_F(HTHeftRoutingTest, ObjectIdsAreSharedWithinOneMapOnly)
 {
@@ -50,7 +47,10 @@ TEST_F(HTHeftRoutingTest, ObjectIdsAreSharedWithinOneMapOnly)
 TEST_F(HTHeftRoutingTest, TouchedCopyOnWriteMemoryBelongsToItsProcess)
 {
     auto cow = [](uint64_t dirty, uint64_t swapped) {
-        return HTScriptedRegion{.objectId = 0x300, .dirty = dirty, .swapped = swapped, .clean = kPage - dirty - swapped,
+        return HTScriptedRegion{.objectId = 0x300,
+                                .dirty = dirty,
+                                .swapped = swapped,
+                                .clean = kPage - dirty - swapped,
                                 .shareMode = SM_COW};
     };
     auto p10 = process(10, {cow(kPage, 0)});

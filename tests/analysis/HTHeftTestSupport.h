@@ -16,7 +16,6 @@ constexpr uint64_t kPage = 4096;
 // The driver with its internal steps opened up for tests.
 class HTHeftProbe : public HTHeft {
 public:
-    using HTHeft::HTHeft;
     using HTHeft::_addProcess;
     using HTHeft::_buildProcessToHeftMap;
     using HTHeft::_calculateHeftForProcess;
@@ -27,6 +26,7 @@ public:
     using HTHeft::_processesBySortingPidDesc;
     using HTHeft::_sharingData;
     using HTHeft::_totalForCategories;
+    using HTHeft::HTHeft;
 };
 
 // Scripted processes on a fake platform. The analysis switches and the
@@ -63,8 +63,7 @@ protected:
     }
 
     // The driver, gathered and reported to one recording formatter.
-    std::vector<std::string> report(const HTHeft::ProcessList& processes, bool verbose = false,
-                                    bool summarize = false)
+    std::vector<std::string> report(const HTHeft::ProcessList& processes, bool verbose = false, bool summarize = false)
     {
         auto log = std::make_shared<HTRecordingFormatter::Log>();
         auto heft = gathered(processes);

@@ -25,7 +25,7 @@ std::shared_ptr<HTProcessGroup> groupOf(std::initializer_list<int32_t> pids)
 TEST(HTProcessGroupTest, HashAndDescriptionFollowTheMembers)
 {
     EXPECT_EQ(HTProcessGroup().hash(), 19u);
-    EXPECT_EQ(groupOf({5})->hash(), 698u);  // 19 * 37 ^ 5
+    EXPECT_EQ(groupOf({5})->hash(), 698u);                     // 19 * 37 ^ 5
     EXPECT_EQ(groupOf({-1})->hashValue(), 703u ^ UINT64_MAX);  // the pid is sign-extended
 
     // A member comes once, whatever process object brings its pid.

@@ -29,7 +29,7 @@ public:
     static std::string totals(const HTMemoryTotals& t)
     {
         return "d" + pages(t.dirty) + " s" + pages(t.swapped) + " c" + pages(t.clean) + " r" + pages(t.reclaimable) +
-               " w" + pages(t.wired) + " n" + std::to_string(t.regions);
+            " w" + pages(t.wired) + " n" + std::to_string(t.regions);
     }
     static std::string categories(const HTCategoryMap& map)
     {
@@ -37,10 +37,10 @@ public:
         for (const auto& [key, category] : map) {
             if (text.size() > 1) text += ", ";
             text += key + "(" +
-                    totals({category->totalDirtySize(), category->totalSwappedSize(), category->totalCleanSize(),
-                            category->totalReclaimableSize(), category->totalWiredSize(),
-                            static_cast<uint32_t>(category->totalRegions())}) +
-                    ")";
+                totals({category->totalDirtySize(), category->totalSwappedSize(), category->totalCleanSize(),
+                        category->totalReclaimableSize(), category->totalWiredSize(),
+                        static_cast<uint32_t>(category->totalRegions())}) +
+                ")";
         }
         return text + "]";
     }

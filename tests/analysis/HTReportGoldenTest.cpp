@@ -36,8 +36,8 @@ class HTReportGoldenTest : public HTAnalysisTest {
 protected:
     // Reports the processes as text, and as JSON too when `json` names its
     // expected report, and compares both with the expected reports.
-    void expectReports(const HTHeft::ProcessList& processes, const std::string& text, int64_t format,
-                       int64_t options, const std::string& sort, bool verbose = false, const std::string& json = "")
+    void expectReports(const HTHeft::ProcessList& processes, const std::string& text, int64_t format, int64_t options,
+                       const std::string& sort, bool verbose = false, const std::string& json = "")
     {
         char dir[] = "/tmp/htgoldenXXXXXX";
         ASSERT_NE(mkdtemp(dir), nullptr);
@@ -47,7 +47,8 @@ protected:
             auto heft = gathered(processes);
             heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(format, options, sort,
                                                                              /*breakDownPhysHeft=*/false, out.file()));
-            if (!json.empty()) heft->addOutputFormatter(HTOutputFormatterJSON::initWithPath(path, false, kPage, nullptr));
+            if (!json.empty())
+                heft->addOutputFormatter(HTOutputFormatterJSON::initWithPath(path, false, kPage, nullptr));
             heft->printOutputVerbose(verbose, /*summarize=*/false);
         }
         expectReport(text, out.take());
@@ -108,9 +109,10 @@ TEST_F(HTReportGoldenTest, VerboseListingAndRowsSortedByCategory)
     // name. Only the low 40 bits of the object id are listed.
     HTScriptedRegion stack = region(5, "stack", 0, 0, 0, nullptr, 0x30000);
     stack.size = kPage;
-    auto p10 = process(10, {region(4, "IOKit", 2, 0, 0, nullptr, 0x10000),
-                            region(3, "mapped file", 1, 1, 0, "/lib/x.so", 0x20000), stack,
-                            region(0x12300000002, "untagged", 3, 0, 0, nullptr, 0x40000)});
+    auto p10 =
+        process(10,
+                {region(4, "IOKit", 2, 0, 0, nullptr, 0x10000), region(3, "mapped file", 1, 1, 0, "/lib/x.so", 0x20000),
+                 stack, region(0x12300000002, "untagged", 3, 0, 0, nullptr, 0x40000)});
     expectReports({p10}, "verbose-by-category.txt", HTTextFormatFormatted, 0, "Category", /*verbose=*/true);
 }
 

@@ -107,7 +107,7 @@ public:
         opened_.wait(lock, [this] { return open_; });
     }
     // False when the gate stayed shut for `timeout`.
-    template <typename Duration>
+    template<typename Duration>
     bool waitFor(Duration timeout)
     {
         std::unique_lock<std::mutex> lock(mutex_);
@@ -125,7 +125,8 @@ class HTGatedProcess : public HTScriptedProcess {
 public:
     HTGatedProcess(std::shared_ptr<HTPlatform> platform, int32_t pid, std::vector<HTScriptedRegion> script,
                    std::shared_ptr<HTGate> gate, std::function<void()> onEntry = nullptr)
-        : HTScriptedProcess(std::move(platform), pid, std::move(script)), gate_(std::move(gate)),
+        : HTScriptedProcess(std::move(platform), pid, std::move(script)),
+          gate_(std::move(gate)),
           onEntry_(std::move(onEntry))
     {
     }

@@ -47,7 +47,8 @@ protected:
             process.regions.push_back(region);
             for (size_t i = 0; i < pages; ++i) {
                 process.dispositions[region.start + i * kPage] = kDirtyPage;
-                if (identities[first + i] != 0) process.pageIdentities[region.start + i * kPage] = identities[first + i];
+                if (identities[first + i] != 0)
+                    process.pageIdentities[region.start + i * kPage] = identities[first + i];
             }
         }
     }
@@ -108,7 +109,8 @@ TEST_F(HTSharedPageResolverTest, PagesCountOnceAndShowWithExactlyTheirMappers)
 
     using Tables = std::map<std::set<int32_t>, uint64_t>;
     EXPECT_EQ(tablesOf(*heft, *processes[0]),
-              (Tables{{{kParent}, 2 * kPage}, {{kParent, kFirstChild, kSecondChild}, 3 * kPage},
+              (Tables{{{kParent}, 2 * kPage},
+                      {{kParent, kFirstChild, kSecondChild}, 3 * kPage},
                       {{kParent, kFirstChild}, kPage}}));
     EXPECT_EQ(tablesOf(*heft, *processes[2]),
               (Tables{{{kSecondChild}, 3 * kPage}, {{kParent, kFirstChild, kSecondChild}, 3 * kPage}}));
@@ -178,7 +180,9 @@ TEST_F(HTSharedPageResolverTest, PrivateFileMappingKeepsTheFilesPagesApartFromIt
         region.info.object_id_full = 0x8000000000000077;
         region.path = "/data/table";
         process.regions.push_back(region);
-        process.dispositions = {{kStart, kCopied}, {kStart + kPage, kCopied}, {kStart + 2 * kPage, kFilePage},
+        process.dispositions = {{kStart, kCopied},
+                                {kStart + kPage, kCopied},
+                                {kStart + 2 * kPage, kFilePage},
                                 {kStart + 3 * kPage, kFilePage}};
     }
     HTHeft::ProcessList processes = created({kParent, kFirstChild});

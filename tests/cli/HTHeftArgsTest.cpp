@@ -59,8 +59,8 @@ TEST(HTHeftArgsTest, DefaultsWithoutOptions)
 
 TEST(HTHeftArgsTest, LaterOptionsOverrideAndSetsAccumulate)
 {
-    Parsed parsed = parse({"-a", "-t", "-s", "-j", "first.json", "--json", "second.json", "-f", "pages",
-                           "--format", "bytes", "-x", "7", "--exclude", "name", "-x", "7", "-v"});
+    Parsed parsed = parse({"-a", "-t", "-s", "-j", "first.json", "--json", "second.json", "-f", "pages", "--format",
+                           "bytes", "-x", "7", "--exclude", "name", "-x", "7", "-v"});
     ASSERT_TRUE(parsed.args);
     const HTHeftArgs& args = *parsed.args;
     EXPECT_TRUE(args.targetAll());
@@ -169,8 +169,8 @@ TEST(HTHeftArgsTest, UnmappedIsSettledAfterAllOptions)
     EXPECT_EQ(parsed.standardError, "");
 
     // The mode given after --unmapped still wins.
-    for (std::vector<std::string> arguments : {std::vector<std::string>{"--vmObjectDirty", "--unmapped"},
-                                               {"--unmapped", "--vmObjectDirty", "-a"}}) {
+    for (std::vector<std::string> arguments :
+         {std::vector<std::string>{"--vmObjectDirty", "--unmapped"}, {"--unmapped", "--vmObjectDirty", "-a"}}) {
         parsed = parse(arguments);
         ASSERT_TRUE(parsed.args);
         EXPECT_FALSE(parsed.args->searchForUnmapped());
@@ -194,8 +194,7 @@ TEST(HTHeftArgsTest, OperandsAndProcOptionsFormOneOrderedSet)
     // --pid between two --proc options must not be mistaken for one.
     Parsed parsed = parse({"7", "x", "-p", "9", "7", "--proc", "x", "--pid", "12", "--proc", "y", "9", "z"});
     ASSERT_TRUE(parsed.args);
-    EXPECT_EQ(parsed.args->potentialTargetProcesses().values(),
-              (std::vector<std::string>{"9", "x", "y", "7", "z"}));
+    EXPECT_EQ(parsed.args->potentialTargetProcesses().values(), (std::vector<std::string>{"9", "x", "y", "7", "z"}));
     EXPECT_EQ(pidsOf(*parsed.args), (std::vector<int32_t>{12}));
 
     // -p does not read its argument as a number.

@@ -116,8 +116,9 @@ TEST_F(HTHeftMainTest, WhatBefellTheProcessesFollowsTheGatheringEscaped)
     zombie.regionFailureIndex = 0;
     Run result = run({"43"});
     EXPECT_EQ(result.status, 0);
-    EXPECT_EQ(result.standardError, "evil\\n\\x1B[7m [43]: had exited and was not yet reaped (a zombie) when read; "
-                                    "marked \"(zombie)\" in the report\n");
+    EXPECT_EQ(result.standardError,
+              "evil\\n\\x1B[7m [43]: had exited and was not yet reaped (a zombie) when read; "
+              "marked \"(zombie)\" in the report\n");
 }
 
 }  // namespace

@@ -45,8 +45,9 @@ std::string optionParserDiagnostic(std::vector<std::string> arguments)
 {
     arguments.insert(arguments.begin(), "heft");
     std::vector<char*> argv = argvOf(arguments);
-    const struct option longOptions[] = {
-        {"json", required_argument, nullptr, 'j'}, {"sort", required_argument, nullptr, 260}, {nullptr, 0, nullptr, 0}};
+    const struct option longOptions[] = {{"json", required_argument, nullptr, 'j'},
+                                         {"sort", required_argument, nullptr, 260},
+                                         {nullptr, 0, nullptr, 0}};
     optind = 0;
     opterr = 1;
     testing::internal::CaptureStderr();
@@ -142,8 +143,8 @@ TEST(HTCommandLineE2ETest, UnprivilegedRunsNeedingRootStop)
                 {{"-a", "--unmapped"}, 1, std::string(kRedundant) + "Must run as root.\n", ""},
                 {{"1"},
                  1,
-                 AnyOf(unreadable, AllOf(StartsWith(unanalyzed), HasSubstr(" [1]: could not be opened: "),
-                                         EndsWith(kNoProcesses))),
+                 AnyOf(unreadable,
+                       AllOf(StartsWith(unanalyzed), HasSubstr(" [1]: could not be opened: "), EndsWith(kNoProcesses))),
                  ""}},
                runHeftAsNobody);
 }

@@ -209,9 +209,10 @@ public:
         std::string swaps = readFile("/proc/swaps");
         available_ = swaps.find('\n') + 1 < swaps.size();
         if (available_) return;
-        Outcome made = runProgram("/bin/sh", {"sh", "-ec",
-                                              "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
-                                              "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
+        Outcome made = runProgram("/bin/sh",
+                                  {"sh", "-ec",
+                                   "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
+                                   "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
         path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
         enabled_ = available_ = made.status == 0;
         reason_ = made.standardError;
@@ -311,9 +312,9 @@ inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread 
     std::string rollup = readFile(base + "/smaps_rollup");
     std::string status = readFile(base + "/status");
     EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;
-    uint64_t pages = proportionally ? kernelField(rollup, "Pss_Dirty") + kernelField(rollup, "SwapPss")
-                                    : kernelField(rollup, "Private_Dirty") + kernelField(rollup, "Shared_Dirty") +
-                                          kernelField(rollup, "Swap");
+    uint64_t pages = proportionally
+        ? kernelField(rollup, "Pss_Dirty") + kernelField(rollup, "SwapPss")
+        : kernelField(rollup, "Private_Dirty") + kernelField(rollup, "Shared_Dirty") + kernelField(rollup, "Swap");
     return pages + kernelField(status, "VmPTE");
 }
 

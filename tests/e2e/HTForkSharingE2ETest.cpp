@@ -97,8 +97,8 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
     const PreforkLayout layout{.pagedOut = 16 * kMiB};
     ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout));
     expectSummaryIsTheFamilysDistinctMemory();
-    EXPECT_NE(text_.standardOutput.find("\nSummary Heft: " +
-                                        std::to_string(number(report_["summary"]["total"], "dirty")) + " B\n"),
+    EXPECT_NE(text_.standardOutput.find(
+                  "\nSummary Heft: " + std::to_string(number(report_["summary"]["total"], "dirty")) + " B\n"),
               std::string::npos);
 
     // Untouched by the children, the shared mapping is the five's; the slice
@@ -135,8 +135,12 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingCountsItsCopiesAndItsFilePagesOnc
     for (bool writtenBack : {true, false}) {
         const char* name = writtenBack ? "written-back.bin" : "still-dirty.bin";
         SCOPED_TRACE(name);
-        const PreforkLayout layout{.shared = 4 * kMiB, .slice = 64 * 1024, .own = kMiB, .after = kMiB,
-                                   .file = "written", .path = directory_.file(name)};
+        const PreforkLayout layout{.shared = 4 * kMiB,
+                                   .slice = 64 * 1024,
+                                   .own = kMiB,
+                                   .after = kMiB,
+                                   .file = "written",
+                                   .path = directory_.file(name)};
         ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout, writtenBack));
 
         // The parent wrote the first half (its copies, which the children
@@ -162,8 +166,13 @@ TEST_F(HTForkSharingE2ETest, SummaryHoldsTheFilePagesOnlyTheParentHasResident)
     // A read-only private mapping has no copies, so fork leaves the child's
     // page tables for it empty: only the parent has the file's pages mapped,
     // in two runs with a gap between them.
-    const PreforkLayout layout{.shared = kMiB, .children = 1, .slice = 64 * 1024, .own = kMiB, .after = kMiB,
-                               .file = "read", .path = directory_.file("read.bin")};
+    const PreforkLayout layout{.shared = kMiB,
+                               .children = 1,
+                               .slice = 64 * 1024,
+                               .own = kMiB,
+                               .after = kMiB,
+                               .file = "read",
+                               .path = directory_.file("read.bin")};
     ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout));
     const std::string category = "mapped file " + layout.path;
 
@@ -201,8 +210,7 @@ TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceTh
         << outcome.standardError;
     size_t first = outcome.standardError.find(kUnidentifiedNotice);
     EXPECT_NE(first, std::string::npos) << outcome.standardError;
-    EXPECT_EQ(outcome.standardError.find(kUnidentifiedNotice, first + 1), std::string::npos)
-        << outcome.standardError;
+    EXPECT_EQ(outcome.standardError.find(kUnidentifiedNotice, first + 1), std::string::npos) << outcome.standardError;
     rapidjson::Document report;
     ASSERT_TRUE(loadReport(path, report));
     EXPECT_EQ(processIn(report, 1), nullptr);

@@ -84,8 +84,8 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     EXPECT_GE(number(*untagged, "regions"), 4u);
 
     // The text report of the same run shows the same figures.
-    EXPECT_NE(text.standardOutput.find(" [" + child.pidString() + "]: 64-bit\tHeft: " +
-                                       std::to_string(number(*process, "heft")) + " B ("),
+    EXPECT_NE(text.standardOutput.find(" [" + child.pidString() +
+                                       "]: 64-bit\tHeft: " + std::to_string(number(*process, "heft")) + " B ("),
               std::string::npos)
         << text.standardOutput;
     expectTextRowShows(text.standardOutput, kUntagged, untagged);

@@ -106,8 +106,8 @@ static char* mapFilePrivately(const char* how, const char* path)
  * all have, the parent writes AFTER bytes of new memory. Printed: the shared
  * mapping, the file mapping (0 for none), the parent's new memory, the
  * MADV_PAGEOUT errno, then the children's pids. */
-static void prefork(size_t shared, int count, size_t slice, size_t own, size_t after, size_t pagedOut,
-                    const char* how, const char* path)
+static void prefork(size_t shared, int count, size_t slice, size_t own, size_t after, size_t pagedOut, const char* how,
+                    const char* path)
 {
     char* pages = mapWritten(shared);
     int pageoutError = pagedOut > 0 && madvise(pages, pagedOut, MADV_PAGEOUT) != 0 ? errno : 0;
@@ -134,8 +134,10 @@ static void prefork(size_t shared, int count, size_t slice, size_t own, size_t a
     for (int i = 0; i < count;) {
         struct pollfd wait = {ready[0], POLLIN, 0};
         char byte;
-        if (poll(&wait, 1, 100) == 1 && read(ready[0], &byte, 1) == 1) ++i;
-        else if (waitpid(-1, NULL, WNOHANG) > 0) exit(5);
+        if (poll(&wait, 1, 100) == 1 && read(ready[0], &byte, 1) == 1)
+            ++i;
+        else if (waitpid(-1, NULL, WNOHANG) > 0)
+            exit(5);
     }
     char* extra = mapWritten(after);
     printf("%lu %lu %lu %d", (unsigned long)pages, (unsigned long)file, (unsigned long)extra, pageoutError);

@@ -1,5 +1,5 @@
-#include "analysis/HTHeft.h"
 #include "model/HTMemoryObject.h"
+#include "analysis/HTHeft.h"
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"

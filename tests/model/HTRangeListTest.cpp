@@ -1,5 +1,5 @@
-#include "model/HTMemoryRegion.h"
 #include "model/HTRangeList.h"
+#include "model/HTMemoryRegion.h"
 
 #include <gtest/gtest.h>
 
@@ -71,16 +71,20 @@ TEST(HTRangeList, ExactSpansAreCutWhereTheyDifferAndJoinedWhereAlike)
          {{0, P, 2, 0, 0}, {4 * P, 2 * P, 3, 0, 0}, {8 * P, P, 1, 3, 5}}},
         {"touching, alike", {{0, P, dirty(P)}, {P, P, dirty(P)}}, {{0, 2 * P, 2 * P, 0, 0}}},
         {"touching, other kinds", {{0, P, dirty(P)}, {P, P, clean(P)}}, {{0, P, P, 0, 0}, {P, P, 0, P, 0}}},
-        {"touching, one wired", {{0, 2 * P, dirtyWired}, {2 * P, P, dirty(P)}},
+        {"touching, one wired",
+         {{0, 2 * P, dirtyWired}, {2 * P, P, dirty(P)}},
          {{0, 2 * P, 2 * P, 0, 2 * P}, {2 * P, P, P, 0, 0}}},
         {"touching, inexact: totals add",
          {{0, 2 * P, dirty(P)}, {2 * P, P, HTMemoryTotals{1, 2, 3, 4, 5, 0}}},
          {{0, 2 * P, P, 0, 0}, {2 * P, P, 1, 3, 5}}},
-        {"unaligned ends on neighbouring pages", {{P + 50, 100, dirty(7)}, {10, 90, dirty(5)}},
+        {"unaligned ends on neighbouring pages",
+         {{P + 50, 100, dirty(7)}, {10, 90, dirty(5)}},
          {{10, 90, 5, 0, 0}, {P + 50, 100, 7, 0, 0}}},
-        {"overlapping kinds split three ways", {{0, 4 * P, dirty(4 * P)}, {2 * P, 4 * P, clean(4 * P)}},
+        {"overlapping kinds split three ways",
+         {{0, 4 * P, dirty(4 * P)}, {2 * P, 4 * P, clean(4 * P)}},
          {{0, 2 * P, 2 * P, 0, 0}, {2 * P, 2 * P, 2 * P, 2 * P, 0}, {4 * P, 2 * P, 0, 2 * P, 0}}},
-        {"a range inside a span cuts it", {{0, 6 * P, dirty(6 * P)}, {2 * P, P, clean(P)}},
+        {"a range inside a span cuts it",
+         {{0, 6 * P, dirty(6 * P)}, {2 * P, P, clean(P)}},
          {{0, 2 * P, 2 * P, 0, 0}, {2 * P, P, P, P, 0}, {3 * P, 3 * P, 3 * P, 0, 0}}},
         {"an empty view changes no span, fills the gaps",
          {{P, P, dirty(P)}, {3 * P, P, clean(P)}, {0, 5 * P, {}}},
@@ -89,7 +93,10 @@ TEST(HTRangeList, ExactSpansAreCutWhereTheyDifferAndJoinedWhereAlike)
          {{0, P, dirty(P)}, {2 * P, P, dirty(P)}, {10 * P, P, dirty(P)}, {P, P, dirty(P)}},
          {{0, 3 * P, 3 * P, 0, 0}, {10 * P, P, P, 0, 0}}},
         {"a range spanning several spans joins them",
-         {{0, P, dirty(P)}, {2 * P, P, dirty(P)}, {4 * P, P, dirty(P)}, {10 * P, P, dirty(P)},
+         {{0, P, dirty(P)},
+          {2 * P, P, dirty(P)},
+          {4 * P, P, dirty(P)},
+          {10 * P, P, dirty(P)},
           {P, 4 * P, dirty(4 * P)}},
          {{0, 5 * P, 5 * P, 0, 0}, {10 * P, P, P, 0, 0}}},
         {"a cut piece joins the alike span next to it",
@@ -120,31 +127,47 @@ TEST(HTRangeList, SharedPagesCountOnce)
         {"a smaller view of the same pages", {{0, 4 * P, dirty(4 * P)}, {0, 4 * P, dirty(2 * P)}}, dirty(4 * P), false},
         {"two kinds, two views",
          {{0, 4 * P, HTMemoryTotals{4 * P, P, 0, 0, 0, 0}}, {0, 4 * P, HTMemoryTotals{2 * P, 2 * P, 0, 0, 0, 0}}},
-         HTMemoryTotals{4 * P, 2 * P, 0, 0, 0, 0}, false},
-        {"views disagree about a page: it counts in both kinds", {{0, 2 * P, dirty(2 * P)}, {0, 2 * P, clean(2 * P)}},
-         HTMemoryTotals{2 * P, 0, 2 * P, 0, 0, 0}, true},
+         HTMemoryTotals{4 * P, 2 * P, 0, 0, 0, 0},
+         false},
+        {"views disagree about a page: it counts in both kinds",
+         {{0, 2 * P, dirty(2 * P)}, {0, 2 * P, clean(2 * P)}},
+         HTMemoryTotals{2 * P, 0, 2 * P, 0, 0, 0},
+         true},
         {"runs, then a view with none resident",
-         {{0, 20 * P, clean(20 * P)}, {30 * P, 21 * P, clean(21 * P)}, {0, 100 * P, {}}}, clean(41 * P), true},
+         {{0, 20 * P, clean(20 * P)}, {30 * P, 21 * P, clean(21 * P)}, {0, 100 * P, {}}},
+         clean(41 * P),
+         true},
         {"a view with none resident, then runs",
-         {{0, 100 * P, {}}, {0, 20 * P, clean(20 * P)}, {30 * P, 21 * P, clean(21 * P)}}, clean(41 * P), true},
+         {{0, 100 * P, {}}, {0, 20 * P, clean(20 * P)}, {30 * P, 21 * P, clean(21 * P)}},
+         clean(41 * P),
+         true},
         {"runs, then an inexact view over them",
          {{0, 20 * P, clean(20 * P)}, {30 * P, 21 * P, clean(21 * P)}, {0, 100 * P, dirty(5 * P)}},
-         HTMemoryTotals{5 * P, 0, 41 * P, 0, 0, 0}, false},
+         HTMemoryTotals{5 * P, 0, 41 * P, 0, 0, 0},
+         false},
         // S = 4P over the two spans, of which at most 4P lie on the range.
         {"an inexact view over two inexact spans",
-         {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(3 * P)}}, dirty(4 * P), false},
+         {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(3 * P)}},
+         dirty(4 * P),
+         false},
         {"an inexact view larger than the spans can hold of it",
-         {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(7 * P)}}, dirty(7 * P), false},
+         {{0, 4 * P, dirty(2 * P)}, {8 * P, 4 * P, dirty(2 * P)}, {0, 12 * P, dirty(7 * P)}},
+         dirty(7 * P),
+         false},
         // At most 4P of the span's 6P lie on the range's pages.
-        {"an inexact view over part of an inexact span", {{0, 8 * P, dirty(6 * P)}, {4 * P, 8 * P, dirty(6 * P)}},
-         dirty(8 * P), false},
+        {"an inexact view over part of an inexact span",
+         {{0, 8 * P, dirty(6 * P)}, {4 * P, 8 * P, dirty(6 * P)}},
+         dirty(8 * P),
+         false},
         // The span has 2P dirty somewhere; the run's 4P on it may include them.
         {"a run over an inexact span and past it",
          {{0, 8 * P, HTMemoryTotals{2 * P, 0, P, 0, 0, 0}}, {4 * P, 8 * P, dirty(8 * P)}},
-         HTMemoryTotals{8 * P, 0, P, 0, 0, 0}, false},
+         HTMemoryTotals{8 * P, 0, P, 0, 0, 0},
+         false},
         {"runs of the same pages, one wired",
          {{0, 4 * P, HTMemoryTotals{4 * P, 0, 0, 0, 4 * P, 0}}, {2 * P, 4 * P, dirty(4 * P)}},
-         HTMemoryTotals{6 * P, 0, 0, 0, 4 * P, 0}, true},
+         HTMemoryTotals{6 * P, 0, 0, 0, 4 * P, 0},
+         true},
         {"two ranges inside one page share it", {{100, 100, dirty(100)}, {300, 100, dirty(100)}}, dirty(100), false},
     };
     for (const Case& c : cases) {
@@ -183,8 +206,10 @@ TEST(HTRangeList, TotalsMatchTheUnionOfPages)
     auto pattern = [](const HTRangeListNode& node) {
         int full = 0;
         for (size_t kind = 0; kind < kKinds; ++kind) {
-            if (node.*kSpanTotals[kind] == node.size) full |= 1 << kind;
-            else if (node.*kSpanTotals[kind] != 0) return -1;
+            if (node.*kSpanTotals[kind] == node.size)
+                full |= 1 << kind;
+            else if (node.*kSpanTotals[kind] != 0)
+                return -1;
         }
         return full;
     };
@@ -233,7 +258,9 @@ TEST(HTRangeList, TotalsMatchTheUnionOfPages)
         const HTMemoryTotals unionOfPages = bytes(all);
         EXPECT_TRUE(list.exact() || !everyRangeExact);
         for (uint64_t HTMemoryTotals::*total : kTotals) {
-            if (list.exact()) { EXPECT_EQ(sum.*total, unionOfPages.*total); }
+            if (list.exact()) {
+                EXPECT_EQ(sum.*total, unionOfPages.*total);
+            }
             EXPECT_GE(sum.*total, largest.*total);
             EXPECT_LE(sum.*total, unionOfPages.*total);
         }

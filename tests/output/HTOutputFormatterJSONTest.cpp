@@ -49,8 +49,8 @@ std::shared_ptr<TestProcess> process(int32_t pid, std::string name = "proc")
 
 // A category known only by its figures; it has no member to name it, so the
 // writer files it under its key.
-void addCategory(HTCategoryMap& map, const std::string& name, uint64_t dirty, uint64_t swapped = 0,
-                 uint64_t clean = 0, uint64_t reclaimable = 0, uint64_t wired = 0)
+void addCategory(HTCategoryMap& map, const std::string& name, uint64_t dirty, uint64_t swapped = 0, uint64_t clean = 0,
+                 uint64_t reclaimable = 0, uint64_t wired = 0)
 {
     auto category = std::make_shared<HTMemoryCategory>(HTSegmentNoImage);
     category->setTotalDirtySize(dirty);
@@ -68,10 +68,7 @@ std::shared_ptr<HTAuxDataMap> auxMap(std::initializer_list<std::pair<std::string
     return map;
 }
 
-HTAuxDataMap::Value datum(int64_t value)
-{
-    return std::make_shared<HTAuxData>(value, false);
-}
+HTAuxDataMap::Value datum(int64_t value) { return std::make_shared<HTAuxData>(value, false); }
 
 // Compact JSON text of a parsed value, keys in document order.
 std::string json(const rapidjson::Value& value)
@@ -82,10 +79,7 @@ std::string json(const rapidjson::Value& value)
     return std::string(buffer.GetString(), buffer.GetSize());
 }
 
-std::string text(const rapidjson::Value& value)
-{
-    return std::string(value.GetString(), value.GetStringLength());
-}
+std::string text(const rapidjson::Value& value) { return std::string(value.GetString(), value.GetStringLength()); }
 
 std::vector<std::string> keys(const rapidjson::Value& object)
 {
@@ -156,7 +150,9 @@ protected:
         document.Parse<rapidjson::kParseValidateEncodingFlag>(raw.data(), raw.size());
         EXPECT_FALSE(document.HasParseError())
             << "error " << document.GetParseError() << " at " << document.GetErrorOffset() << " in " << raw;
-        if (!document.HasParseError()) EXPECT_EQ(json(document), raw);
+        if (!document.HasParseError()) {
+            EXPECT_EQ(json(document), raw);
+        }
         if (!expected.empty()) expectReport(expected, raw);
         return document;
     }
@@ -300,7 +296,8 @@ TEST_F(HTOutputFormatterJSONTest, PageSizeFallsBackToTheKernelPageSize)
         finishRun(*formatter);
         auto doc = read();
         ASSERT_TRUE(doc.IsObject());
-        EXPECT_EQ(doc["page size"].GetUint64(), kKernelPage) << (withProcess ? "process without page size" : "no process");
+        EXPECT_EQ(doc["page size"].GetUint64(), kKernelPage)
+            << (withProcess ? "process without page size" : "no process");
     }
 }
 
@@ -348,7 +345,8 @@ TEST(HTOutputFormatterJSON, ValidUTF8MendsOnlyBadBytes)
 TEST(HTOutputFormatterJSON, UnopenablePathGivesNoFormatter)
 {
     std::string error;
-    auto formatter = HTOutputFormatterJSON::initWithPath("/nonexistent-heft-dir/report.json", true, kKernelPage, &error);
+    auto formatter =
+        HTOutputFormatterJSON::initWithPath("/nonexistent-heft-dir/report.json", true, kKernelPage, &error);
     EXPECT_EQ(formatter, nullptr);
     EXPECT_EQ(error, "Unable to open JSON output file '/nonexistent-heft-dir/report.json': No such file or directory");
 }

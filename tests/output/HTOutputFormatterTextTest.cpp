@@ -33,9 +33,9 @@ constexpr uint64_t kPage = 4096;
 // Exposes the protected helpers.
 class TextFormatter : public HTOutputFormatterText {
 public:
-    using HTOutputFormatterText::HTOutputFormatterText;
     using HTOutputFormatterText::_sortedKeysForCategories;
     using HTOutputFormatterText::_truncatedNameForString;
+    using HTOutputFormatterText::HTOutputFormatterText;
 };
 
 // A process source that failed: errors can only be added from inside.
@@ -146,12 +146,23 @@ TEST(HTOutputFormatterText, RendersSizesInEachFormat)
     } rows[] = {
         {HTTextFormatBytes, 0, {{0, "0 B"}, {16384, "16384 B"}}},
         {HTTextFormatPages, 0, {{12345, "0 pages"}}},  // no page size yet
-        {HTTextFormatPages, 16384,
-         {{0, "0 pages"}, {1, "1 pages"}, {16384, "1 pages"}, {16385, "2 pages"},
+        {HTTextFormatPages,
+         16384,
+         {{0, "0 pages"},
+          {1, "1 pages"},
+          {16384, "1 pages"},
+          {16385, "2 pages"},
           {UINT64_MAX, "1125899906842624 pages"}}},
-        {HTTextFormatFormatted, 0,
-         {{0, "0 B"}, {1023, "1023 B"}, {1024, "1024 B"}, {1536, "1536 B"}, {16384, "16 KB"},
-          {10 * 1024 * 1024, "10 MB"}, {1023 * 1024, "1023 KB"}, {2 * 1024 * 1024, "2048 KB"}}},
+        {HTTextFormatFormatted,
+         0,
+         {{0, "0 B"},
+          {1023, "1023 B"},
+          {1024, "1024 B"},
+          {1536, "1536 B"},
+          {16384, "16 KB"},
+          {10 * 1024 * 1024, "10 MB"},
+          {1023 * 1024, "1023 KB"},
+          {2 * 1024 * 1024, "2048 KB"}}},
     };
     HTOutputCapture out;
     for (const Row& row : rows) {
@@ -166,9 +177,12 @@ TEST(HTOutputFormatterText, RendersSizesInEachFormat)
 TEST(HTOutputFormatterText, ShortensPathsUnlessWide)
 {
     TextFormatter narrow(HTTextFormatFormatted, 0, "Dirty", true, stdout);
-    for (const auto& [path, shown] : std::vector<std::pair<std::string, std::string>>{
-             {"/usr/lib/libexample", ".../libexample"}, {"libexample", "libexample"}, {"/usr/lib/", ".../lib"},
-             {"/", "/"}, {"", ""}})
+    for (const auto& [path, shown] :
+         std::vector<std::pair<std::string, std::string>>{{"/usr/lib/libexample", ".../libexample"},
+                                                          {"libexample", "libexample"},
+                                                          {"/usr/lib/", ".../lib"},
+                                                          {"/", "/"},
+                                                          {"", ""}})
         EXPECT_EQ(narrow._truncatedNameForString(path), shown) << path;
     EXPECT_EQ(narrow._truncatedNameForString(std::nullopt), std::nullopt);
 
@@ -189,8 +203,8 @@ TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
     // Equal rows keep the map's order; "Category" goes by character codes:
     // upper case before "_" before lower case.
     const std::pair<const char*, Keys> rows[] = {
-        {"Dirty", {M, S, T, D, U}}, {"Swapped", {M, D, T, S, U}}, {"Clean", {T, D, M, S, U}},
-        {"Reclaimable", {S, D, T, M, U}}, {"Wired", {M, D, T, S, U}}, {"Regions", {S, T, D, M, U}},
+        {"Dirty", {M, S, T, D, U}},       {"Swapped", {M, D, T, S, U}}, {"Clean", {T, D, M, S, U}},
+        {"Reclaimable", {S, D, T, M, U}}, {"Wired", {M, D, T, S, U}},   {"Regions", {S, T, D, M, U}},
         {"Category", {M, D, T, S, U}},
     };
     for (const auto& [sort, keys] : rows) EXPECT_EQ(keysSortedBy(sort), keys) << sort;
@@ -205,7 +219,11 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     std::string report;
     auto piece = [&](const char* what) { report += out.take() + "--- " + what + "\n"; };
     // Headers that only set up the counts are left out of the report.
-    auto quietly = [&](auto print) { report += out.take(); print(); out.take(); };
+    auto quietly = [&](auto print) {
+        report += out.take();
+        print();
+        out.take();
+    };
     using Text = HTOutputFormatterText;
 
     piece("empty tables: formatted wide, bytes swapped, pages wired");

@@ -7,7 +7,7 @@
 
 namespace {
 
-template <typename Format>
+template<typename Format>
 std::string text(Format format, uint64_t value)
 {
     char out[kHTSizeTextCapacity];

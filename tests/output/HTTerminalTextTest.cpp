@@ -19,7 +19,9 @@ TEST(HTTerminalText, ControlCharactersAndInvalidUTF8AreEscaped)
         {"del\x7F", "del\\x7F"},
         // C1 controls, stray continuation bytes, truncated and overlong
         // sequences, surrogates.
-        {"csi\xC2\x9B" "31m", "csi\\xC2\\x9B31m"},
+        {"csi\xC2\x9B"
+         "31m",
+         "csi\\xC2\\x9B31m"},
         {"stray\x80", "stray\\x80"},
         {"cut\xE2\x82", "cut\\xE2\\x82"},
         {"overlong\xC0\xAF", "overlong\\xC0\\xAF"},

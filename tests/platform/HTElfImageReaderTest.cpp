@@ -1,8 +1,8 @@
 #include "platform/linux/HTElfImageReader.h"
-#include "platform/linux/HTLinuxPlatform.h"
-#include "platform/linux/HTSmapsParser.h"
-#include "platform/linux/HTProcBuffer.h"
 #include "platform/HTTestChildren.h"
+#include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTSmapsParser.h"
 
 #include <gtest/gtest.h>
 
@@ -33,7 +33,7 @@ constexpr uint64_t kPage = 4096;
 
 using Layout = HTElfImageReader::Layout;
 
-template <class Phdr>
+template<class Phdr>
 Phdr programHeader(uint32_t type, uint32_t flags, uint64_t offset, uint64_t vaddr, uint64_t filesz, uint64_t memsz)
 {
     Phdr header{};
@@ -50,7 +50,7 @@ Phdr programHeader(uint32_t type, uint32_t flags, uint64_t offset, uint64_t vadd
 
 // The bytes of an ELF file of the given class holding only its headers,
 // padded to `fileSize`.
-template <class Ehdr, class Phdr>
+template<class Ehdr, class Phdr>
 std::string elfFile(uint16_t type, const std::vector<Phdr>& headers, size_t fileSize)
 {
     Ehdr header{};
@@ -72,7 +72,7 @@ std::string elfFile(uint16_t type, const std::vector<Phdr>& headers, size_t file
 // A shared object laid out the usual way: headers and dynamic symbols,
 // code, read-only data, then data whose first page is RELRO and whose
 // address runs one page ahead of its file offset.
-template <class Ehdr, class Phdr>
+template<class Ehdr, class Phdr>
 std::string sharedObject(uint64_t relroSize)
 {
     std::vector<Phdr> headers = {
@@ -240,13 +240,21 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
     // Data lies one page ahead of its file offset: the RELRO page split off
     // by mprotect, and the page after it. The last row is beyond every
     // PT_LOAD's file contents.
-    struct Row { uint64_t address, offset; bool executable, found; };
-    const Row rows[] = {{0, 0, false, true},           {0x1000, 0x1000, true, true}, {0x4000, 0x3000, false, true},
-                        {0x5000, 0x4000, false, true}, {0x9000, 0x8000, false, false}};
+    struct Row {
+        uint64_t address, offset;
+        bool executable, found;
+    };
+    const Row rows[] = {{0, 0, false, true},
+                        {0x1000, 0x1000, true, true},
+                        {0x4000, 0x3000, false, true},
+                        {0x5000, 0x4000, false, true},
+                        {0x9000, 0x8000, false, false}};
     for (const Row& row : rows) {
         uint64_t bias = 0;
-        EXPECT_EQ(HTElfImageReader::biasForMapping(*layout, base + row.address, row.offset, row.executable, kPage, &bias),
-                  row.found) << std::hex << row.address;
+        EXPECT_EQ(
+            HTElfImageReader::biasForMapping(*layout, base + row.address, row.offset, row.executable, kPage, &bias),
+            row.found)
+            << std::hex << row.address;
         EXPECT_EQ(bias, row.found ? base : 0) << std::hex << row.address;
     }
     uint64_t bias = 0;

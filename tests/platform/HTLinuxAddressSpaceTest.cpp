@@ -1,20 +1,20 @@
+#include "platform/HTTestChildren.h"
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTLinuxTaskPort.h"
-#include "platform/HTTestChildren.h"
 
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <chrono>
 #include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
 #include <optional>
 #include <string>
-#include <thread>
-#include <chrono>
 #include <sys/mman.h>
 #include <sys/syscall.h>
+#include <thread>
 #include <unistd.h>
 #include <vector>
 
@@ -34,10 +34,7 @@ struct ChildLayout {
     uint64_t file = 0;     // kFilePages pages of a shared file mapping, the first kFileWrittenPages written
 };
 
-size_t pageSize()
-{
-    return static_cast<size_t>(::sysconf(_SC_PAGESIZE));
-}
+size_t pageSize() { return static_cast<size_t>(::sysconf(_SC_PAGESIZE)); }
 
 // `pages` read-write pages between two inaccessible ones, so that the
 // kernel cannot merge them with a neighbouring mapping: the walk then
@@ -129,10 +126,7 @@ std::vector<int32_t> dispositions(HTPlatform& platform, HTTaskPort& task, uint64
     return answer;
 }
 
-bool pageFlagsReadable()
-{
-    return ::access("/proc/kpageflags", R_OK) == 0;
-}
+bool pageFlagsReadable() { return ::access("/proc/kpageflags", R_OK) == 0; }
 
 // A child that lays out known memory, reports where through a page shared
 // with the test, and stops itself; continued, it exits. The walk of its
@@ -188,7 +182,13 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     // Written pages are resident and dirty: mlock faults the locked ones
     // in, and the test looks well within the kernel's 30 s before it writes
     // dirty file pages back. Files have an external pager.
-    struct Row { uint64_t start; size_t pages, written; uint8_t shareMode; uint32_t inheritance; int external, wired; };
+    struct Row {
+        uint64_t start;
+        size_t pages, written;
+        uint8_t shareMode;
+        uint32_t inheritance;
+        int external, wired;
+    };
     const Row rows[] = {{layout_.touched, kTouchedPages, kTouchedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 0},
                         {layout_.locked, kLockedPages, kLockedPages, SM_PRIVATE, VM_INHERIT_COPY, 0, 1},
                         {layout_.file, kFilePages, kFileWrittenPages, SM_SHARED, VM_INHERIT_SHARE, 1, 0}};
@@ -213,7 +213,8 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     // The touched pages each alike, the inaccessible page on either side
     // never touched.
     kern_return_t result;
-    std::vector<int32_t> pages = dispositions(platform_, *task_, layout_.touched - pageSize(), kTouchedPages + 2, result);
+    std::vector<int32_t> pages =
+        dispositions(platform_, *task_, layout_.touched - pageSize(), kTouchedPages + 2, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     EXPECT_EQ(pages.front(), 0);
     EXPECT_EQ(pages.back(), 0);

@@ -1,8 +1,8 @@
 #include "platform/linux/HTLinuxPlatform.h"
+#include "platform/HTTestChildren.h"
 #include "platform/linux/HTLinuxTaskPort.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
-#include "platform/HTTestChildren.h"
 
 #include <gtest/gtest.h>
 
@@ -19,10 +19,7 @@
 
 namespace {
 
-std::string field(const char* chars, size_t capacity)
-{
-    return std::string(chars, strnlen(chars, capacity));
-}
+std::string field(const char* chars, size_t capacity) { return std::string(chars, strnlen(chars, capacity)); }
 
 std::vector<int32_t> listAll(HTPlatform& platform)
 {
@@ -327,5 +324,4 @@ TEST(HTLinuxPlatform, SettingsHeftKeepsItself)
         EXPECT_EQ(platform.sysctlbyname(absent, &value, &length, nullptr, 0), -1) << absent;
         EXPECT_EQ(errno, ENOENT) << absent;
     }
-
 }

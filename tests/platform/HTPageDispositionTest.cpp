@@ -1,5 +1,5 @@
-#include "platform/HTPlatformTypes.h"
 #include "platform/linux/HTPageDisposition.h"
+#include "platform/HTPlatformTypes.h"
 #include "platform/linux/HTProcStatusParser.h"
 
 #include <gtest/gtest.h>
@@ -38,7 +38,11 @@ int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPriva
 TEST(HTPageDisposition, FromPagemapAndPageFlags)
 {
     constexpr int32_t kCopied = VM_PAGE_QUERY_PAGE_COPIED;
-    struct Row { uint64_t entry, flags; HTPageMapping mapping; int32_t expected; };
+    struct Row {
+        uint64_t entry, flags;
+        HTPageMapping mapping;
+        int32_t expected;
+    };
     const Row rows[] = {
         // Anonymous memory and shared memory are swap-backed: dirty while present.
         {kPresentEntry, HT_KPF_ANON | HT_KPF_SWAPBACKED, kPrivate, kPresent | kDirty},
@@ -83,14 +87,15 @@ std::vector<uint64_t> possibleFlags(uint64_t entry, HTPageMapping mapping)
     const bool file = (entry & HT_PAGEMAP_FILE_OR_SHARED) != 0;
     if (mapping.hugetlb) return {0, HT_KPF_DIRTY, HT_KPF_ANON, HT_KPF_ANON | HT_KPF_DIRTY};
     // Neither the zero page nor freed: swap-backed anonymous memory.
-    if (mapping.plainAnonymous && !file) return {HT_KPF_ANON | HT_KPF_SWAPBACKED, HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
+    if (mapping.plainAnonymous && !file)
+        return {HT_KPF_ANON | HT_KPF_SWAPBACKED, HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
     // Shared memory pages are always swap-backed.
     if (mapping.sharedMemory && file) return {HT_KPF_SWAPBACKED, HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
     // Clean page cache; copies made on write, never freed with MADV_FREE.
     if (mapping.cleanFile)
-        return file ? std::vector<uint64_t>{0}
-                    : std::vector<uint64_t>{HT_KPF_ANON | HT_KPF_SWAPBACKED,
-                                            HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
+        return file
+            ? std::vector<uint64_t>{0}
+            : std::vector<uint64_t>{HT_KPF_ANON | HT_KPF_SWAPBACKED, HT_KPF_ANON | HT_KPF_SWAPBACKED | HT_KPF_DIRTY};
     return {};
 }
 
@@ -124,9 +129,12 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
 TEST(HTPageDisposition, SharedPageIdentities)
 {
     constexpr uint64_t kExclusive = HT_PAGEMAP_EXCLUSIVE;
-    struct Row { uint64_t entry; bool swapShared, zeroPage, named; };
+    struct Row {
+        uint64_t entry;
+        bool swapShared, zeroPage, named;
+    };
     const Row rows[] = {
-        {kPresentEntry, false, false, true},               // resident, mapped by others too
+        {kPresentEntry, false, false, true},                // resident, mapped by others too
         {kPresentEntry | kExclusive, false, false, false},  // mapped here alone
         {kFileEntry, false, false, false},                  // the file's page, not a copy
         {kPresentEntry, false, true, false},                // the zero page holds nothing
@@ -145,8 +153,7 @@ TEST(HTPageDisposition, SharedPageIdentities)
     // same frame seen from two processes is one.
     EXPECT_NE(htSharedPageIdentity(HT_PAGEMAP_PRESENT | 0x5678, false, false),
               htSharedPageIdentity(kSwappedEntry, true, false));
-    EXPECT_EQ(htSharedPageIdentity(kPresentEntry, false, false),
-              htSharedPageIdentity(kPresentEntry, true, false));
+    EXPECT_EQ(htSharedPageIdentity(kPresentEntry, false, false), htSharedPageIdentity(kPresentEntry, true, false));
 }
 
 TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)

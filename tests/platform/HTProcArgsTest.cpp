@@ -53,7 +53,8 @@ TEST(HTProcArgs, LaysOutCountPathPaddingAndArguments)
 TEST(HTProcArgs, ShortBufferKeepsTheBeginningAndNeverOverruns)
 {
     std::string path = "/opt/app/bin/server";
-    std::string cmdline = "server\0--port\0" "8080\0"s;
+    std::string cmdline = "server\0--port\0"
+                          "8080\0"s;
     std::string whole = build(path, cmdline);
     for (size_t capacity = 1; capacity < whole.size(); ++capacity) {
         std::string buffer(capacity + 8, '#');

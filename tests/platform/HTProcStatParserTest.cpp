@@ -1,5 +1,5 @@
-#include "platform/HTPlatformTypes.h"
 #include "platform/linux/HTProcStatParser.h"
+#include "platform/HTPlatformTypes.h"
 
 #include <gtest/gtest.h>
 
@@ -47,7 +47,13 @@ TEST(HTProcStatParser, CommRunsToTheLastParenthesis)
     // A process may call itself anything, parentheses and blanks included;
     // the fields after the name must not shift. The last line stops before
     // the stack address.
-    struct Row { const char* line; const char* comm; char state; int32_t ppid, nice; uint64_t starttime; };
+    struct Row {
+        const char* line;
+        const char* comm;
+        char state;
+        int32_t ppid, nice;
+        uint64_t starttime;
+    };
     const Row rows[] = {
         {"1234 ((a) b)) S 77 1234 1234 0 -1 4194560 0 0 0 0 0 0 0 0 39 19 1 0 500 0 0\n", "(a) b)", 'S', 77, 19, 500},
         {"9 ( x  ) ) Z 1 9 9 0 -1 4 0 0 0 0 0 0 0 0 20 -5 1 0 7 0 0", " x  ) ", 'Z', 1, -5, 7},

@@ -1,6 +1,6 @@
+#include "platform/linux/HTSmapsParser.h"
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTProcBuffer.h"
-#include "platform/linux/HTSmapsParser.h"
 
 #include <gtest/gtest.h>
 
@@ -87,16 +87,15 @@ TEST(HTSmapsParser, ReusesRecordsAndSkipsWhatItCannotRead)
 {
     std::vector<HTSmapsEntry> entries = parsedCapture();
     // A second, shorter text: no record of the first survives in it.
-    constexpr std::string_view text =
-        "not a maps line\n"
-        "Rss:                 99 kB\n"
-        "7f00-zz00 rw-p 00000000 00:00 0 \n"
-        "Rss:                 98 kB\n"
-        "1000-3000 rw-s 00002000 00:01 7    /memfd:x (deleted)\n"
-        "Rss:                  8 kB\n"
-        "Swap:\n"
-        "Private_Dirty:        4 kB\n"
-        "VmFlags: rd wr sh mr mw me lo";  // cut short: no final line feed
+    constexpr std::string_view text = "not a maps line\n"
+                                      "Rss:                 99 kB\n"
+                                      "7f00-zz00 rw-p 00000000 00:00 0 \n"
+                                      "Rss:                 98 kB\n"
+                                      "1000-3000 rw-s 00002000 00:01 7    /memfd:x (deleted)\n"
+                                      "Rss:                  8 kB\n"
+                                      "Swap:\n"
+                                      "Private_Dirty:        4 kB\n"
+                                      "VmFlags: rd wr sh mr mw me lo";  // cut short: no final line feed
     ASSERT_EQ(htParseSmaps(text, entries), 1u);
     ASSERT_EQ(entries.size(), 1u);
     EXPECT_EQ(entries[0].start, 0x1000u);
@@ -131,9 +130,9 @@ TEST(HTLinuxRegionInfo, RecordsOfCapturedMappings)
         {0x55e60358a000, HT_VM_TAG_UNTAGGED, SM_COW, VM_INHERIT_COPY, 1, 1, 1, 0, 0, 1, 0},  // the program
         {0x55e63f88e000, HT_VM_TAG_HEAP, SM_PRIVATE, VM_INHERIT_COPY, 0, 2, 2, 0, 0, 1, 0},
         {0x7f8955800000, HT_VM_TAG_UNTAGGED, SM_PRIVATE, VM_INHERIT_COPY, 0, 512, 512, 0, 0, 1, 0},  // THP
-        {0x7f8955dc1000, HT_VM_TAG_UNTAGGED, SM_EMPTY, VM_INHERIT_NONE, 0, 0, 0, 0, 0, 1, 0},  // MADV_DONTFORK
-        {0x7f8955dc2000, HT_VM_TAG_UNTAGGED, SM_PRIVATE, VM_INHERIT_COPY, 0, 4, 0, 0, 4, 1, 0},  // MADV_FREE
-        {0x7f8955dc6000, HT_VM_TAG_UNTAGGED, SM_PRIVATE, VM_INHERIT_COPY, 0, 2, 2, 0, 0, 1, 1},  // mlocked
+        {0x7f8955dc1000, HT_VM_TAG_UNTAGGED, SM_EMPTY, VM_INHERIT_NONE, 0, 0, 0, 0, 0, 1, 0},        // MADV_DONTFORK
+        {0x7f8955dc2000, HT_VM_TAG_UNTAGGED, SM_PRIVATE, VM_INHERIT_COPY, 0, 4, 0, 0, 4, 1, 0},      // MADV_FREE
+        {0x7f8955dc6000, HT_VM_TAG_UNTAGGED, SM_PRIVATE, VM_INHERIT_COPY, 0, 2, 2, 0, 0, 1, 1},      // mlocked
         // One page copied on write, one still shared with the file.
         {0x7f8955dc8000, HT_VM_TAG_UNTAGGED, SM_COW, VM_INHERIT_COPY, 1, 2, 2, 1, 0, 2, 0},
         {0x7f8955dca000, HT_VM_TAG_UNTAGGED, SM_SHARED, VM_INHERIT_SHARE, 1, 1, 1, 0, 0, 2, 0},

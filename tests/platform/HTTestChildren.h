@@ -40,8 +40,7 @@ public:
     {
         if (pid_ <= 0) return;
         ::kill(pid_, SIGKILL);
-        while (::waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {
-        }
+        while (::waitpid(pid_, nullptr, 0) < 0 && errno == EINTR) {}
         pid_ = -1;
     }
 

@@ -58,8 +58,10 @@ TEST(HTImage, SettingTheNameSetsTheSegmentCode)
 {
     // Renamed in turn; a name outside the families leaves the code as it was.
     HTImage image;
-    for (auto [name, segment] : {std::pair{"__TEXT_EXEC", HTSegmentText}, {"__LINKEDIT", HTSegmentLinkEdit},
-                                 {"__DATA_CONST", HTSegmentOther}, {"MACH_HEADER", HTSegmentOther}}) {
+    for (auto [name, segment] : {std::pair{"__TEXT_EXEC", HTSegmentText},
+                                 {"__LINKEDIT", HTSegmentLinkEdit},
+                                 {"__DATA_CONST", HTSegmentOther},
+                                 {"MACH_HEADER", HTSegmentOther}}) {
         image.setName(name);
         EXPECT_EQ(image.segment(), segment) << name;
     }
@@ -159,11 +161,14 @@ TEST(HTImage, GatherImagesNamesSegmentsAndResolvesPaths)
     HTImageListPlatform platform;
     platform.realpaths["/lib/link.so"] = "/lib/real.so";
     auto task = platform.task({
-        {"/lib/link.so", 0x7f0000000000,
-         {{"__DATA", 0x7f0000004000, 0x1000}, {"MACH_HEADER", 0x7f0000000000, 0x1000},
+        {"/lib/link.so",
+         0x7f0000000000,
+         {{"__DATA", 0x7f0000004000, 0x1000},
+          {"MACH_HEADER", 0x7f0000000000, 0x1000},
           {"__TEXT", 0x7f0000001000, 0x3000}}},
         {"/gone/lib.so", 0x10000, {{"", 0x10000, 0x1000}, {"text segment", 0x11000, 0x1000}}},
-        {"/usr/lib/shared/libshared.so", sharedBase + 0x4000,
+        {"/usr/lib/shared/libshared.so",
+         sharedBase + 0x4000,
          {{"__DATA_CONST", sharedBase + 0x8000, 0x1000}, {"__LINKEDIT", sharedBase + 0x4000, 0x2000}}},
     });
     auto images = HTImage::gatherImages(platform, *task, sharedBase, sharedSize);
@@ -175,15 +180,16 @@ TEST(HTImage, GatherImagesNamesSegmentsAndResolvesPaths)
     std::vector<Row> rows;
     for (const auto& image : images)
         rows.emplace_back(image->start(), image->size(), image->name(), image->segment(), image->ownerPath());
-    EXPECT_EQ(rows, (std::vector<Row>{
-        {0x10000, 0x1000, "unknown", HTSegmentNotSet, "/gone/lib.so"},
-        {0x11000, 0x1000, "text", HTSegmentNotSet, "/gone/lib.so"},
-        {sharedBase + 0x4000, 0x2000, "__LINKEDIT", HTSegmentLinkEdit, "/usr/lib/shared/libshared.so"},
-        {sharedBase + 0x8000, 0x1000, "__DATA_CONST", HTSegmentOther, "/usr/lib/shared/libshared.so"},
-        {0x7f0000000000, 0x1000, "__TEXT", HTSegmentText, "/lib/real.so"},
-        {0x7f0000001000, 0x3000, "__TEXT", HTSegmentText, "/lib/real.so"},
-        {0x7f0000004000, 0x1000, "__DATA", HTSegmentOther, "/lib/real.so"},
-    }));
+    EXPECT_EQ(rows,
+              (std::vector<Row>{
+                  {0x10000, 0x1000, "unknown", HTSegmentNotSet, "/gone/lib.so"},
+                  {0x11000, 0x1000, "text", HTSegmentNotSet, "/gone/lib.so"},
+                  {sharedBase + 0x4000, 0x2000, "__LINKEDIT", HTSegmentLinkEdit, "/usr/lib/shared/libshared.so"},
+                  {sharedBase + 0x8000, 0x1000, "__DATA_CONST", HTSegmentOther, "/usr/lib/shared/libshared.so"},
+                  {0x7f0000000000, 0x1000, "__TEXT", HTSegmentText, "/lib/real.so"},
+                  {0x7f0000001000, 0x3000, "__TEXT", HTSegmentText, "/lib/real.so"},
+                  {0x7f0000004000, 0x1000, "__DATA", HTSegmentOther, "/lib/real.so"},
+              }));
     ASSERT_EQ(images.size(), 7u);
 
     // Segment names, and paths in the shared region, are one string for

@@ -67,8 +67,7 @@ public:
     {
         if (lifeline_ >= 0) ::close(lifeline_);
         if (child_.valid()) {
-            while (::waitpid(child_.pid(), nullptr, 0) < 0 && errno == EINTR) {
-            }
+            while (::waitpid(child_.pid(), nullptr, 0) < 0 && errno == EINTR) {}
             // Reaped already; keep HTTestChild from signalling a reused pid.
             child_ = HTTestChild();
         }
@@ -84,10 +83,8 @@ private:
     [[noreturn]] static void live(int lifeline)
     {
         char byte;
-        while (::read(lifeline, &byte, 1) != 0 && errno == EINTR) {
-        }
-        while (::wait(nullptr) > 0 || errno == EINTR) {
-        }
+        while (::read(lifeline, &byte, 1) != 0 && errno == EINTR) {}
+        while (::wait(nullptr) > 0 || errno == EINTR) {}
         ::_exit(0);
     }
     static void tell(int fd, int32_t role, pid_t pid)
@@ -151,8 +148,7 @@ TEST_F(HTProcessDiscoveryLinux, DescendantsAreFoundGenerationByGeneration)
     ASSERT_TRUE(pids);
     ASSERT_EQ(pids->size(), 4u);
     EXPECT_EQ((*pids)[0], tree.root());
-    EXPECT_EQ((std::set<int32_t>{(*pids)[1], (*pids)[2]}),
-              (std::set<int32_t>{tree.firstChild(), tree.secondChild()}));
+    EXPECT_EQ((std::set<int32_t>{(*pids)[1], (*pids)[2]}), (std::set<int32_t>{tree.firstChild(), tree.secondChild()}));
     EXPECT_EQ((*pids)[3], tree.grandchild());
 
     // A leaf yields just itself.

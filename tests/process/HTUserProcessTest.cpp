@@ -67,8 +67,8 @@ TEST_F(HTUserProcessTest, LedgerFailuresLeaveNoPageTableRegion)
     addTarget().ledgerErrno = EPERM;
     platform_->ledgerTemplate = std::vector<std::string>{"page_table"};
     auto process = gathered();
-    EXPECT_EQ(process->warnings(), std::vector<std::string>{
-                                       std::string("target [500]: Unable to retrieve ledger entry info - ") +
+    EXPECT_EQ(process->warnings(),
+              std::vector<std::string>{std::string("target [500]: Unable to retrieve ledger entry info - ") +
                                        std::strerror(EPERM)});
     EXPECT_TRUE(process->memoryRegions().empty());
 
@@ -325,15 +325,31 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
     };
     const std::string bailOut = "bailing out for process target [500]; data may be incomplete! ";
     const Case cases[] = {
-        {SZOMB, 0, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (zombie)"}, {},
+        {SZOMB,
+         0,
+         MACH_SEND_INVALID_DEST,
+         {"target [500]: process is gone (zombie)"},
+         {},
          "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report"},
         // Killed, not yet a zombie: its memory is going already.
-        {SRUN, PROC_FLAG_INEXIT, MACH_SEND_INVALID_DEST, {"target [500]: process is gone (process exited)"}, {},
+        {SRUN,
+         PROC_FLAG_INEXIT,
+         MACH_SEND_INVALID_DEST,
+         {"target [500]: process is gone (process exited)"},
+         {},
          std::string("target [500]") + kExitedNotice},
         // A running process, or another code: an error.
-        {SRUN, 0, MACH_SEND_INVALID_DEST, {}, {"target [500]: process is gone"},
+        {SRUN,
+         0,
+         MACH_SEND_INVALID_DEST,
+         {},
+         {"target [500]: process is gone"},
          bailOut + "(its memory map could not be read: process is gone)"},
-        {SRUN, PROC_FLAG_INEXIT, KERN_FAILURE, {}, {"target [500]: failure"},
+        {SRUN,
+         PROC_FLAG_INEXIT,
+         KERN_FAILURE,
+         {},
+         {"target [500]: failure"},
          bailOut + "(its memory map could not be read: failure)"},
     };
     for (const Case& test : cases) {
@@ -398,8 +414,8 @@ std::vector<Span> spans(const HTMemoryRegion& region)
     std::vector<Span> result;
     if (!region.subrangeList()) return result;
     for (const HTRangeListNode* node = region.subrangeList()->head(); node; node = node->next)
-        result.push_back({node->start, node->size, node->dirty, node->swapped, node->clean, node->reclaimable,
-                          node->wired});
+        result.push_back(
+            {node->start, node->size, node->dirty, node->swapped, node->clean, node->reclaimable, node->wired});
     return result;
 }
 
@@ -475,9 +491,10 @@ TEST_F(HTUserProcessSubrangeTest, LargeRegionsAreQueriedInChunksAndRunsCrossThem
 
     auto process = gathered();
     // Only the populated runs are queried, a chunk of at most 4096 pages at a time.
-    EXPECT_EQ(platform_->pageQueries, (HTPageQueries{{start + 10 * kPage, 4096 * kPage},
-                                                     {start + 4106 * kPage, 94 * kPage},
-                                                     {start + 4201 * kPage, 799 * kPage}}));
+    EXPECT_EQ(platform_->pageQueries,
+              (HTPageQueries{{start + 10 * kPage, 4096 * kPage},
+                             {start + 4106 * kPage, 94 * kPage},
+                             {start + 4201 * kPage, 799 * kPage}}));
     EXPECT_EQ(spans(regionAt(*process, start)),
               (std::vector<Span>{{10 * kPage, 4190 * kPage, 4190 * kPage, 0, 0, 0, 0},
                                  {4201 * kPage, 799 * kPage, 0, 0, 799 * kPage, 0, 0}}));

@@ -66,7 +66,7 @@ protected:
     HTFakePlatform::Process& target() { return *platform_->process(kPid); }
     HTFakePlatform::Process& addTarget() { return platform_->addProcess(kPid, 1, "target"); }
 
-    template <typename Process = HTUserProcess>
+    template<typename Process = HTUserProcess>
     std::shared_ptr<Process> created()
     {
         auto process = std::make_shared<Process>(platform_);
@@ -74,7 +74,7 @@ protected:
         return process;
     }
 
-    template <typename Process = HTUserProcess>
+    template<typename Process = HTUserProcess>
     std::shared_ptr<Process> gathered()
     {
         auto process = created<Process>();

@@ -3,9 +3,9 @@
 #include "platform/HTMachErrorText.h"
 
 #include <algorithm>
-#include <new>
 #include <cerrno>
 #include <cstring>
+#include <new>
 
 namespace {
 
@@ -36,7 +36,7 @@ std::string buildProcargs(const std::string& path, const std::vector<std::string
 }  // namespace
 
 HTFakePlatform::Process& HTFakePlatform::addProcess(int32_t pid, int32_t ppid, const std::string& comm,
-                                                   std::optional<std::string> executablePath, uint32_t flags)
+                                                    std::optional<std::string> executablePath, uint32_t flags)
 {
     if (processes_.count(pid) == 0) order_.push_back(pid);
     Process& process = processes_[pid];
@@ -175,10 +175,7 @@ kern_return_t HTFakePlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskPo
     return KERN_SUCCESS;
 }
 
-std::string HTFakePlatform::mach_error_string(kern_return_t code)
-{
-    return htMachErrorString(code);
-}
+std::string HTFakePlatform::mach_error_string(kern_return_t code) { return htMachErrorString(code); }
 
 void HTFakePlatform::mach_error(const char* label, kern_return_t code)
 {
@@ -191,8 +188,7 @@ void HTFakePlatform::mach_error(const char* label, kern_return_t code)
 size_t HTFakePlatform::regionIndexAtOrAfter(const Process& process, uint64_t address)
 {
     size_t index = 0;
-    while (index < process.regions.size() &&
-           process.regions[index].start + process.regions[index].size <= address)
+    while (index < process.regions.size() && process.regions[index].start + process.regions[index].size <= address)
         ++index;
     return index;
 }
@@ -255,8 +251,7 @@ kern_return_t HTFakePlatform::mach_vm_region(HTTaskPort& task, uint64_t* address
     return KERN_SUCCESS;
 }
 
-kern_return_t HTFakePlatform::mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
-                                                       int32_t* state)
+kern_return_t HTFakePlatform::mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state)
 {
     Process* found = process(task.pid());
     if (found == nullptr) return MACH_SEND_INVALID_DEST;

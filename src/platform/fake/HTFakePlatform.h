@@ -96,8 +96,8 @@ public:
     Process* process(int32_t pid);
 
     // Scripted state, public for tests to set.
-    int listErrno = 0;                  // non-zero: proc_listallpids fails with it
-    int32_t argmax = 256 * 1024;        // KERN_ARGMAX
+    int listErrno = 0;            // non-zero: proc_listallpids fails with it
+    int32_t argmax = 256 * 1024;  // KERN_ARGMAX
     uint64_t pageSize = 4096;
     int32_t ownPid = 99999;
     // Whether shared pages can be told apart (page frames are visible).
@@ -108,7 +108,7 @@ public:
     // Whether walking an address space runs out of memory.
     bool outOfMemoryInWalk = false;
     uint32_t euid = 0;
-    std::set<int> terminals;            // descriptors that are terminals
+    std::set<int> terminals;  // descriptors that are terminals
     std::set<std::string> existingFiles;
     std::map<std::string, int32_t> sysctlValues;  // sysctlbyname integers; absent: ENOENT
     std::vector<std::string> machErrors;          // what mach_error wrote

@@ -1,6 +1,5 @@
 #include "platform/linux/HTElfImageReader.h"
 
-
 #include <algorithm>
 #include <cerrno>
 #include <charconv>
@@ -74,7 +73,7 @@ void addWritableSegments(std::vector<HTElfImageReader::Layout::Segment>& segment
     if (constEnd < end) segments.push_back({kData, constEnd, end});
 }
 
-template <class Ehdr, class Phdr>
+template<class Ehdr, class Phdr>
 HTElfImageReader::ReadResult readLayoutOf(int fd, const unsigned char* headerBytes, size_t headerLength,
                                           uint64_t pageSize, std::shared_ptr<const HTElfImageReader::Layout>* out)
 {
@@ -196,8 +195,10 @@ HTElfImageReader::ReadResult HTElfImageReader::readLayout(int fd, uint64_t pageS
     if (length < EI_NIDENT || std::memcmp(header, ELFMAG, SELFMAG) != 0) return ReadResult::NotImage;
     // Only objects of this machine's byte order can be mapped by it.
     if (header[EI_DATA] != kNativeData) return ReadResult::NotImage;
-    if (header[EI_CLASS] == ELFCLASS64) return readLayoutOf<Elf64_Ehdr, Elf64_Phdr>(fd, header, length, pageSize, layout);
-    if (header[EI_CLASS] == ELFCLASS32) return readLayoutOf<Elf32_Ehdr, Elf32_Phdr>(fd, header, length, pageSize, layout);
+    if (header[EI_CLASS] == ELFCLASS64)
+        return readLayoutOf<Elf64_Ehdr, Elf64_Phdr>(fd, header, length, pageSize, layout);
+    if (header[EI_CLASS] == ELFCLASS32)
+        return readLayoutOf<Elf32_Ehdr, Elf32_Phdr>(fd, header, length, pageSize, layout);
     return ReadResult::NotImage;
 }
 
@@ -223,7 +224,7 @@ bool HTElfImageReader::biasForMapping(const Layout& layout, uint64_t mapStart, u
 }
 
 std::shared_ptr<const HTElfImageReader::Layout> HTElfImageReader::layoutForMapping(int procDirFd,
-                                                                                 const HTSmapsEntry& mapping)
+                                                                                   const HTSmapsEntry& mapping)
 {
     FileKey key{(uint64_t(mapping.devMajor) << 32) | mapping.devMinor, mapping.inode};
     {

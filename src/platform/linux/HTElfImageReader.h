@@ -30,7 +30,6 @@
 #include <unordered_map>
 #include <vector>
 
-
 class HTElfImageReader {
 public:
     // An ELF file's load layout, with addresses as linked (bias 0).

@@ -28,7 +28,6 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-
 namespace {
 
 constexpr bool kHeftIs64bit = sizeof(void*) == 8;
@@ -36,7 +35,7 @@ constexpr const char* kSelfRegionHeftName = "vm.self_region_heft";
 // Bounds of the argument-area size heft announces: the caller allocates
 // that much for every process it names.
 constexpr long kArgMaxFloor = 4096;
-constexpr long kArgMaxCeiling = 1024 * 1024;
+constexpr long kArgMaxCeiling = 1024L * 1024;
 
 // Writes the decimal pid followed by `suffix` into `out` (NUL-terminated).
 void formatPidPath(char (&out)[48], int32_t pid, std::string_view suffix)
@@ -97,11 +96,7 @@ bool processHasExited(int dirfd)
     return !stat || stat->hasExited();
 }
 
-bool meansGone(int error)
-{
-    return error == ESRCH || error == ENOENT;
-}
-
+bool meansGone(int error) { return error == ESRCH || error == ENOENT; }
 
 // What the page rules need to know of the mapping at `index`.
 HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
@@ -117,8 +112,8 @@ HTPageMapping pageMapping(HTLinuxTaskPort& task, size_t index)
     // swap (tmpfs and its kin sit on anonymous devices, major number 0), and
     // without a dirty page, counted from the same smaps as the walk, no file
     // page can be dirty.
-    mapping.cleanFile = vma.kind == HTSmapsKind::File && vma.devMajor != 0 && vma.sharedDirty == 0 &&
-                        vma.privateDirty == 0;
+    mapping.cleanFile =
+        vma.kind == HTSmapsKind::File && vma.devMajor != 0 && vma.sharedDirty == 0 && vma.privateDirty == 0;
     // The anonymous pages of a file's mapping are its copies on write: the
     // zero page only fills anonymous memory, and MADV_FREE takes nothing
     // else. Anonymous memory says in smaps what it holds freed, and the
@@ -141,9 +136,12 @@ bool mayHoldSharedAnonymousPages(const HTSmapsEntry& vma)
     case HTSmapsKind::Anonymous:
     case HTSmapsKind::Heap:
     case HTSmapsKind::Stack:
-    case HTSmapsKind::NamedAnonymous: return vma.mayShareWithOtherProcesses();
-    case HTSmapsKind::File: return vma.sharedDirty != 0 || vma.swapPss < vma.swap;
-    default: return false;
+    case HTSmapsKind::NamedAnonymous:
+        return vma.mayShareWithOtherProcesses();
+    case HTSmapsKind::File:
+        return vma.sharedDirty != 0 || vma.swapPss < vma.swap;
+    default:
+        return false;
     }
 }
 
@@ -434,9 +432,9 @@ int HTLinuxPlatform::proc_listallpids(int32_t* buffer, int bufferSize)
 
 int HTLinuxPlatform::proc_pidinfo(int32_t pid, int flavor, uint64_t, void* buffer, int bufferSize)
 {
-    size_t needed = flavor == PROC_PIDTBSDINFO         ? sizeof(proc_bsdinfo)
-                    : flavor == PROC_PIDT_SHORTBSDINFO ? sizeof(proc_bsdshortinfo)
-                                                       : 0;
+    size_t needed = flavor == PROC_PIDTBSDINFO ? sizeof(proc_bsdinfo)
+        : flavor == PROC_PIDT_SHORTBSDINFO     ? sizeof(proc_bsdshortinfo)
+                                               : 0;
     if (needed == 0) {
         errno = EINVAL;
         return 0;
@@ -468,10 +466,7 @@ int HTLinuxPlatform::proc_pidinfo(int32_t pid, int flavor, uint64_t, void* buffe
     return sizeof(shortInfo);
 }
 
-int HTLinuxPlatform::proc_get_dirty(int32_t, uint32_t*)
-{
-    return ENOTSUP;
-}
+int HTLinuxPlatform::proc_get_dirty(int32_t, uint32_t*) { return ENOTSUP; }
 
 int HTLinuxPlatform::readProcArgs(int32_t pid, void* oldp, size_t* oldlenp)
 {
@@ -501,8 +496,7 @@ int HTLinuxPlatform::readProcArgs(int32_t pid, void* oldp, size_t* oldlenp)
     thread_local HTProcBuffer cmdline;
     if (!readProcessFile(pid, "/cmdline", cmdline)) return -1;
 
-    std::string_view executable =
-        htExecutablePathFromLink(std::string_view(link, static_cast<size_t>(linkLength)));
+    std::string_view executable = htExecutablePathFromLink(std::string_view(link, static_cast<size_t>(linkLength)));
     size_t total = htBuildProcArgs(executable, cmdline.view(), nullptr, 0);
     if (oldp == nullptr) {
         *oldlenp = total;
@@ -517,8 +511,7 @@ int HTLinuxPlatform::readProcArgs(int32_t pid, void* oldp, size_t* oldlenp)
     return 0;
 }
 
-int HTLinuxPlatform::sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
-                            size_t)
+int HTLinuxPlatform::sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp, size_t)
 {
     if (name == nullptr || nameLength < 2 || name[0] != CTL_KERN) {
         errno = ENOENT;
@@ -609,30 +602,18 @@ kern_return_t HTLinuxPlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskP
     return KERN_SUCCESS;
 }
 
-std::string HTLinuxPlatform::mach_error_string(kern_return_t code)
-{
-    return htMachErrorString(code);
-}
+std::string HTLinuxPlatform::mach_error_string(kern_return_t code) { return htMachErrorString(code); }
 
 void HTLinuxPlatform::mach_error(const char* label, kern_return_t code)
 {
     std::fprintf(stderr, "%s: %s (0x%x)\n", label, htMachErrorString(code).c_str(), static_cast<unsigned>(code));
 }
 
-int32_t HTLinuxPlatform::getpid()
-{
-    return ::getpid();
-}
+int32_t HTLinuxPlatform::getpid() { return ::getpid(); }
 
-uint32_t HTLinuxPlatform::geteuid()
-{
-    return ::geteuid();
-}
+uint32_t HTLinuxPlatform::geteuid() { return ::geteuid(); }
 
-bool HTLinuxPlatform::isatty(int fd)
-{
-    return ::isatty(fd) != 0;
-}
+bool HTLinuxPlatform::isatty(int fd) { return ::isatty(fd) != 0; }
 
 bool HTLinuxPlatform::stat(const char* path)
 {
@@ -685,8 +666,7 @@ kern_return_t HTLinuxPlatform::vmaAtOrAbove(HTTaskPort& task, uint64_t address, 
 }
 
 kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
-                                                      uint32_t* depth, vm_region_submap_info_64* info,
-                                                      uint32_t* count)
+                                                      uint32_t* depth, vm_region_submap_info_64* info, uint32_t* count)
 {
     if (address == nullptr || size == nullptr || info == nullptr || count == nullptr) return KERN_INVALID_ARGUMENT;
     const HTSmapsEntry* vma = nullptr;
@@ -993,8 +973,8 @@ kern_return_t HTLinuxPlatform::identifyPages(HTLinuxTaskPort& task, size_t index
     // a kernel without the scan is asked page by page.
     thread_local std::vector<std::pair<uint64_t, uint64_t>> zeroRuns;
     const bool checkZero = task.mayMapZeroPage(index) != false;
-    const bool zeroRunsKnown = checkZero && (task.zeroPageRunsFromScan(from, to, zeroRuns) ||
-                                             htPagemapZeroPageRuns(pagemap, from, to, zeroRuns));
+    const bool zeroRunsKnown = checkZero &&
+        (task.zeroPageRunsFromScan(from, to, zeroRuns) || htPagemapZeroPageRuns(pagemap, from, to, zeroRuns));
     HTRunCursor zeroPages(zeroRuns);
 
     thread_local std::array<uint64_t, HTPageQueryChunk::kPages> ownEntries;
@@ -1013,8 +993,8 @@ kern_return_t HTLinuxPlatform::identifyPages(HTLinuxTaskPort& task, size_t index
             uint64_t identity = htSharedPageIdentity(entries[i], swapShared, false);
             // Only a resident page can be a zero page.
             if (identity != 0 && checkZero && (entries[i] & HT_PAGEMAP_PRESENT) != 0) {
-                const bool zero = zeroRunsKnown ? zeroPages.contains(at + i * pageSize)
-                                                : isZeroFrame(htPagemapFrame(entries[i]));
+                const bool zero =
+                    zeroRunsKnown ? zeroPages.contains(at + i * pageSize) : isZeroFrame(htPagemapFrame(entries[i]));
                 if (zero) identity = 0;
             }
             *identities++ = identity;

@@ -53,15 +53,14 @@ public:
     // KERN_INVALID_ADDRESS; other failures HT_KERN_ERRNO_BASE | errno.
     kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
                                          vm_region_submap_info_64* info, uint32_t* count) override;
-    kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size,
-                                 vm_region_basic_info_64* info, uint32_t* count) override;
+    kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
+                                 uint32_t* count) override;
     // Linux has no purgeable memory: always KERN_INVALID_ARGUMENT.
-    kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control,
-                                           int32_t* state) override;
+    kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
     // From /proc/PID/pagemap, and /proc/kpageflags when it is readable.
     // KERN_INVALID_ARGUMENT when the process is gone or a zombie.
-    kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size,
-                                           int32_t* dispositions, uint64_t* count) override;
+    kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
+                                           uint64_t* count) override;
     // True when heft may read physical frame numbers from pagemap (as root).
     bool canIdentifySharedPages() override;
     // From /proc/PID/pagemap: frames of resident anonymous pages that are not
@@ -121,8 +120,7 @@ private:
     bool readStatus(int32_t pid, HTProcStatus& status);
     // The identities of the pages [from, to) of the task's mapping at
     // `index` into `identities`.
-    kern_return_t identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to,
-                                uint64_t* identities);
+    kern_return_t identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to, uint64_t* identities);
     // Whether the frame is a zero page, from its kpageflags.
     bool isZeroFrame(uint64_t frame);
     // /proc/kpageflags when heft may read it (as root), else -1; opened once.

@@ -18,7 +18,7 @@ uint32_t pages(uint64_t bytes, uint64_t pageSize)
 uint32_t maxProtection(const HTSmapsEntry& entry)
 {
     return (entry.hasFlag(HTVmFlagMayRead) ? VM_PROT_READ : 0) | (entry.hasFlag(HTVmFlagMayWrite) ? VM_PROT_WRITE : 0) |
-           (entry.hasFlag(HTVmFlagMayExec) ? VM_PROT_EXECUTE : 0);
+        (entry.hasFlag(HTVmFlagMayExec) ? VM_PROT_EXECUTE : 0);
 }
 
 uint32_t inheritance(const HTSmapsEntry& entry)
@@ -30,24 +30,28 @@ uint32_t inheritance(const HTSmapsEntry& entry)
 
 // Private anonymous memory has no object offset: the maps line shows the
 // page number of its start address there.
-uint64_t objectOffset(const HTSmapsEntry& entry)
-{
-    return entry.hasBackingObject() ? entry.offset : 0;
-}
+uint64_t objectOffset(const HTSmapsEntry& entry) { return entry.hasBackingObject() ? entry.offset : 0; }
 
 }  // namespace
 
 uint32_t htRegionTag(const HTSmapsEntry& entry)
 {
     switch (entry.kind) {
-    case HTSmapsKind::Heap: return HT_VM_TAG_HEAP;
-    case HTSmapsKind::Stack: return HT_VM_TAG_STACK;
-    case HTSmapsKind::SharedMemory: return HT_VM_TAG_SHARED_MEMORY;
-    case HTSmapsKind::KernelProvided: return HT_VM_TAG_KERNEL_PROVIDED;
+    case HTSmapsKind::Heap:
+        return HT_VM_TAG_HEAP;
+    case HTSmapsKind::Stack:
+        return HT_VM_TAG_STACK;
+    case HTSmapsKind::SharedMemory:
+        return HT_VM_TAG_SHARED_MEMORY;
+    case HTSmapsKind::KernelProvided:
+        return HT_VM_TAG_KERNEL_PROVIDED;
     case HTSmapsKind::NamedAnonymous:
-    case HTSmapsKind::NamedSharedMemory: return HT_VM_TAG_NAMED_ANONYMOUS;
-    case HTSmapsKind::File: return HT_VM_TAG_UNTAGGED;
-    case HTSmapsKind::Anonymous: return entry.protection == 0 ? HT_VM_TAG_GUARD : HT_VM_TAG_UNTAGGED;
+    case HTSmapsKind::NamedSharedMemory:
+        return HT_VM_TAG_NAMED_ANONYMOUS;
+    case HTSmapsKind::File:
+        return HT_VM_TAG_UNTAGGED;
+    case HTSmapsKind::Anonymous:
+        return entry.protection == 0 ? HT_VM_TAG_GUARD : HT_VM_TAG_UNTAGGED;
     }
     return HT_VM_TAG_UNTAGGED;
 }

@@ -22,9 +22,7 @@ void closeKeepingErrno(int fd)
 }
 }  // namespace
 
-HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, std::optional<uint64_t> startTime) : pid_(pid), startTime_(startTime)
-{
-}
+HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, std::optional<uint64_t> startTime) : pid_(pid), startTime_(startTime) {}
 
 HTLinuxTaskPort::~HTLinuxTaskPort()
 {

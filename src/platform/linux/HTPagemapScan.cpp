@@ -60,7 +60,7 @@ std::optional<uint64_t> firstPageWithAny(int pagemapFd, uint64_t start, uint64_t
 // [start, end) that have all of `required` and any of `anyOf`, in address
 // order; runs are told apart by those categories and by `alsoReturned`.
 // False when the kernel does not offer the scan or it fails.
-template <typename Found>
+template<typename Found>
 bool scanRuns(int pagemapFd, uint64_t start, uint64_t end, uint64_t required, uint64_t anyOf, uint64_t alsoReturned,
               Found found)
 {

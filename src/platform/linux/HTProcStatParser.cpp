@@ -7,7 +7,7 @@
 namespace {
 
 // Reads one blank-separated integer field and moves past it.
-template <typename Integer>
+template<typename Integer>
 bool takeField(std::string_view& rest, Integer& value)
 {
     size_t start = rest.find_first_not_of(' ');
@@ -65,11 +65,15 @@ std::optional<HTProcStat> htParseProcStat(std::string_view text)
 uint32_t htProcStatusForState(char state)
 {
     switch (state) {
-    case 'R': return SRUN;
+    case 'R':
+        return SRUN;
     case 'Z':
-    case 'X': return SZOMB;
+    case 'X':
+        return SZOMB;
     case 'T':
-    case 't': return SSTOP;
-    default: return SSLEEP;  // S, D, I and the rarer waiting states
+    case 't':
+        return SSTOP;
+    default:
+        return SSLEEP;  // S, D, I and the rarer waiting states
     }
 }

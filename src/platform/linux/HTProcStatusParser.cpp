@@ -15,10 +15,10 @@ HTProcStatus htParseProcStatus(std::string_view text)
         if (colon == std::string_view::npos) continue;
         std::string_view name = line.substr(0, colon);
         std::optional<uint64_t>* field = name == "RssAnon" ? &status.rssAnon
-                                         : name == "VmSwap" ? &status.vmSwap
-                                         : name == "VmPTE"  ? &status.vmPTE
-                                         : name == "VmHWM"  ? &status.vmHWM
-                                                            : nullptr;
+            : name == "VmSwap"                             ? &status.vmSwap
+            : name == "VmPTE"                              ? &status.vmPTE
+            : name == "VmHWM"                              ? &status.vmHWM
+                                                           : nullptr;
         if (field == nullptr) continue;
         std::string_view value = line.substr(colon + 1);
         size_t digits = value.find_first_not_of(" \t");

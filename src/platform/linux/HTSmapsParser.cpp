@@ -12,7 +12,7 @@ constexpr std::string_view kDeletedSuffix = " (deleted)";
 
 // Reads a number in `base` at the front of `text` and drops it; false when
 // there is none.
-template <typename T>
+template<typename T>
 bool takeNumber(std::string_view& text, T& value, int base)
 {
     auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value, base);
@@ -43,7 +43,7 @@ bool parseMapsLine(std::string_view line, HTSmapsEntry& entry)
         !takeChar(line, ' ') || line.size() < 5 || line[4] != ' ')
         return false;
     entry.protection = (line[0] == 'r' ? VM_PROT_READ : 0) | (line[1] == 'w' ? VM_PROT_WRITE : 0) |
-                       (line[2] == 'x' ? VM_PROT_EXECUTE : 0);
+        (line[2] == 'x' ? VM_PROT_EXECUTE : 0);
     entry.shared = line[3] == 's';
     line.remove_prefix(5);
     if (!takeNumber(line, entry.offset, 16) || !takeChar(line, ' ') || !takeNumber(line, entry.devMajor, 16) ||
@@ -67,17 +67,38 @@ uint32_t parseVmFlags(std::string_view text)
     for (size_t at = 0; at + 1 < text.size(); at += 3) {
         // Tokens are two letters, each followed by a blank.
         switch (flagKey(text[at], text[at + 1])) {
-        case flagKey('s', 'h'): flags |= HTVmFlagShared; break;
-        case flagKey('m', 'r'): flags |= HTVmFlagMayRead; break;
-        case flagKey('m', 'w'): flags |= HTVmFlagMayWrite; break;
-        case flagKey('m', 'e'): flags |= HTVmFlagMayExec; break;
-        case flagKey('l', 'o'): flags |= HTVmFlagLocked; break;
-        case flagKey('d', 'c'): flags |= HTVmFlagDontCopy; break;
-        case flagKey('h', 't'): flags |= HTVmFlagHugetlb; break;
-        case flagKey('i', 'o'): flags |= HTVmFlagIO; break;
-        case flagKey('p', 'f'): flags |= HTVmFlagPfnMap; break;
-        case flagKey('m', 'm'): flags |= HTVmFlagMixedMap; break;
-        default: break;
+        case flagKey('s', 'h'):
+            flags |= HTVmFlagShared;
+            break;
+        case flagKey('m', 'r'):
+            flags |= HTVmFlagMayRead;
+            break;
+        case flagKey('m', 'w'):
+            flags |= HTVmFlagMayWrite;
+            break;
+        case flagKey('m', 'e'):
+            flags |= HTVmFlagMayExec;
+            break;
+        case flagKey('l', 'o'):
+            flags |= HTVmFlagLocked;
+            break;
+        case flagKey('d', 'c'):
+            flags |= HTVmFlagDontCopy;
+            break;
+        case flagKey('h', 't'):
+            flags |= HTVmFlagHugetlb;
+            break;
+        case flagKey('i', 'o'):
+            flags |= HTVmFlagIO;
+            break;
+        case flagKey('p', 'f'):
+            flags |= HTVmFlagPfnMap;
+            break;
+        case flagKey('m', 'm'):
+            flags |= HTVmFlagMixedMap;
+            break;
+        default:
+            break;
         }
     }
     return flags;
@@ -112,7 +133,8 @@ uint64_t* sizeField(HTSmapsEntry& entry, std::string_view name)
     case 'K':
         if (name == "KernelPageSize") return &entry.kernelPageSize;
         break;
-    default: break;
+    default:
+        break;
     }
     return nullptr;
 }
@@ -142,10 +164,7 @@ void resetEntry(HTSmapsEntry& entry)
     entry.path = std::move(path);
 }
 
-bool isHexDigit(char c)
-{
-    return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'f');
-}
+bool isHexDigit(char c) { return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'f'); }
 
 }  // namespace
 

@@ -26,16 +26,16 @@ enum class HTSmapsKind : uint8_t {
 
 // The VmFlags heft uses, one bit each.
 enum HTSmapsVmFlag : uint32_t {
-    HTVmFlagShared = 1u << 0,     // sh
-    HTVmFlagMayRead = 1u << 1,    // mr
-    HTVmFlagMayWrite = 1u << 2,   // mw
-    HTVmFlagMayExec = 1u << 3,    // me
-    HTVmFlagLocked = 1u << 4,     // lo (mlock)
-    HTVmFlagDontCopy = 1u << 5,   // dc (MADV_DONTFORK)
-    HTVmFlagHugetlb = 1u << 6,    // ht
-    HTVmFlagIO = 1u << 7,         // io (device memory)
-    HTVmFlagPfnMap = 1u << 8,     // pf (raw page frames, no struct page)
-    HTVmFlagMixedMap = 1u << 9,   // mm (page frames with and without struct page)
+    HTVmFlagShared = 1u << 0,    // sh
+    HTVmFlagMayRead = 1u << 1,   // mr
+    HTVmFlagMayWrite = 1u << 2,  // mw
+    HTVmFlagMayExec = 1u << 3,   // me
+    HTVmFlagLocked = 1u << 4,    // lo (mlock)
+    HTVmFlagDontCopy = 1u << 5,  // dc (MADV_DONTFORK)
+    HTVmFlagHugetlb = 1u << 6,   // ht
+    HTVmFlagIO = 1u << 7,        // io (device memory)
+    HTVmFlagPfnMap = 1u << 8,    // pf (raw page frames, no struct page)
+    HTVmFlagMixedMap = 1u << 9,  // mm (page frames with and without struct page)
 };
 
 struct HTSmapsEntry {
@@ -74,16 +74,10 @@ struct HTSmapsEntry {
     bool hasFlag(HTSmapsVmFlag flag) const { return (vmFlags & flag) != 0; }
     // Device memory: raw page frames, with or without page structures.
     bool mapsDeviceMemory() const { return (vmFlags & (HTVmFlagIO | HTVmFlagPfnMap | HTVmFlagMixedMap)) != 0; }
-    bool isSharedMemory() const
-    {
-        return kind == HTSmapsKind::SharedMemory || kind == HTSmapsKind::NamedSharedMemory;
-    }
+    bool isSharedMemory() const { return kind == HTSmapsKind::SharedMemory || kind == HTSmapsKind::NamedSharedMemory; }
     // Whether pages of this mapping may be mapped by other processes too:
     // resident pages counted shared, or swap slots shared.
-    bool mayShareWithOtherProcesses() const
-    {
-        return sharedClean + sharedDirty + sharedHugetlb != 0 || swapPss < swap;
-    }
+    bool mayShareWithOtherProcesses() const { return sharedClean + sharedDirty + sharedHugetlb != 0 || swapPss < swap; }
     // Backed by a kernel object (a file or a shared-memory inode) that other
     // processes may map as well.
     bool hasBackingObject() const { return kind == HTSmapsKind::File || isSharedMemory(); }
