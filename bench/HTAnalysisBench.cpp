@@ -170,30 +170,33 @@ const std::vector<std::vector<HTScriptedRegion>>& scripts()
     return all;
 }
 
-std::shared_ptr<HTFakePlatform> platformWithBreakdown(bool on)
+HTSettings settingsWithBreakdown(bool on)
 {
-    auto platform = std::make_shared<HTFakePlatform>();
-    platform->sysctlValues["vm.self_region_heft"] = on ? 1 : 0;
-    HTHeft::setBreakDownPhysHeft(*platform, on);
-    return platform;
+    HTSettings settings;
+    settings.breakDownPhysHeft = on;
+    return settings;
 }
 
-HTHeft::ProcessList freshProcesses(const std::shared_ptr<HTFakePlatform>& platform)
+HTHeft::ProcessList freshProcesses(const HTSettings& settings)
 {
+    auto platform = std::make_shared<HTFakePlatform>();
     HTHeft::ProcessList processes;
     processes.reserve(kProcesses);
-    for (int pid = 1; pid <= kProcesses; ++pid)
-        processes.push_back(std::make_shared<HTScriptedProcess>(platform, pid, scripts()[pid - 1]));
+    for (int pid = 1; pid <= kProcesses; ++pid) {
+        auto process = std::make_shared<HTScriptedProcess>(platform, pid, scripts()[pid - 1]);
+        process->setSettings(settings);
+        processes.push_back(std::move(process));
+    }
     return processes;
 }
 
 void BM_AnalysisFull(benchmark::State& state)
 {
-    auto platform = platformWithBreakdown(state.range(0) != 0);
+    const HTSettings settings = settingsWithBreakdown(state.range(0) != 0);
     uint64_t calls = 0;
     for (auto _ : state) {
         state.PauseTiming();
-        auto heft = std::make_unique<HTHeft>(freshProcesses(platform), platform);
+        auto heft = std::make_unique<HTHeft>(freshProcesses(settings), settings);
         auto formatter = std::make_shared<NullFormatter>();
         state.ResumeTiming();
 
@@ -212,10 +215,10 @@ void BM_AnalysisFull(benchmark::State& state)
 
 void BM_AnalysisReport(benchmark::State& state)
 {
-    auto platform = platformWithBreakdown(state.range(0) != 0);
+    const HTSettings settings = settingsWithBreakdown(state.range(0) != 0);
     for (auto _ : state) {
         state.PauseTiming();
-        auto heft = std::make_unique<HTHeft>(freshProcesses(platform), platform);
+        auto heft = std::make_unique<HTHeft>(freshProcesses(settings), settings);
         heft->gatherData();
         auto formatter = std::make_shared<NullFormatter>();
         heft->addOutputFormatter(formatter);
@@ -233,10 +236,10 @@ void BM_AnalysisReport(benchmark::State& state)
 // Gathering, routing, finalising and hefts, without the report.
 void BM_AnalysisGather(benchmark::State& state)
 {
-    auto platform = platformWithBreakdown(state.range(0) != 0);
+    const HTSettings settings = settingsWithBreakdown(state.range(0) != 0);
     for (auto _ : state) {
         state.PauseTiming();
-        auto heft = std::make_unique<HTHeft>(freshProcesses(platform), platform);
+        auto heft = std::make_unique<HTHeft>(freshProcesses(settings), settings);
         state.ResumeTiming();
 
         heft->gatherData();

@@ -1,32 +1,26 @@
 #pragma once
 
 #include "base/HTPidMap.h"
-#include "model/HTCategoryMap.h"
+#include "base/HTSettings.h"
 #include "model/HTIdentitySet.h"
 #include "model/HTMemoryTotals.h"
-#include "platform/HTPlatform.h"
 
 #include <atomic>
 #include <cstdint>
-#include <functional>
 #include <memory>
-#include <unordered_map>
 #include <vector>
 
-class HTHeftSharingData;
 class HTMemoryObject;
 class HTMemoryObjectMap;
 class HTOutputFormatter;
 class HTProcess;
-class HTProcessGroup;
-class HTSignalSource;
 
 // The analysis driver. It gathers every target process's regions in
 // parallel, routes every region to the memory object behind it so that
 // memory mapped by several regions or processes counts once, finalises the
-// objects, computes each process's heft, and feeds the report to the
-// attached formatters: every process's private and shared memory, by
-// category, and the summary across processes.
+// objects, computes each process's heft, and hands the report to
+// HTHeftReport, which feeds the attached formatters; HTSharingAnalysis
+// groups the objects by the processes that map them.
 //
 // An instance gathers once and prints once, on one thread; only cancel()
 // may be called from another thread.
@@ -46,30 +40,14 @@ public:
     static constexpr const char* kUnidentifiedSharedPagesNotice =
         "Memory shared after fork may be counted more than once: telling its pages apart needs root";
 
-    // The targets, in the order given; that order is kept for routing.
-    HTHeft(ProcessList processes, std::shared_ptr<HTPlatform> platform);
+    // The targets, in the order given; that order is kept for routing. The
+    // settings are those the processes were made with.
+    HTHeft(ProcessList processes, const HTSettings& settings);
     ~HTHeft();
     HTHeft(const HTHeft&) = delete;
     HTHeft& operator=(const HTHeft&) = delete;
 
-    // Whether the kernel reports per-region physical heft for this program
-    // (the breakdown mode). The value lives in the kernel setting
-    // "vm.self_region_heft"; the class caches what it last read.
-    static bool breakDownPhysHeft(HTPlatform& platform);
-    static void setBreakDownPhysHeft(HTPlatform& platform, bool enabled);
-
-    // When on, regions join their memory objects without their process, so
-    // that no per-process views arise.
-    static bool isSharingAnalysisDisabled();
-    static void setSharingAnalysisDisabled(bool disabled);
-
-    // With standard output redirected, turns SIGINT into a call of
-    // `callback` on a thread of its own, so that an interrupted run still
-    // writes its report; null when standard output is a terminal, where
-    // Ctrl-C keeps ending the program at once. Cancel the source on the
-    // thread that installed it once gathering is over.
-    static std::unique_ptr<HTSignalSource> installCancelHandler(HTPlatform& platform, std::function<void()> callback);
-
+    const HTSettings& settings() const { return settings_; }
     const ProcessList& processes() const { return processes_; }
     // The heft of every visible process, filled by gatherData.
     const HTPidMap<uint64_t>& pidToHeft() const { return pidToHeft_; }
@@ -108,23 +86,10 @@ public:
     // short names. Called once, after gatherData: it releases the object
     // maps.
     void printOutputVerbose(bool verbose, bool summarize);
-    void printSpanlistLikeOutputForProcesses(const ProcessList& processes);
 
 protected:
     // Routes every region of the process to its memory object.
     void _addProcess(const std::shared_ptr<HTProcess>& process);
-
-    // Which processes map which objects, grouped by sets of processes.
-    std::unique_ptr<HTHeftSharingData> _sharingData();
-
-    // The objects as `process` sees them, in categories. `hasProcessView`,
-    // when given, learns whether any object looked different to this process
-    // than it is as a whole.
-    HTCategoryMap _categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
-                                        bool summarize);
-    // Every object a visible process maps, once, whole.
-    HTCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize);
-    static void _totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* outTotal);
 
     // Dirty plus swapped bytes charged to the process.
     uint64_t _calculateHeftForProcess(HTProcess& process);
@@ -137,24 +102,10 @@ protected:
     ProcessList _processesBySortingHeft(const ProcessList& processes) const;
 
 private:
-    // One table of a process's report: a group's objects as the process
-    // sees them, in categories, and their total.
-    struct GroupTable {
-        HTCategoryMap categories;
-        HTMemoryTotals total;
-        bool hasProcessView = false;
-    };
-    using CommonTables = std::unordered_map<const HTProcessGroup*, GroupTable>;
-
-    // The table of `group` for `process`. A shared group whose objects look
-    // the same to every process has one table for all its members, made on
-    // first use and kept in `common`; any other table is made in `scratch`.
-    const GroupTable& tableForGroup(const HTProcessGroup& group, const ObjectSet& objects, HTProcess& process,
-                                    bool summarize, CommonTables& common, GroupTable& scratch);
     void releaseMemoryObjectMaps();
     void reportUnidentifiedSharedPages() const;
 
-    std::shared_ptr<HTPlatform> platform_;
+    HTSettings settings_;
     ProcessList processes_;
     HTPidMap<uint64_t> pidToHeft_;
     std::unique_ptr<HTMemoryObjectMap> memoryObjects_;

@@ -1,7 +1,7 @@
 #include "analysis/HTHeftSharingData.h"
 
-#include "analysis/HTProcessGroup.h"
 #include "model/HTMemoryObject.h"
+#include "process/HTProcessGroup.h"
 
 void HTProcessGroupOrderedSet::insertAtFront(const std::shared_ptr<HTProcessGroup>& group)
 {

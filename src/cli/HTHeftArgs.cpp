@@ -1,6 +1,6 @@
 #include "cli/HTHeftArgs.h"
 
-#include "process/HTProcess.h"
+#include "process/HTProcessDiscovery.h"
 
 #include <getopt.h>
 #include <strings.h>
@@ -203,7 +203,7 @@ bool HTHeftArgs::_applyPid(const char* argument, HTError* error)
 {
     // A pid is a whole number within the range of pids: "12abc" or a value
     // that would wrap to another pid names no process.
-    std::optional<int32_t> pid = HTProcess::pidForText(argument);
+    std::optional<int32_t> pid = HTProcessDiscovery::pidForText(argument);
     if (!pid)
         return fail(error, HTHeftErrorCodePid,
                     stringWithFormat("'%s' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
@@ -255,103 +255,28 @@ void HTHeftArgs::_settleUnmapped()
     }
 }
 
-// --- target selection -------------------------------------------------------
-
-std::optional<std::vector<std::shared_ptr<HTProcess>>>
-HTHeftArgs::targetProcessesAndError(const std::shared_ptr<HTPlatform>& platform, HTError* error)
+HTSettings HTHeftArgs::settings() const
 {
-    if (error) *error = HTError();
-    HTProcess::ProcessMap result;
-
-    // Snapfile pass: operands that name existing files are opened as
-    // snapfiles before anything else, and their processes enter `result`.
-    // Until heft reads snapfiles, every operand goes on to process discovery.
-
-    if (targetPids_.empty() && potentialTargetProcesses_.empty() && result.empty() && !targetAll_) {
-        fail(error, HTHeftErrorCodeNoTarget, "Must specify at least one process or snapfile");
-        return std::nullopt;
-    }
-
-    std::set<int32_t> excluded = _excludedPids(*platform);
-    if (targetAll_) {
-        // Every live process but the excluded ones; the operands and any
-        // snapfiles are not used.
-        result = HTProcess::allProcessesExcludingPids(platform, excluded).value_or(HTProcess::ProcessMap());
-    } else {
-        _resolvePotentialTargets(*platform);
-        for (int32_t pid : excluded) targetPids_.erase(pid);
-        // After the exclusions on purpose: -t reaches every descendant, even
-        // an excluded one.
-        if (targetChildren_) _addDescendantsOfTargets(*platform);
-        if (searchForUnmapped_) result = _hiddenProcessesForUnmapped(platform, excluded);
-        _addTargetProcesses(platform, result);
-    }
-    if (skipIdleExitClean_) result = HTProcess::removeIdleExitCleanProcessesFrom(result);
-
-    std::vector<std::shared_ptr<HTProcess>> processes;
-    processes.reserve(result.size());
-    for (const auto& entry : result) processes.push_back(entry.second);
-    return processes;
+    HTSettings settings;
+    settings.breakDownPhysHeft = shouldGetPhysHeftBreakdown_;
+    settings.summaryFormat = summaryFormat_;
+    settings.textOptions = textOptions_;
+    settings.textSort = textSort_;
+    settings.verbose = spanlistLikeOutput_;
+    settings.summarize = summarize_;
+    return settings;
 }
 
-std::set<int32_t> HTHeftArgs::_excludedPids(HTPlatform& platform) const
+HTTargetSelection::Request HTHeftArgs::targetRequest() const
 {
-    std::set<int32_t> excluded;
-    if (excludeSelf_) excluded.insert(platform.getpid());
-    if (!excludedPidsOrProcesses_.empty()) {
-        // Exclusions that match nothing are not worth a message.
-        auto pids = HTProcess::pidsForStringDescriptions(platform, excludedPidsOrProcesses_.values(), nullptr);
-        if (pids)
-            for (const auto& entry : *pids) excluded.insert(entry.first);
-    }
-    return excluded;
-}
-
-void HTHeftArgs::_resolvePotentialTargets(HTPlatform& platform)
-{
-    if (potentialTargetProcesses_.empty()) return;
-    std::vector<std::string> errors;
-    auto pids = HTProcess::pidsForStringDescriptions(platform, potentialTargetProcesses_.values(), &errors);
-    if (pids)
-        for (const auto& [pid, name] : *pids) targetPids_.set(pid, name);
-    // An operand that matches nothing does not stop the others.
-    for (const auto& message : errors) std::fprintf(stderr, "%s\n", message.c_str());
-}
-
-void HTHeftArgs::_addDescendantsOfTargets(HTPlatform& platform)
-{
-    auto pids = HTProcess::childPidsForPids(platform, targetPids_.keys());
-    if (!pids) return;
-    // Targets found by name lose their name here: from now on they are
-    // reported by pid, like the descendants.
-    for (int32_t pid : *pids) targetPids_.set(pid, std::nullopt);
-}
-
-HTProcess::ProcessMap HTHeftArgs::_hiddenProcessesForUnmapped(const std::shared_ptr<HTPlatform>& platform,
-                                                              const std::set<int32_t>& excluded) const
-{
-    // Every other process is analysed for memory that a target owns without
-    // mapping it; those processes are not reported themselves. The kernel
-    // owns nothing a user process could have unmapped, so it stays out.
-    std::set<int32_t> skipped = excluded;
-    for (int32_t pid : targetPids_.keys()) skipped.insert(pid);
-    skipped.insert(0);
-    auto others = HTProcess::allProcessesExcludingPids(platform, skipped);
-    if (!others) return {};
-    for (const auto& entry : *others) entry.second->setHiddenFromDisplay(true);
-    return std::move(*others);
-}
-
-void HTHeftArgs::_addTargetProcesses(const std::shared_ptr<HTPlatform>& platform, HTProcess::ProcessMap& result) const
-{
-    for (const auto& [pid, name] : targetPids_) {
-        if (auto process = HTProcess::processWithPid(platform, pid)) {
-            result.set(pid, std::move(process));
-        } else if (name) {
-            std::fprintf(stderr, "Unable to analyze process %s [%ld] (try as root?)\n", name->c_str(),
-                         static_cast<long>(pid));
-        } else {
-            std::fprintf(stderr, "Unable to analyze process with pid %ld (try as root?)\n", static_cast<long>(pid));
-        }
-    }
+    HTTargetSelection::Request request;
+    request.targetPids = targetPids_;
+    request.potentialTargetProcesses = potentialTargetProcesses_.values();
+    request.excludedPidsOrProcesses = excludedPidsOrProcesses_.values();
+    request.targetAll = targetAll_;
+    request.targetChildren = targetChildren_;
+    request.searchForUnmapped = searchForUnmapped_;
+    request.skipIdleExitClean = skipIdleExitClean_;
+    request.excludeSelf = excludeSelf_;
+    return request;
 }

@@ -2,36 +2,21 @@
 
 #include "base/HTError.h"
 #include "base/HTPidMap.h"
+#include "base/HTSettings.h"
 #include "cli/HTOrderedStringSet.h"
-#include "output/HTOutputFormatterText.h"
-#include "platform/HTPlatform.h"
 #include "process/HTProcess.h"
+#include "process/HTTargetSelection.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
-// Codes of the "HTHeftError" domain: command-line and target-selection
-// failures.
-enum : int64_t {
-    HTHeftErrorCodeCreation = 0,      // the arguments object could not be made
-    HTHeftErrorCodeHelp = 1,          // -h / --help: usage, status 0
-    HTHeftErrorCodeFormat = 2,        // bad -f / --format value
-    HTHeftErrorCodeSort = 3,          // bad --sort value
-    HTHeftErrorCodePid = 4,           // --pid value without digits
-    HTHeftErrorCodeOption = 5,        // unknown option or missing argument
-    HTHeftErrorCodeSnapfileMode = 6,  // snapfiles disagree on the analysis mode
-    HTHeftErrorCodeSnapfileOpen = 7,  // an existing file that is no snapfile and no process
-    HTHeftErrorCodeNoTarget = 8,      // nothing to analyse
-};
-
 // Everything the command line says: which processes to analyse and which
 // to leave out, the analysis mode and the report options. Parsing only
-// records what was written; targetProcessesAndError() later turns the
-// pids, names and files into process objects.
+// records what was written; HTTargetSelection later turns the pids, names
+// and files into process objects.
 class HTHeftArgs {
 public:
     // Pid to the name it was found by, or nullopt when it was given as a pid.
@@ -50,12 +35,10 @@ public:
     static const std::vector<std::string>& sortColumns();
     static const std::string& defaultSortColumn();
 
-    // The processes to analyse: live processes found by pid and name, with
-    // the exclusions, -t, -a, --unmapped and -s applied. nullopt and an error
-    // when the command line names nothing to analyse; an empty list when
-    // nothing could be opened. Updates targetPids and the mode fields.
-    std::optional<std::vector<std::shared_ptr<HTProcess>>>
-    targetProcessesAndError(const std::shared_ptr<HTPlatform>& platform, HTError* error);
+    // The settings of the run the command line asks for.
+    HTSettings settings() const;
+    // The processes the command line names, for target selection.
+    HTTargetSelection::Request targetRequest() const;
 
     // --- fields ----------------------------------------------------------
     bool targetChildren() const { return targetChildren_; }
@@ -100,14 +83,6 @@ private:
     bool _applyFormat(const char* argument, HTError* error);
     // Resolves the conflicts of --unmapped with the other modes.
     void _settleUnmapped();
-
-    // Target selection, in the order it runs.
-    std::set<int32_t> _excludedPids(HTPlatform& platform) const;
-    void _resolvePotentialTargets(HTPlatform& platform);
-    void _addDescendantsOfTargets(HTPlatform& platform);
-    HTProcess::ProcessMap _hiddenProcessesForUnmapped(const std::shared_ptr<HTPlatform>& platform,
-                                                      const std::set<int32_t>& excluded) const;
-    void _addTargetProcesses(const std::shared_ptr<HTPlatform>& platform, HTProcess::ProcessMap& result) const;
 
     bool targetChildren_ = false;
     bool targetAll_ = false;

@@ -2,12 +2,13 @@
 
 #include "analysis/HTHeft.h"
 #include "base/HTNoticeLog.h"
+#include "cli/HTCancelHandler.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
 #include "output/HTOutputFormatterJSON.h"
 #include "output/HTOutputFormatterText.h"
 #include "output/HTTerminalText.h"
-#include "platform/HTSignalSource.h"
+#include "process/HTTargetSelection.h"
 
 #include <cerrno>
 #include <cstdio>
@@ -32,11 +33,12 @@ bool needsRoot(const HTHeftArgs& args) { return args.targetAll() || args.searchF
 
 // The JSON file is opened before the analysis, so that a path that cannot
 // be written is reported at once; the run then goes on without it.
-std::shared_ptr<HTOutputFormatterJSON> openJSONFormatter(const HTHeftArgs& args, HTPlatform& platform)
+std::shared_ptr<HTOutputFormatterJSON> openJSONFormatter(const HTHeftArgs& args, const HTSettings& settings,
+                                                         HTPlatform& platform)
 {
     if (!args.JSONOutputFile()) return nullptr;
     std::string errorText;
-    auto formatter = HTOutputFormatterJSON::initWithPath(*args.JSONOutputFile(), HTHeft::breakDownPhysHeft(platform),
+    auto formatter = HTOutputFormatterJSON::initWithPath(*args.JSONOutputFile(), settings.breakDownPhysHeft,
                                                          platform.vm_kernel_page_size(), &errorText);
     if (!formatter) std::fprintf(stderr, "%s\n", errorText.c_str());
     return formatter;
@@ -55,7 +57,7 @@ void tellNotices()
 // gathering early and the report of what was gathered still follows.
 void gather(HTHeft& heft, HTPlatform& platform)
 {
-    auto source = HTHeft::installCancelHandler(platform, [&heft] {
+    auto source = installCancelHandler(platform, [&heft] {
         heft.cancel();
         std::fprintf(stderr, "Exiting early due to SIGINT\n");
     });
@@ -75,9 +77,7 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
     std::unique_ptr<HTHeftArgs> args = HTHeftArgs::initWithArgc(argc, argv, &error);
     if (!args) return reportArgumentError(error);
 
-    // The breakdown mode is the default; --vmObjectDirty leaves the kernel
-    // setting as it found it.
-    if (args->shouldGetPhysHeftBreakdown()) HTHeft::setBreakDownPhysHeft(*platform, true);
+    const HTSettings settings = args->settings();
 
     if (needsRoot(*args) && platform->geteuid() != 0) {
         std::fprintf(stderr, "Must run as root.\n");
@@ -85,7 +85,8 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
     }
 
     stage = "listing the processes";
-    auto targets = args->targetProcessesAndError(platform, &error);
+    HTTargetSelection selection(platform, settings, args->targetRequest());
+    auto targets = selection.targetProcessesAndError(&error);
     // With nothing to gather, what befell the processes is said now.
     if (!targets || targets->empty()) tellNotices();
     if (!targets) {
@@ -99,18 +100,17 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
         return 1;
     }
 
-    auto jsonFormatter = openJSONFormatter(*args, *platform);
+    auto jsonFormatter = openJSONFormatter(*args, settings, *platform);
     // A report that could not be written whole ends the run in failure.
     int status = args->JSONOutputFile() && !jsonFormatter ? 1 : 0;
     stage = "gathering the processes' memory";
-    HTHeft heft(std::move(*targets), platform);
+    HTHeft heft(std::move(*targets), settings);
     gather(heft, *platform);
     stage = "writing the report";
 
-    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(
-        args->summaryFormat(), args->textOptions(), args->textSort(), HTHeft::breakDownPhysHeft(*platform)));
+    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings));
     if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
-    heft.printOutputVerbose(args->spanlistLikeOutput(), args->summarize());
+    heft.printOutputVerbose(settings.verbose, settings.summarize);
     if (jsonFormatter && jsonFormatter->writeError()) {
         std::fprintf(stderr, "%s\n", jsonFormatter->writeError()->c_str());
         status = 1;

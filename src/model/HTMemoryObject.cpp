@@ -2,7 +2,6 @@
 
 #include "base/HTAssert.h"
 #include "model/HTMemoryRegion.h"
-#include "process/HTProcess.h"
 
 #include <algorithm>
 
@@ -15,18 +14,18 @@ const std::optional<std::string> kNoName;
 HTMemoryObject::HTMemoryObject() : memoryRegions_(std::make_shared<RegionSet>()) {}
 HTMemoryObject::~HTMemoryObject() = default;
 
-void HTMemoryObject::addRegion(const std::shared_ptr<HTMemoryRegion>& region, const HTProcess& process)
+void HTMemoryObject::addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize, int32_t pid)
 {
-    _addRegion(region, process.pageSize(), &process);
+    _addRegion(region, pageSize, pid);
 }
 
 void HTMemoryObject::addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize)
 {
-    _addRegion(region, pageSize, nullptr);
+    _addRegion(region, pageSize, std::nullopt);
 }
 
 void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize,
-                                const HTProcess* process)
+                                std::optional<int32_t> pid)
 {
     if (accurateSizes_) HT_FATAL("HTMemoryObject", "region added to a finalised object");
     HT_ASSERT("HTMemoryObject", region != nullptr, "region != nil");
@@ -37,8 +36,7 @@ void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, u
 
     // Once one region has made the object worth viewing per process, every
     // later region is recorded so that each process's list is complete.
-    if (process && (processMemoryRegions_ || region->eligibleForProcessView()))
-        recordRegionForProcess(region, process->pid());
+    if (pid && (processMemoryRegions_ || region->eligibleForProcessView())) recordRegionForProcess(region, *pid);
 
     if (!rangeList_) rangeList_ = std::make_unique<HTRangeList>();
     rangeList_->addRegion(*region, pageSize);
@@ -173,22 +171,23 @@ HTMemoryRegion* HTMemoryObject::_canonicalRegion() const
     return first;
 }
 
-std::shared_ptr<HTMemoryObject> HTMemoryObject::viewForProcess(HTProcess& process, bool breakDownPhysHeft)
+std::shared_ptr<HTMemoryObject> HTMemoryObject::viewForProcess(int32_t pid, uint64_t pageSize, bool processBreakDown,
+                                                               bool breakDownPhysHeft)
 {
     std::shared_ptr<HTMemoryObject> view = shared_from_this();
     if (processMemoryRegions_ && !processMemoryRegions_->empty()) {
-        const RegionList* regions = processMemoryRegions_->find(process.pid());
+        const RegionList* regions = processMemoryRegions_->find(pid);
         // The process maps the object through none of the regions kept apart:
         // it sees the object whole, whoever owns it.
         if (!regions) return view;
         view = std::make_shared<HTMemoryObject>();
         view->setOwnerPid(ownerPid_);
-        for (const auto& region : *regions) view->addRegion(region, process.pageSize());
-        view->finalizeUsingRegionDirtySize(process.breakDownPhysHeft(), breakDownPhysHeft);
+        for (const auto& region : *regions) view->addRegion(region, pageSize);
+        view->finalizeUsingRegionDirtySize(processBreakDown, breakDownPhysHeft);
     }
 
     // Memory another process owns is shown as clean to everyone else.
-    if (ownerPid_ != -1 && ownerPid_ != process.pid()) {
+    if (ownerPid_ != -1 && ownerPid_ != pid) {
         std::shared_ptr<HTMemoryObject> shown = view->copy();
         shown->totalDirtySize_ = 0;
         shown->totalSwappedSize_ = 0;

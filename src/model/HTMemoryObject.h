@@ -11,7 +11,6 @@
 #include <vector>
 
 class HTMemoryRegion;
-class HTProcess;
 
 // One kernel VM object, or one process's private copy-on-write instance of
 // it, with every region of every analysed process that maps it. Finalising
@@ -58,9 +57,10 @@ public:
     const HTRangeList* rangeList() const { return rangeList_.get(); }
     void setRangeList(std::unique_ptr<HTRangeList> list) { rangeList_ = std::move(list); }
 
-    // Adds a region mapped by `process`, recording it per process. Each
-    // region is added once: its pages would otherwise count twice.
-    void addRegion(const std::shared_ptr<HTMemoryRegion>& region, const HTProcess& process);
+    // Adds a region mapped by the process `pid`, whose pages are `pageSize`
+    // bytes, recording it per process. Each region is added once: its pages
+    // would otherwise count twice.
+    void addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize, int32_t pid);
     // Adds a region without recording a process.
     void addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize);
 
@@ -72,11 +72,13 @@ public:
     // are the regions' own figures summed, without page de-duplication.
     void finalizeUsingRegionDirtySize(bool useRegionDirtySize, bool breakDownPhysHeft);
 
-    // The object as `process` sees it: a finalised view built from that
-    // process's own regions when the object kept them apart, shown as clean
-    // when another process owns it, else this object itself. (The process is
-    // not const: asking it for its heft mode may read the kernel setting.)
-    std::shared_ptr<HTMemoryObject> viewForProcess(HTProcess& process, bool breakDownPhysHeft);
+    // The object as the process `pid` sees it: a finalised view built from
+    // that process's own regions (of `pageSize` bytes a page, counted after
+    // the process's own mode `processBreakDown`) when the object kept them
+    // apart, shown as clean when another process owns it, else this object
+    // itself.
+    std::shared_ptr<HTMemoryObject> viewForProcess(int32_t pid, uint64_t pageSize, bool processBreakDown,
+                                                   bool breakDownPhysHeft);
     // Whether viewForProcess gives every process this object itself.
     bool looksTheSameToEveryProcess() const
     {
@@ -94,7 +96,7 @@ public:
     std::optional<std::string> fullName() const;
 
 protected:
-    void _addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize, const HTProcess* process);
+    void _addRegion(const std::shared_ptr<HTMemoryRegion>& region, uint64_t pageSize, std::optional<int32_t> pid);
     // The region that names the object; null when the set is empty.
     HTMemoryRegion* _canonicalRegion() const;
 

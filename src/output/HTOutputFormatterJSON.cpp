@@ -1,6 +1,6 @@
 #include "output/HTOutputFormatterJSON.h"
 
-#include "analysis/HTProcessGroup.h"
+#include "process/HTProcessGroup.h"
 #include "base/HTAssert.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"

@@ -1,6 +1,5 @@
 #include "output/HTOutputFormatterText.h"
 
-#include "analysis/HTProcessGroup.h"
 #include "base/HTAssert.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
@@ -10,6 +9,7 @@
 #include "output/HTSizeText.h"
 #include "output/HTTerminalText.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessGroup.h"
 
 #include <algorithm>
 #include <charconv>
@@ -89,11 +89,13 @@ CategoryOrder orderForSortColumn(const std::string& sort)
 
 }  // namespace
 
-HTOutputFormatterText::HTOutputFormatterText(int64_t summaryFormat, int64_t options, std::string sort,
-                                             bool breakDownPhysHeft, FILE* output)
-    : summaryFormat_(summaryFormat), sort_(std::move(sort)), output_(output), breakDownPhysHeft_(breakDownPhysHeft)
+HTOutputFormatterText::HTOutputFormatterText(const HTSettings& settings, FILE* output)
+    : summaryFormat_(settings.summaryFormat),
+      sort_(settings.textSort),
+      output_(output),
+      breakDownPhysHeft_(settings.breakDownPhysHeft)
 {
-    setOptions(options);
+    setOptions(settings.textOptions);
 }
 
 void HTOutputFormatterText::setOptions(int64_t value)

@@ -1,5 +1,6 @@
 #pragma once
 
+#include "base/HTSettings.h"
 #include "model/HTCategoryMap.h"
 #include "output/HTOutputFormatter.h"
 
@@ -12,26 +13,16 @@
 
 class HTAuxDataMap;
 
-// Option bits of the text report.
-inline constexpr int64_t HTTextOptionWired = 1;    // show the wired column
-inline constexpr int64_t HTTextOptionSwapped = 2;  // show the swapped column
-inline constexpr int64_t HTTextOptionWide = 4;     // never shorten names
-
-// How the text report writes a size.
-inline constexpr int64_t HTTextFormatBytes = 0;
-inline constexpr int64_t HTTextFormatFormatted = 1;
-inline constexpr int64_t HTTextFormatPages = 2;
-
 // The human-readable report: the region listings, each process's header,
 // its category tables and auxiliary data, the run's diagnostics, and the
 // summary across processes. Sizes are written in bytes, with a unit prefix
 // or in pages after the summary format; the listing always counts pages.
 class HTOutputFormatterText : public HTOutputFormatter {
 public:
-    // `breakDownPhysHeft` is the run-wide counting mode, passed in because a
-    // formatter never asks the platform; with it off the summary says so.
-    HTOutputFormatterText(int64_t summaryFormat, int64_t options, std::string sort, bool breakDownPhysHeft,
-                          FILE* output = stdout);
+    // The summary format, the option bits and the sort column come from the
+    // settings, and so does the counting mode: with the breakdown off the
+    // summary says so.
+    explicit HTOutputFormatterText(const HTSettings& settings, FILE* output = stdout);
 
     int64_t summaryFormat() const { return summaryFormat_; }
     void setSummaryFormat(int64_t value) { summaryFormat_ = value; }

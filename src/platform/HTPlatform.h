@@ -55,7 +55,7 @@ public:
     // {CTL_KERN, KERN_PROCARGS2, pid}. 0, or -1 and errno.
     virtual int sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
                        size_t newlen) = 0;
-    // sysctl by name ("vm.self_region_heft", "vm.get_owned_vmobjects").
+    // sysctl by name ("vm.get_owned_vmobjects").
     // 0, or -1 and errno (ENOENT: no such setting).
     virtual int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) = 0;
 
@@ -149,8 +149,6 @@ public:
     }
     // The path with symbolic links resolved; nullopt when it cannot be.
     virtual std::optional<std::string> realpath(const std::string& path) { return std::nullopt; }
-    // The platform's text for a VM tag, when it has one.
-    virtual std::optional<std::string> describeRegionType(uint32_t tag) { return std::nullopt; }
 
     // --- the calling program -------------------------------------------
     virtual int32_t getpid() = 0;

@@ -34,8 +34,6 @@ public:
     // calling thread if it was not blocked before. Later calls do nothing.
     void cancel();
 
-    int signalNumber() const { return signo_; }
-
 private:
     HTSignalSource(int signo, std::function<void()> handler);
     void listen();

@@ -1,12 +1,12 @@
 #pragma once
 
 #include "base/HTPidMap.h"
+#include "base/HTSettings.h"
 #include "platform/HTPlatform.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
-#include <set>
 #include <string>
 #include <vector>
 
@@ -22,8 +22,8 @@ enum : int32_t {
 };
 
 // A process as the analysis sees it: a live user process, the kernel, a
-// corpse or a saved snapfile. Subclasses fill memoryRegions in gatherData.
-// The class-level operations discover the processes of the running system.
+// corpse or a saved snapfile. Subclasses fill memoryRegions in gatherData,
+// after the run's settings; HTProcessDiscovery finds and makes them.
 class HTProcess {
 public:
     // Map from pid to the name it was found by, or nullopt when it was given
@@ -48,7 +48,13 @@ public:
     virtual bool _isAlive();
     // Null stands for "no auxiliary data".
     virtual std::shared_ptr<HTAuxDataMap> auxData();
-    virtual bool breakDownPhysHeft();
+
+    // --- the run's settings ------------------------------------------------
+    // Set when the process is made, before it is gathered.
+    const HTSettings& settings() const { return settings_; }
+    void setSettings(const HTSettings& settings) { settings_ = settings; }
+    bool breakDownPhysHeft() const { return settings_.breakDownPhysHeft; }
+    bool sharingAnalysisDisabled() const { return settings_.sharingAnalysisDisabled; }
 
     // --- fields ----------------------------------------------------------
     int32_t pid() const { return pid_; }
@@ -82,31 +88,21 @@ public:
     HTPlatform& platform() const { return *platform_; }
     const std::shared_ptr<HTPlatform>& sharedPlatform() const { return platform_; }
 
-    // --- process discovery ---------------------------------------------
-    static std::shared_ptr<HTProcess> processWithBsdInfo(const std::shared_ptr<HTPlatform>& platform,
-                                                         const proc_bsdinfo& info);
-    static std::shared_ptr<HTProcess> processWithPid(const std::shared_ptr<HTPlatform>& platform, int32_t pid);
+    // The name a process record stands for: the executable's file name from
+    // its arguments, else the record's own short name.
     static std::string _nameForBsdInfo(HTPlatform& platform, const proc_bsdinfo& info);
-    // The pid a command line names: a whole decimal number, leading blanks
-    // allowed, within the range of pids; nullopt for anything else.
-    static std::optional<int32_t> pidForText(const std::string& text);
     static std::string _nameForBsdInfoCommName(const proc_bsdinfo& info);
-    // nullopt when the system process list cannot be read.
-    static std::optional<ProcessMap> allProcessesExcludingPids(const std::shared_ptr<HTPlatform>& platform,
-                                                               const std::set<int32_t>& excludedPids);
-    static std::optional<PidDescriptionMap> pidsForStringDescriptions(HTPlatform& platform,
-                                                                      const std::vector<std::string>& descriptions,
-                                                                      std::vector<std::string>* errors);
-    static std::optional<std::vector<int32_t>> childPidsForPids(HTPlatform& platform, const std::vector<int32_t>& pids);
-    static ProcessMap removeIdleExitCleanProcessesFrom(const ProcessMap& processes);
 
     // The program-wide list of errors not tied to one process. Written on
     // the main thread only.
-    // Labels the threads that set up the processes of a listing.
-    static constexpr const char* kSetupQueueLabel = "heft.setup";
     static void _addGlobalError(std::string error);
     static std::vector<std::string> globalErrors();
     static void _clearGlobalErrors();
+    // While set, errors added on the calling thread go to `list` rather than
+    // to the global list: processes set up side by side each keep theirs
+    // apart, and the caller adds them in the order of its own list. Returns
+    // the list it replaces; null restores the global list.
+    static std::vector<std::string>* _captureGlobalErrors(std::vector<std::string>* list);
 
 protected:
     void addError(std::string error) { errors_.push_back(std::move(error)); }
@@ -114,6 +110,7 @@ protected:
 
 private:
     std::shared_ptr<HTPlatform> platform_;
+    HTSettings settings_;
     int32_t pid_ = 0;
     bool is64bit_ = false;
     int32_t idleExitStatus_ = HTIdleExitStatusUnknown;

@@ -1,6 +1,5 @@
 #include "process/HTUserProcess.h"
 
-#include "analysis/HTHeft.h"
 #include "base/HTAssert.h"
 #include "base/HTMix.h"
 #include "base/HTNoticeLog.h"
@@ -852,7 +851,7 @@ void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies
 {
     const uint64_t page = pageSize();
     const bool hidden = hiddenFromDisplay();
-    const bool sharingDisabled = HTHeft::isSharingAnalysisDisabled();
+    const bool sharingDisabled = sharingAnalysisDisabled();
     const bool subranges = breakDownPhysHeft() && !sharingDisabled && !hidden;
     // Private memory that other processes map as well, after a fork, is
     // named page by page so that the analysis counts each page once.

@@ -3,6 +3,7 @@
 
 #include "analysis/HTHeftTestSupport.h"
 #include "base/HTNoticeLog.h"
+#include "cli/HTCancelHandler.h"
 #include "platform/HTSignalSource.h"
 #include "platform/HTWorkQueue.h"
 #include "process/HTUserProcess.h"
@@ -138,11 +139,11 @@ TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
 
     // On a terminal Ctrl-C keeps its default action.
     platform_->terminals = {1};
-    EXPECT_EQ(HTHeft::installCancelHandler(*platform_, [] {}), nullptr);
+    EXPECT_EQ(installCancelHandler(*platform_, [] {}), nullptr);
     platform_->terminals.clear();
 
-    HTHeftProbe heft(processes, platform_);
-    std::unique_ptr<HTSignalSource> source = HTHeft::installCancelHandler(*platform_, [&] {
+    HTHeftProbe heft(processes, settings_);
+    std::unique_ptr<HTSignalSource> source = installCancelHandler(*platform_, [&] {
         heft.cancel();
         gate->open();
     });

@@ -114,7 +114,7 @@ TEST_F(HTHeftRoutingTest, SwitchesDecideOwnersAndProcessViews)
     secondPage.offset = kPage;
     auto run = [&](bool breakdown, bool sharingDisabled) {
         setBreakdown(breakdown);
-        HTHeft::setSharingAnalysisDisabled(sharingDisabled);
+        settings_.sharingAnalysisDisabled = sharingDisabled;
         auto p10 = process(10, {owned});
         auto p20 = process(20, {dirtyPages(0x500, 1), secondPage});
         auto heft = gathered({p10, p20});

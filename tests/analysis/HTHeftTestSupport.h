@@ -1,9 +1,12 @@
 #pragma once
 
 #include "analysis/HTHeft.h"
+#include "analysis/HTHeftReport.h"
+#include "analysis/HTHeftSharingData.h"
 #include "analysis/HTMemoryObjectMap.h"
 #include "analysis/HTRecordingFormatter.h"
 #include "analysis/HTScriptedProcess.h"
+#include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
 
 #include <gtest/gtest.h>
@@ -19,45 +22,53 @@ public:
     using HTHeft::_addProcess;
     using HTHeft::_buildProcessToHeftMap;
     using HTHeft::_calculateHeftForProcess;
-    using HTHeft::_categoriesForAllProcessesShouldSummarize;
-    using HTHeft::_categoriesForObjects;
     using HTHeft::_notHiddenProcesses;
     using HTHeft::_processesBySortingHeft;
     using HTHeft::_processesBySortingPidDesc;
-    using HTHeft::_sharingData;
-    using HTHeft::_totalForCategories;
     using HTHeft::HTHeft;
+
+    std::unique_ptr<HTHeftSharingData> _sharingData()
+    {
+        return HTSharingAnalysis::sharingDataForProcesses(processes());
+    }
+    HTCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize)
+    {
+        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
+            ._categoriesForAllProcesses(processes());
+    }
+    HTCategoryMap _categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
+                                        bool summarize)
+    {
+        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
+            ._categoriesForObjects(objects, process, hasProcessView);
+    }
+    static void _totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* total)
+    {
+        HTHeftReport::_totalForCategories(categories, total);
+    }
 };
 
-// Scripted processes on a fake platform. The analysis switches and the
-// global error list are program-wide, so every test starts and ends with
-// them in their default state.
+// Scripted processes on a fake platform. The global error list is
+// program-wide, so every test starts and ends with it empty.
 class HTAnalysisTest : public ::testing::Test {
 protected:
     HTAnalysisTest() : platform_(std::make_shared<HTFakePlatform>()) { setBreakdown(false); }
-    ~HTAnalysisTest() override
-    {
-        HTHeft::setSharingAnalysisDisabled(false);
-        HTProcess::_clearGlobalErrors();
-        HTFakePlatform unset;
-        HTHeft::setBreakDownPhysHeft(unset, false);
-    }
+    ~HTAnalysisTest() override { HTProcess::_clearGlobalErrors(); }
 
-    void setBreakdown(bool on)
-    {
-        platform_->sysctlValues["vm.self_region_heft"] = on ? 1 : 0;
-        HTHeft::setBreakDownPhysHeft(*platform_, on);
-    }
+    // The settings of the processes and drivers made from here on.
+    void setBreakdown(bool on) { settings_.breakDownPhysHeft = on; }
 
     std::shared_ptr<HTScriptedProcess> process(int32_t pid, std::vector<HTScriptedRegion> script, bool is64bit = true)
     {
-        return std::make_shared<HTScriptedProcess>(platform_, pid, std::move(script), is64bit);
+        auto made = std::make_shared<HTScriptedProcess>(platform_, pid, std::move(script), is64bit);
+        made->setSettings(settings_);
+        return made;
     }
 
     // The driver over the processes, gathered.
     std::unique_ptr<HTHeftProbe> gathered(const HTHeft::ProcessList& processes)
     {
-        auto heft = std::make_unique<HTHeftProbe>(processes, platform_);
+        auto heft = std::make_unique<HTHeftProbe>(processes, settings_);
         heft->gatherData();
         return heft;
     }
@@ -73,6 +84,7 @@ protected:
     }
 
     std::shared_ptr<HTFakePlatform> platform_;
+    HTSettings settings_;
 };
 
 // `n` pages of object `id`, all dirty, mapped shared.

@@ -4,13 +4,13 @@
 // shared log, so that tests can compare whole reports, call order included.
 // Sizes are shown in 4 KiB pages.
 
-#include "analysis/HTProcessGroup.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTCategoryMap.h"
 #include "model/HTMemoryCategory.h"
 #include "output/HTOutputFormatter.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessGroup.h"
 
 #include <memory>
 #include <string>

@@ -34,6 +34,15 @@ HTScriptedRegion region(uint64_t id, const char* name, uint64_t dirtyPages, uint
 
 class HTReportGoldenTest : public HTAnalysisTest {
 protected:
+    HTSettings textSettings(int64_t format, int64_t options, std::string sort)
+    {
+        HTSettings settings = settings_;
+        settings.summaryFormat = format;
+        settings.textOptions = options;
+        settings.textSort = std::move(sort);
+        return settings;
+    }
+
     // Reports the processes as text, and as JSON too when `json` names its
     // expected report, and compares both with the expected reports.
     void expectReports(const HTHeft::ProcessList& processes, const std::string& text, int64_t format, int64_t options,
@@ -45,8 +54,8 @@ protected:
         HTOutputCapture out;
         {
             auto heft = gathered(processes);
-            heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(format, options, sort,
-                                                                             /*breakDownPhysHeft=*/false, out.file()));
+            heft->addOutputFormatter(
+                std::make_shared<HTOutputFormatterText>(textSettings(format, options, sort), out.file()));
             if (!json.empty())
                 heft->addOutputFormatter(HTOutputFormatterJSON::initWithPath(path, false, kPage, nullptr));
             heft->printOutputVerbose(verbose, /*summarize=*/false);

@@ -5,10 +5,10 @@
 
 #include "analysis/HTHeftSharingData.h"
 #include "analysis/HTHeftTestSupport.h"
-#include "analysis/HTProcessGroup.h"
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
 #include "model/HTMemoryRegion.h"
+#include "process/HTProcessGroup.h"
 #include "process/HTUserProcess.h"
 
 #include <set>
@@ -23,8 +23,6 @@ constexpr int32_t kDirtyPage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_D
 
 class HTSharedPageResolverTest : public HTAnalysisTest {
 protected:
-    ~HTSharedPageResolverTest() override { HTHeft::setSharingAnalysisDisabled(false); }
-
     // Private anonymous mappings of `identities.size()` written pages from
     // kStart, `regionPages` pages a mapping (all in one when 0), with a page
     // of gap between them; a page's identity is 0 when only its process
@@ -58,6 +56,7 @@ protected:
         HTHeft::ProcessList processes;
         for (int32_t pid : pids) {
             auto process = std::make_shared<HTUserProcess>(platform_);
+            process->setSettings(settings_);
             EXPECT_TRUE(process->initWithBsdInfo(platform_->process(pid)->info));
             processes.push_back(process);
         }
@@ -153,7 +152,7 @@ TEST_F(HTSharedPageResolverTest, WithoutIdentitiesEachProcessKeepsItsOwnCopy)
     EXPECT_TRUE(static_cast<HTUserProcess&>(*processes[0]).sharedPagesUnidentified());
 
     // Sharing analysis off: nothing is named, nothing is noticed.
-    HTHeft::setSharingAnalysisDisabled(true);
+    settings_.sharingAnalysisDisabled = true;
     auto process = created({kParent}).front();
     process->gatherData();
     EXPECT_FALSE(static_cast<HTUserProcess&>(*process).sharedPagesUnidentified());

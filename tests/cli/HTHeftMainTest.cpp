@@ -15,8 +15,6 @@
 
 namespace {
 
-constexpr const char* kSelfRegionHeft = "vm.self_region_heft";
-
 // The run up to the analysis, against a scripted system. The exact texts
 // a user sees are checked end to end on the built program; here the checks
 // are about what the run does to the system and in which order.
@@ -30,7 +28,6 @@ protected:
         platform_->ownPid = 500;
         platform_->addProcess(1, 0, "init", "/sbin/init");
         platform_->addProcess(42, 1, "worker", "/usr/bin/worker");
-        platform_->sysctlValues[kSelfRegionHeft] = 0;
     }
 
     void TearDown() override { HTProcess::_clearGlobalErrors(); }
@@ -60,18 +57,22 @@ protected:
     std::shared_ptr<HTFakePlatform> platform_;
 };
 
-TEST_F(HTHeftMainTest, TurnsTheBreakdownModeOnUnlessVmObjectDirty)
+TEST_F(HTHeftMainTest, TheBreakdownModeIsOnUnlessVmObjectDirty)
 {
+    // Only the breakdown mode asks the kernel which objects a process owns.
+    const char* kDirtyAnalysis = "VM Object Dirty Analysis: Enabled\n";
     Run result = run({"--vmObjectDirty", "42"});
     EXPECT_EQ(result.status, 0);
-    EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 0);
+    EXPECT_NE(result.standardOutput.find(kDirtyAnalysis), std::string::npos) << result.standardOutput;
+    EXPECT_EQ(platform_->ownedVmObjectQueries, 0);
 
     result = run({"42"});
     EXPECT_EQ(result.status, 0);
     // The selected process is analysed and reported.
     EXPECT_NE(result.standardOutput.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << result.standardOutput;
+    EXPECT_EQ(result.standardOutput.find(kDirtyAnalysis), std::string::npos);
     EXPECT_EQ(result.standardError, "");
-    EXPECT_EQ(platform_->sysctlValues[kSelfRegionHeft], 1);
+    EXPECT_GT(platform_->ownedVmObjectQueries, 0);
 }
 
 TEST_F(HTHeftMainTest, RunningOutOfMemorySaysWhereAndLeavesNoFile)

@@ -1,15 +1,24 @@
-#include "cli/HTHeftArgs.h"
+#include "process/HTTargetSelection.h"
 #include "platform/fake/HTFakePlatform.h"
-#include "process/HTProcess.h"
 
 #include <gtest/gtest.h>
 
+#include <sstream>
 #include <string>
 #include <vector>
 
 namespace {
 
 constexpr int32_t kOwnPid = 500;
+
+// The words of `text`, split at blanks.
+std::vector<std::string> words(const std::string& text)
+{
+    std::istringstream in(text);
+    std::vector<std::string> result;
+    for (std::string word; in >> word;) result.push_back(word);
+    return result;
+}
 
 // A small system: the kernel, init, two shells with a tree of workers below
 // one of them, and heft itself next to a second program of the same name.
@@ -30,62 +39,32 @@ protected:
         platform_->addProcess(kOwnPid, 200, "heft", "/usr/bin/heft");
         platform_->addProcess(501, 200, "heft", "/opt/heft/heft");
     }
-
     void TearDown() override { HTProcess::_clearGlobalErrors(); }
 
-    struct Selection {
-        std::optional<std::vector<std::shared_ptr<HTProcess>>> processes;
+    // Selects after the request; the pids selected, "!" after a hidden one,
+    // or "error" when nothing could be selected.
+    std::string select(HTTargetSelection::Request request, HTTargetSelection::Request* after = nullptr)
+    {
+        HTTargetSelection selection(platform_, settings_, std::move(request));
         HTError error;
-        std::string standardError;
-
-        std::vector<int32_t> pids() const
-        {
-            std::vector<int32_t> result;
-            if (processes)
-                for (const auto& process : *processes) result.push_back(process->pid());
-            return result;
-        }
-    };
-
-    Selection select(HTHeftArgs& args)
-    {
-        Selection selection;
         testing::internal::CaptureStderr();
-        selection.processes = args.targetProcessesAndError(platform_, &selection.error);
-        selection.standardError = testing::internal::GetCapturedStderr();
-        return selection;
-    }
-
-    static HTHeftArgs argsWithTargets(std::vector<std::string> operands, std::vector<int32_t> pids = {},
-                                      std::vector<std::string> excluded = {})
-    {
-        auto set = [](const std::vector<std::string>& values) {
-            HTOrderedStringSet made;
-            for (const auto& value : values) made.add(value);
-            return made;
-        };
-        HTHeftArgs args;
-        args.setPotentialTargetProcesses(set(operands));
-        HTHeftArgs::PidMap pidMap;
-        for (int32_t pid : pids) pidMap.set(pid, std::nullopt);
-        args.setTargetPids(pidMap);
-        args.setExcludedPidsOrProcesses(set(excluded));
-        return args;
+        auto processes = selection.targetProcessesAndError(&error);
+        standardError_ = testing::internal::GetCapturedStderr();
+        if (after) after->targetPids = selection.targetPids();
+        if (!processes) return "error " + std::to_string(error.code) + ": " + error.description.value_or("");
+        std::string text;
+        for (const auto& process : *processes) {
+            text +=
+                (text.empty() ? "" : " ") + std::to_string(process->pid()) + (process->hiddenFromDisplay() ? "!" : "");
+            EXPECT_EQ(process->breakDownPhysHeft(), settings_.breakDownPhysHeft) << "made with the run's settings";
+        }
+        return text;
     }
 
     std::shared_ptr<HTFakePlatform> platform_;
+    HTSettings settings_;
+    std::string standardError_;
 };
-
-TEST_F(HTTargetSelectionTest, NothingToAnalyseIsAnError)
-{
-    HTHeftArgs args;
-    Selection selection = select(args);
-    EXPECT_FALSE(selection.processes);
-    EXPECT_EQ(selection.error.domain, "HTHeftError");
-    EXPECT_EQ(selection.error.code, 8);
-    EXPECT_EQ(selection.error.description, "Must specify at least one process or snapfile");
-    EXPECT_EQ(selection.standardError, "");
-}
 
 TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
 {
@@ -96,101 +75,78 @@ TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
         platform_->process(pid)->dirtyFlags =
             PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT | (pid == 203 ? PROC_DIRTY_IS_DIRTY : 0);
     }
+    // Operands, pids and exclusions are lists of words.
     struct Row {
-        const char* what;
-        std::vector<std::string> operands;
+        const char* operands;
         std::vector<int32_t> pids;
-        std::vector<std::string> excluded;
+        const char* excluded;
         int options;
-        std::vector<int32_t> selected;
-        std::string standardError;
+        const char* selected;
     } rows[] = {
-        {"a name selects every process of that name; pid 100 is reached twice, selected once",
-         {"worker", "100", "init"},
-         {},
-         {},
-         kNone,
-         {100, 201, 203, 1},
-         ""},
-        {"unknown operands are reported and the others kept; a pid with more after it is a name",
-         {"nosuchthing", "shell", "99999", "100 x"},
-         {},
-         {},
-         kNone,
-         {200},
-         "Unable to find pid for process matching 'nosuchthing'\n"
-         "Unable to find pid for process matching '99999'\n"
-         "Unable to find pid for process matching '100 x'\n"},
-        {"heft leaves itself out; exclusions that match nothing stay silent",
-         {"heft", "worker"},
-         {kOwnPid},
-         {"201", "helper", "nosuchthing"},
-         kNone,
-         {501, 100, 203},
-         ""},
-        {"heft alone", {}, {kOwnPid}, {}, kNone, {}, ""},
-        {"descendants come after the exclusions, heft's own pid among them",
-         {"shell"},
-         {},
-         {"202"},
-         kChildren,
-         {200, 201, 202, 500, 501, 203},
-         ""},
-        {"an excluded target has no descendants to add", {}, {202}, {"helper"}, kChildren, {}, ""},
-        {"all but heft and the excluded; operands not looked at",
-         {"nosuchthing"},
-         {1},
-         {"worker"},
-         kAll,
-         {0, 1, 200, 202, 501},
-         ""},
-        {"all", {}, {}, {}, kAll, {0, 1, 100, 200, 201, 202, 203, 501}, ""},
-        {"the unmapped search adds every other process but the kernel and the excluded",
-         {},
-         {201},
-         {"init"},
-         kUnmapped,
-         {100, 200, 202, 203, 501, 201},
-         ""},
-        {"idle-exit clean processes skipped", {"worker", "shell"}, {}, {}, kSkipClean, {203, 200}, ""},
-        {"only idle-exit clean processes", {}, {100, 201}, {}, kSkipClean, {}, ""},
+        // A name selects every process of that name; 100 is named twice.
+        {"worker 100 init", {}, "", kNone, "100 201 203 1"},
+        // heft leaves itself out; exclusions that match nothing stay silent.
+        {"heft worker", {kOwnPid}, "201 helper nosuchthing", kNone, "501 100 203"},
+        {"", {kOwnPid}, "", kNone, ""},
+        // Descendants come after the exclusions, heft's own pid among them;
+        // an excluded target has none to add.
+        {"shell", {}, "202", kChildren, "200 201 202 500 501 203"},
+        {"", {202}, "helper", kChildren, ""},
+        // All but heft and the excluded; operands are not looked at.
+        {"nosuchthing", {1}, "worker", kAll, "0 1 200 202 501"},
+        {"", {}, "", kAll, "0 1 100 200 201 202 203 501"},
+        // The unmapped search adds, hidden, every other process but the
+        // kernel and the excluded.
+        {"", {201}, "init", kUnmapped, "100! 200! 202! 203! 501! 201"},
+        {"worker shell", {}, "", kSkipClean, "203 200"},
+        {"", {100, 201}, "", kSkipClean, ""},
+        {"", {}, "", kNone, "error 8: Must specify at least one process or snapfile"},
     };
     for (const Row& row : rows) {
-        HTHeftArgs args = argsWithTargets(row.operands, row.pids, row.excluded);
-        args.setTargetAll(row.options & kAll);
-        args.setTargetChildren(row.options & kChildren);
-        args.setSearchForUnmapped(row.options & kUnmapped);
-        args.setSkipIdleExitClean(row.options & kSkipClean);
-        Selection selection = select(args);
-        ASSERT_TRUE(selection.processes) << row.what;
-        EXPECT_EQ(selection.pids(), row.selected) << row.what;
-        EXPECT_EQ(selection.standardError, row.standardError) << row.what;
-        // Only the unmapped search hides processes: all but the ones asked for.
-        for (const auto& process : *selection.processes)
-            EXPECT_EQ(process->hiddenFromDisplay(), (row.options & kUnmapped) && process->pid() != 201) << row.what;
+        HTTargetSelection::Request request;
+        request.potentialTargetProcesses = words(row.operands);
+        for (int32_t pid : row.pids) request.targetPids.set(pid, std::nullopt);
+        request.excludedPidsOrProcesses = words(row.excluded);
+        request.targetAll = row.options & kAll;
+        request.targetChildren = row.options & kChildren;
+        request.searchForUnmapped = row.options & kUnmapped;
+        request.skipIdleExitClean = row.options & kSkipClean;
+        EXPECT_EQ(select(request), row.selected) << row.operands << " / " << row.excluded << " / " << row.options;
+        EXPECT_EQ(standardError_, "");
     }
 
     // Names found stay with their pids, unless the pid was given too; -t
     // finds descendants by pid.
-    HTHeftArgs named = argsWithTargets({"worker", "100"});
-    select(named);
-    EXPECT_EQ(named.targetPids().find(201)->value_or(""), "worker");
-    EXPECT_FALSE(*named.targetPids().find(100));
-    HTHeftArgs children = argsWithTargets({"shell"});
-    children.setTargetChildren(true);
-    select(children);
-    for (const auto& [pid, name] : children.targetPids()) EXPECT_FALSE(name) << pid;
+    HTTargetSelection::Request named, after;
+    named.potentialTargetProcesses = {"worker", "100"};
+    settings_.breakDownPhysHeft = false;
+    select(named, &after);
+    EXPECT_EQ(after.targetPids.find(201)->value_or(""), "worker");
+    EXPECT_FALSE(*after.targetPids.find(100));
+    named.targetChildren = true;
+    select(named, &after);
+    for (const auto& [pid, name] : after.targetPids) EXPECT_FALSE(name) << pid;
 }
 
-TEST_F(HTTargetSelectionTest, UnreadableProcessesAreNamedAsTheyWereGiven)
+TEST_F(HTTargetSelectionTest, WhatCannotBeFoundOrOpenedIsNamedAsGiven)
 {
+    // A pid with more after it is a name.
+    HTTargetSelection::Request request;
+    request.potentialTargetProcesses = {"nosuchthing", "shell", "99999", "100 x"};
+    EXPECT_EQ(select(request), "200");
+    EXPECT_EQ(standardError_,
+              "Unable to find pid for process matching 'nosuchthing'\n"
+              "Unable to find pid for process matching '99999'\n"
+              "Unable to find pid for process matching '100 x'\n");
+
     platform_->process(100)->taskResult = KERN_FAILURE;
     platform_->process(202)->taskResult = KERN_FAILURE;
-    HTHeftArgs args = argsWithTargets({"worker"}, {202, 1});
-    Selection selection = select(args);
-    ASSERT_TRUE(selection.processes);
-    EXPECT_EQ(selection.pids(), (std::vector<int32_t>{1, 201, 203}));
-    EXPECT_EQ(selection.standardError,
+    request = {};
+    request.potentialTargetProcesses = {"worker"};
+    request.targetPids.set(202, std::nullopt);
+    request.targetPids.set(1, std::nullopt);
+    EXPECT_EQ(select(request), "1 201 203");
+    EXPECT_EQ(standardError_,
               "Unable to analyze process with pid 202 (try as root?)\n"
               "Unable to analyze process worker [100] (try as root?)\n");
 }

@@ -1,5 +1,4 @@
 #include "model/HTMemoryObject.h"
-#include "analysis/HTHeft.h"
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
@@ -36,23 +35,17 @@ Totals totals(const HTMemoryObject& o)
     return {o.totalDirtySize(), o.totalSwappedSize(), o.totalCleanSize(), o.totalReclaimableSize()};
 }
 
-// Processes whose platform answers the per-region heft setting. HTHeft
-// caches that setting program-wide, so the cache is reset on the way out.
+// Processes made in one counting mode: per-region heft or not.
 class Processes {
 public:
     explicit Processes(bool regionHeft) : platform_(std::make_shared<HTFakePlatform>())
     {
-        platform_->sysctlValues["vm.self_region_heft"] = regionHeft ? 1 : 0;
-        HTHeft::setBreakDownPhysHeft(*platform_, regionHeft);
-    }
-    ~Processes()
-    {
-        HTFakePlatform unset;
-        HTHeft::setBreakDownPhysHeft(unset, false);
+        settings_.breakDownPhysHeft = regionHeft;
     }
     std::shared_ptr<HTProcess> operator()(int32_t pid)
     {
         auto made = std::make_shared<HTProcess>(platform_);
+        made->setSettings(settings_);
         made->setPid(pid);
         made->setPageSize(kPage);
         return made;
@@ -60,6 +53,7 @@ public:
 
 private:
     std::shared_ptr<HTFakePlatform> platform_;
+    HTSettings settings_;
 };
 
 // p1 maps two pages twice and its regions report them twice; p2 maps the
@@ -67,9 +61,9 @@ private:
 std::shared_ptr<HTMemoryObject> mappedTwiceByOne(HTProcess& p1, HTProcess& p2)
 {
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 2, 2), p1);
-    object->addRegion(region(5, 0, 2, 2, 1), p1);
-    object->addRegion(region(5, 2, 1, 1), p2);
+    object->addRegion(region(5, 0, 2, 2), p1.pageSize(), p1.pid());
+    object->addRegion(region(5, 0, 2, 2, 1), p1.pageSize(), p1.pid());
+    object->addRegion(region(5, 2, 1, 1), p2.pageSize(), p2.pid());
     return object;
 }
 
@@ -80,15 +74,15 @@ TEST(HTMemoryObject, TotalsCountEachPageOnce)
     Processes process(false);
     auto p1 = process(1);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 4, 4), *p1);
-    object->addRegion(region(5, 2, 4, 4), *p1);
+    object->addRegion(region(5, 0, 4, 4), p1->pageSize(), p1->pid());
+    object->addRegion(region(5, 2, 4, 4), p1->pageSize(), p1->pid());
     // Only a region's sub-ranges count once it has some.
     auto pieces = region(5, 16, 4, 4);
     pieces->addSubrange(16 * kPage, kPage, HTMemoryTotals{0, 0, kPage, 0, 0, 0}, kPage);
-    object->addRegion(pieces, *p1);
+    object->addRegion(pieces, p1->pageSize(), p1->pid());
     EXPECT_EQ(pieces->subrangeList(), nullptr);
     // Without an object id a region names the object but counts nothing.
-    object->addRegion(region(0, 0, 8, 8), *p1);
+    object->addRegion(region(0, 0, 8, 8), p1->pageSize(), p1->pid());
 
     object->finalize(false);
     EXPECT_EQ(totals(*object), (Totals{6 * kPage, 0, kPage, 0}));
@@ -96,7 +90,7 @@ TEST(HTMemoryObject, TotalsCountEachPageOnce)
     EXPECT_EQ(object->rangeList(), nullptr);
     // A single process sees the object whole.
     EXPECT_FALSE(object->processMemoryRegions());
-    EXPECT_EQ(object->viewForProcess(*p1, false), object);
+    EXPECT_EQ(object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), false), object);
 }
 
 TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
@@ -105,11 +99,11 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
     auto p1 = process(1);
     auto p2 = process(2);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 1, 1, 0, SM_PRIVATE), *p1);
+    object->addRegion(region(5, 0, 1, 1, 0, SM_PRIVATE), p1->pageSize(), p1->pid());
     EXPECT_FALSE(object->processMemoryRegions()) << "a private region starts no map";
-    object->addRegion(region(5, 0, 1, 1), *p2);
+    object->addRegion(region(5, 0, 1, 1), p2->pageSize(), p2->pid());
     // Once the map exists every region is recorded, eligible or not.
-    object->addRegion(region(5, 1, 1, 1, 0, SM_PRIVATE), *p1);
+    object->addRegion(region(5, 1, 1, 1, 0, SM_PRIVATE), p1->pageSize(), p1->pid());
     object->addRegion(region(5, 0, 1, 1), kPage);
     ASSERT_TRUE(object->processMemoryRegions());
     ASSERT_EQ(object->processMemoryRegions()->keys(), (std::vector<int32_t>{2, 1}));
@@ -119,8 +113,8 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
     // kept when one differs.
     for (uint64_t secondDirty : {2, 1}) {
         auto two = std::make_shared<HTMemoryObject>();
-        two->addRegion(region(5, 0, 2, 2), *p1);
-        two->addRegion(region(5, 0, 2, secondDirty), *p2);
+        two->addRegion(region(5, 0, 2, 2), p1->pageSize(), p1->pid());
+        two->addRegion(region(5, 0, 2, secondDirty), p2->pageSize(), p2->pid());
         two->finalize(false);
         EXPECT_EQ(bool(two->processMemoryRegions()), secondDirty != 2) << secondDirty << " dirty";
     }
@@ -141,11 +135,12 @@ TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
     EXPECT_EQ(totals(*object), (Totals{4 * kPage, kPage, 0, 0}));
 
     // p1's regions report per-region heft: its view sums them as reported.
-    auto view1 = object->viewForProcess(*p1, true);
+    auto view1 = object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), true);
     EXPECT_EQ(view1->totalDirtySize(), 4 * kPage);
     EXPECT_EQ(view1->memoryRegions().size(), 2u);
-    EXPECT_EQ(object->viewForProcess(*p2, true)->totalDirtySize(), kPage);
-    EXPECT_EQ(object->viewForProcess(*process(3), true), object) << "no list of its own";
+    EXPECT_EQ(object->viewForProcess(p2->pid(), p2->pageSize(), p2->breakDownPhysHeft(), true)->totalDirtySize(),
+              kPage);
+    EXPECT_EQ(object->viewForProcess(3, kPage, true, true), object) << "no list of its own";
 }
 
 TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
@@ -157,15 +152,16 @@ TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
     auto p1 = process(1);
     auto p2 = process(2);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 4, 1), *p2);
+    object->addRegion(region(5, 0, 4, 1), p2->pageSize(), p2->pid());
     for (uint64_t half : {0, 2}) {
         auto mapped = region(5, half, 2, 1);
         mapped->setCleanNonSpecSize(kPage);
-        object->addRegion(mapped, *p1);
+        object->addRegion(mapped, p1->pageSize(), p1->pid());
     }
     object->finalize(false);
     EXPECT_EQ(totals(*object), (Totals{2 * kPage, 0, 2 * kPage, 0}));
-    EXPECT_EQ(totals(*object->viewForProcess(*p1, false)), (Totals{2 * kPage, 0, 2 * kPage, 0}));
+    EXPECT_EQ(totals(*object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), false)),
+              (Totals{2 * kPage, 0, 2 * kPage, 0}));
 }
 
 TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
@@ -178,12 +174,12 @@ TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
     mapped->setCleanNonSpecSize(kPage);
     mapped->setReclaimableSize(kPage);
     mapped->setWired(true);
-    object->addRegion(mapped, *owner);
+    object->addRegion(mapped, owner->pageSize(), owner->pid());
     object->setOwnerPid(7);
     object->finalize(false);
 
-    EXPECT_EQ(object->viewForProcess(*owner, false), object);
-    auto seen = object->viewForProcess(*other, false);
+    EXPECT_EQ(object->viewForProcess(owner->pid(), owner->pageSize(), owner->breakDownPhysHeft(), false), object);
+    auto seen = object->viewForProcess(other->pid(), other->pageSize(), other->breakDownPhysHeft(), false);
     EXPECT_EQ(totals(*seen), (Totals{0, 0, 4 * kPage, 0}));
     EXPECT_EQ(&seen->memoryRegions(), &object->memoryRegions()) << "a copy shares the region set";
 
@@ -191,7 +187,7 @@ TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
     auto kept = mappedTwiceByOne(*process(1), *owner);
     kept->setOwnerPid(7);
     kept->finalize(false);
-    EXPECT_EQ(kept->viewForProcess(*other, false), kept);
+    EXPECT_EQ(kept->viewForProcess(other->pid(), other->pageSize(), other->breakDownPhysHeft(), false), kept);
 }
 
 TEST(HTMemoryObject, NamesComeFromTheCanonicalRegion)

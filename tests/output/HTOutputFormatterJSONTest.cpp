@@ -1,6 +1,5 @@
 #include "output/HTOutputFormatterJSON.h"
 
-#include "analysis/HTProcessGroup.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryCategory.h"
@@ -8,6 +7,7 @@
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessGroup.h"
 
 #include "output/HTExpectedReport.h"
 

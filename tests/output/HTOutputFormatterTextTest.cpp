@@ -5,7 +5,6 @@
 
 #include "output/HTOutputFormatterText.h"
 
-#include "analysis/HTProcessGroup.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTCategoryMap.h"
@@ -14,6 +13,7 @@
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessGroup.h"
 
 #include "output/HTExpectedReport.h"
 #include "output/HTOutputCapture.h"
@@ -29,6 +29,16 @@
 namespace {
 
 constexpr uint64_t kPage = 4096;
+
+HTSettings textSettings(int64_t format, int64_t options, std::string sort, bool breakDown = true)
+{
+    HTSettings settings;
+    settings.summaryFormat = format;
+    settings.textOptions = options;
+    settings.textSort = std::move(sort);
+    settings.breakDownPhysHeft = breakDown;
+    return settings;
+}
 
 // Exposes the protected helpers.
 class TextFormatter : public HTOutputFormatterText {
@@ -166,7 +176,7 @@ TEST(HTOutputFormatterText, RendersSizesInEachFormat)
     };
     HTOutputCapture out;
     for (const Row& row : rows) {
-        HTOutputFormatterText formatter(row.format, 0, "Dirty", true, out.file());
+        HTOutputFormatterText formatter(textSettings(row.format, 0, "Dirty", true), out.file());
         if (row.pageSize) formatter.setPageSize(row.pageSize);
         for (const auto& [size, expected] : row.sizes)
             EXPECT_EQ(formatter.formattedStringForSize(size), expected) << row.format << " " << size;
@@ -176,7 +186,7 @@ TEST(HTOutputFormatterText, RendersSizesInEachFormat)
 
 TEST(HTOutputFormatterText, ShortensPathsUnlessWide)
 {
-    TextFormatter narrow(HTTextFormatFormatted, 0, "Dirty", true, stdout);
+    TextFormatter narrow(textSettings(HTTextFormatFormatted, 0, "Dirty", true), stdout);
     for (const auto& [path, shown] :
          std::vector<std::pair<std::string, std::string>>{{"/usr/lib/libexample", ".../libexample"},
                                                           {"libexample", "libexample"},
@@ -186,7 +196,7 @@ TEST(HTOutputFormatterText, ShortensPathsUnlessWide)
         EXPECT_EQ(narrow._truncatedNameForString(path), shown) << path;
     EXPECT_EQ(narrow._truncatedNameForString(std::nullopt), std::nullopt);
 
-    TextFormatter wide(HTTextFormatFormatted, 7, "Dirty", true, stdout);
+    TextFormatter wide(textSettings(HTTextFormatFormatted, 7, "Dirty", true), stdout);
     EXPECT_EQ(wide._truncatedNameForString("/usr/lib/libexample"), "/usr/lib/libexample");
 }
 
@@ -195,7 +205,7 @@ TEST(HTOutputFormatterText, RowOrderUnderEachSortColumn)
     using Keys = std::vector<std::string>;
     const HTCategoryMap categories = sampleCategories();
     auto keysSortedBy = [&](const char* sort) {
-        TextFormatter formatter(HTTextFormatFormatted, 0, sort, true, stdout);
+        TextFormatter formatter(textSettings(HTTextFormatFormatted, 0, sort, true), stdout);
         return formatter._sortedKeysForCategories(categories);
     };
     const std::string D = "__DATA libplain", T = "__TEXT /usr/lib/libexample", M = "MALLOC_SMALL", S = "stack",
@@ -227,14 +237,15 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     using Text = HTOutputFormatterText;
 
     piece("empty tables: formatted wide, bytes swapped, pages wired");
-    Text(HTTextFormatFormatted, 7, "Dirty", true, out.file()).printProcessCategories({}, kTotal);
-    Text(HTTextFormatBytes, HTTextOptionSwapped, "Dirty", true, out.file()).printProcessCategories({}, kTotal);
-    Text pages(HTTextFormatPages, HTTextOptionWired, "Dirty", true, out.file());
+    Text(textSettings(HTTextFormatFormatted, 7, "Dirty", true), out.file()).printProcessCategories({}, kTotal);
+    Text(textSettings(HTTextFormatBytes, HTTextOptionSwapped, "Dirty", true), out.file())
+        .printProcessCategories({}, kTotal);
+    Text pages(textSettings(HTTextFormatPages, HTTextOptionWired, "Dirty", true), out.file());
     pages.setPageSize(16384);
     pages.printProcessCategories({}, kTotal);
 
     piece("private table sorted by dirty, an unnamed category under its key");
-    Text formatted(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    Text formatted(textSettings(HTTextFormatFormatted, 0, "Dirty", true), out.file());
     formatted.printProcessCategories(sampleCategories(), HTMemoryTotals{20480, 4096, 24576, 4096, 8192, 7});
 
     piece("shared tables: sizes wider than their column; 19 others named; 20 others counted");
@@ -243,18 +254,18 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     const auto& self = *members[1];
     HTCategoryMap big;
     addCategory(big, "big", "big", std::nullopt, {1000000000, 0, 0, 0, 0, 1});
-    Text(HTTextFormatBytes, 0, "Dirty", true, out.file())
+    Text(textSettings(HTTextFormatBytes, 0, "Dirty", true), out.file())
         .printSharedCategories(big, *group({members[0], members[1]}), self, false, {1000000000, 0, 0, 0, 0, 1});
     formatted.printSharedCategories({}, *group({members.begin(), members.begin() + 20}), self, true, {});
     formatted.printSharedCategories({}, *group(members), self, false, {});
 
     piece("summaries: one process with and without the breakdown; two; pages of the last process, swapped");
     for (bool breakDown : {true, false}) {
-        Text one(HTTextFormatFormatted, 0, "Dirty", breakDown, out.file());
+        Text one(textSettings(HTTextFormatFormatted, 0, "Dirty", breakDown), out.file());
         quietly([&] { one.printProcessHeader(*process(812, "cat")); });
         one.printSummaryCategories({}, kTotal, true);
     }
-    Text two(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    Text two(textSettings(HTTextFormatFormatted, 0, "Dirty", true), out.file());
     quietly([&] {
         two.printProcessHeader(*process(1, "a"));
         two.printProcessHeader(*process(2, "b"));
@@ -262,7 +273,7 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     HTCategoryMap stack;
     addCategory(stack, "stack", "stack", std::nullopt, {4096, 0, 0, 4096, 0, 3});
     two.printSummaryCategories(stack, {20480, 4096, 24576, 4096, 8192, 7}, false);
-    Text three(HTTextFormatPages, HTTextOptionSwapped, "Dirty", false, out.file());
+    Text three(textSettings(HTTextFormatPages, HTTextOptionSwapped, "Dirty", false), out.file());
     quietly([&] {
         for (int32_t pid : {1, 2, 3}) three.printProcessHeader(*process(pid, "p", pid == 1 ? 4096 : 16384));
     });
@@ -278,16 +289,16 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     auto owned = region(HTNoAddress, 4096, 0x2a, "owned unmapped memory");
     owned->setDirtySize(4096);
     owned->setReclaimableSize(4095);
-    Text(HTTextFormatBytes, HTTextOptionSwapped | HTTextOptionWired, "Dirty", true, out.file())
+    Text(textSettings(HTTextFormatBytes, HTTextOptionSwapped | HTTextOptionWired, "Dirty", true), out.file())
         .printSpanlistLikeOutputForProcess(*process(812, "cat"), {text, owned});
     auto far = region(0x7f0000001000, 4096, 7, "__TEXT", "/usr/lib/libexample");
     far->setDirtySize(4096);
-    Text wide(HTTextFormatFormatted, HTTextOptionWide, "Dirty", true, out.file());
+    Text wide(textSettings(HTTextFormatFormatted, HTTextOptionWide, "Dirty", true), out.file());
     wide.printSpanlistLikeOutputForProcess(*process(9, "odd", 0), {far});
     wide.printSpanlistLikeOutputForProcess(*process(10, "idle"), {});
 
     piece("headers: clean; 32-bit with warnings; failed with warnings and errors; the rule of all columns");
-    Text headers(HTTextFormatFormatted, 0, "Dirty", true, out.file());
+    Text headers(textSettings(HTTextFormatFormatted, 0, "Dirty", true), out.file());
     auto clean = process(812, "cat", 16384);
     headers.printProcessHeader(*clean);
     headers.printProcessTotal(3 * 16384, *clean);
@@ -307,7 +318,8 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     headers.printProcessHeader(*failed);
     headers.endProcessHeader(*failed);
     EXPECT_EQ(headers.processCount(), 2);
-    Text all(HTTextFormatBytes, HTTextOptionWide | HTTextOptionSwapped | HTTextOptionWired, "Dirty", true, out.file());
+    Text all(textSettings(HTTextFormatBytes, HTTextOptionWide | HTTextOptionSwapped | HTTextOptionWired, "Dirty", true),
+             out.file());
     all.printProcessHeader(*process(812, "cat"));
     all.printProcessTotal(4096, *process(812, "cat"));
     all.endProcessHeader(*process(812, "cat"));
@@ -331,7 +343,7 @@ TEST(HTOutputFormatterText, PiecesOfOtherFormatsAndOptions)
     pages.printProcessAuxData(auxMap({{"phys_heft", datum(4097)}}));
 
     piece("run-wide auxiliary data: one process; two; none");
-    Text global(HTTextFormatBytes, 0, "Dirty", true, out.file());
+    Text global(textSettings(HTTextFormatBytes, 0, "Dirty", true), out.file());
     quietly([&] { global.printProcessHeader(*process(1, "a")); });
     global.printGlobalAuxData(auxMap({{"phys_heft", datum(8192)}}));
     quietly([&] { global.printProcessHeader(*process(2, "b")); });

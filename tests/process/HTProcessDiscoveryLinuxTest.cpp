@@ -4,6 +4,7 @@
 #include "platform/linux/HTLinuxTaskPort.h"
 #include "process/HTKernelProcess.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessDiscovery.h"
 #include "process/HTUserProcess.h"
 
 #include <gtest/gtest.h>
@@ -104,6 +105,7 @@ protected:
     void TearDown() override { HTProcess::_clearGlobalErrors(); }
 
     std::shared_ptr<HTPlatform> platform_ = std::make_shared<HTLinuxPlatform>();
+    HTProcessDiscovery discovery_{platform_, HTSettings()};
 };
 
 }  // namespace
@@ -121,7 +123,7 @@ TEST_F(HTProcessDiscoveryLinux, NameSharedByThreeProcessesYieldsAllThree)
     std::string goneText = std::to_string(gone);
 
     std::vector<std::string> errors;
-    auto pids = HTProcess::pidsForStringDescriptions(*platform_, {program.name(), goneText}, &errors);
+    auto pids = discovery_.pidsForStringDescriptions({program.name(), goneText}, &errors);
     ASSERT_TRUE(pids);
     EXPECT_EQ(pids->size(), 3u);
     for (const auto& child : children) {
@@ -133,7 +135,7 @@ TEST_F(HTProcessDiscoveryLinux, NameSharedByThreeProcessesYieldsAllThree)
     EXPECT_EQ(errors[0], "Unable to find pid for process matching '" + goneText + "'");
 
     // A pid given as a number maps to no name.
-    pids = HTProcess::pidsForStringDescriptions(*platform_, {std::to_string(children[1].pid())}, &errors);
+    pids = discovery_.pidsForStringDescriptions({std::to_string(children[1].pid())}, &errors);
     ASSERT_TRUE(pids);
     ASSERT_EQ(pids->size(), 1u);
     EXPECT_EQ(*pids->find(children[1].pid()), std::nullopt);
@@ -144,7 +146,7 @@ TEST_F(HTProcessDiscoveryLinux, DescendantsAreFoundGenerationByGeneration)
 {
     HTTestProcessTree tree;
     ASSERT_TRUE(tree.complete());
-    auto pids = HTProcess::childPidsForPids(*platform_, {tree.root()});
+    auto pids = discovery_.childPidsForPids({tree.root()});
     ASSERT_TRUE(pids);
     ASSERT_EQ(pids->size(), 4u);
     EXPECT_EQ((*pids)[0], tree.root());
@@ -152,7 +154,7 @@ TEST_F(HTProcessDiscoveryLinux, DescendantsAreFoundGenerationByGeneration)
     EXPECT_EQ((*pids)[3], tree.grandchild());
 
     // A leaf yields just itself.
-    pids = HTProcess::childPidsForPids(*platform_, {tree.grandchild()});
+    pids = discovery_.childPidsForPids({tree.grandchild()});
     ASSERT_TRUE(pids);
     EXPECT_EQ(*pids, std::vector<int32_t>{tree.grandchild()});
 }
@@ -164,7 +166,7 @@ TEST_F(HTProcessDiscoveryLinux, ProcessWithPidMakesUserAndKernelProcesses)
     HTTestChild child = HTTestChild::exec(program.path(), {program.name(), "600"});
     ASSERT_TRUE(child.valid());
 
-    auto process = HTProcess::processWithPid(platform_, child.pid());
+    auto process = discovery_.processWithPid(child.pid());
     ASSERT_NE(process, nullptr);
     auto* user = dynamic_cast<HTUserProcess*>(process.get());
     ASSERT_NE(user, nullptr);
@@ -177,19 +179,19 @@ TEST_F(HTProcessDiscoveryLinux, ProcessWithPidMakesUserAndKernelProcesses)
     ASSERT_NE(task, nullptr);
     EXPECT_EQ(task->pid(), child.pid());
 
-    auto kernel = HTProcess::processWithPid(platform_, 0);
+    auto kernel = discovery_.processWithPid(0);
     ASSERT_NE(kernel, nullptr);
     EXPECT_NE(dynamic_cast<HTKernelProcess*>(kernel.get()), nullptr);
     EXPECT_EQ(kernel->name(), "kernel");
     EXPECT_EQ(kernel->idleExitStatus(), HTIdleExitStatusNotControlled);
 
-    EXPECT_EQ(HTProcess::processWithPid(platform_, htReapedPid()), nullptr);
+    EXPECT_EQ(discovery_.processWithPid(htReapedPid()), nullptr);
     EXPECT_TRUE(HTProcess::globalErrors().empty());
 
     // Processes heft may not read are reported on standard error; that is
     // not what this test looks at.
     testing::internal::CaptureStderr();
-    auto all = HTProcess::allProcessesExcludingPids(platform_, {::getpid()});
+    auto all = discovery_.allProcessesExcludingPids({::getpid()});
     testing::internal::GetCapturedStderr();
     ASSERT_TRUE(all);
     EXPECT_TRUE(all->contains(0));
@@ -210,7 +212,7 @@ TEST_F(HTProcessDiscoveryLinux, ProcessGoneBeforeItsTaskOpensIsAGlobalError)
     child.reap();
 
     HTNoticeLog::standardError().take();
-    EXPECT_EQ(HTProcess::processWithBsdInfo(platform_, info), nullptr);
+    EXPECT_EQ(discovery_.processWithBsdInfo(info), nullptr);
     EXPECT_EQ(HTNoticeLog::standardError().take(),
               std::vector<std::string>{std::string(info.pbi_name) + " [" + std::to_string(pid) +
                                        "]: exited before it could be opened; not measured"});

@@ -523,10 +523,10 @@ TEST_F(HTUserProcessSubrangeTest, NoSubrangesWhenSharingAnalysisIsOffOrProcessHi
 {
     addShared(0x100000, 3);
     target().dispositions[0x100000] = VM_PAGE_QUERY_PAGE_DIRTY;
-    HTHeft::setSharingAnalysisDisabled(true);
+    settings_.sharingAnalysisDisabled = true;
     EXPECT_EQ(gathered()->memoryRegions()[0]->subrangeList(), nullptr);
 
-    HTHeft::setSharingAnalysisDisabled(false);
+    settings_.sharingAnalysisDisabled = false;
     auto hidden = created();
     hidden->setHiddenFromDisplay(true);
     hidden->gatherData();

@@ -1,6 +1,5 @@
 #pragma once
 
-#include "analysis/HTHeft.h"
 #include "base/HTNoticeLog.h"
 #include "model/HTMemoryRegion.h"
 #include "platform/fake/HTFakePlatform.h"
@@ -47,20 +46,14 @@ protected:
     }
     ~HTUserProcessTest() override
     {
-        HTHeft::setSharingAnalysisDisabled(false);
         HTProcess::_clearGlobalErrors();
         HTNoticeLog::standardError().take();
         HTUserProcessProbe::_forgetLedgerTemplate();
         HTUserProcessProbe::_forgetOutOfDescriptors();
-        HTFakePlatform unset;
-        HTHeft::setBreakDownPhysHeft(unset, false);
     }
 
-    void setBreakdown(bool on)
-    {
-        platform_->sysctlValues["vm.self_region_heft"] = on ? 1 : 0;
-        HTHeft::setBreakDownPhysHeft(*platform_, on);
-    }
+    // The settings of the processes made from here on.
+    void setBreakdown(bool on) { settings_.breakDownPhysHeft = on; }
 
     // The scripted process "target" under kPid.
     HTFakePlatform::Process& target() { return *platform_->process(kPid); }
@@ -70,6 +63,7 @@ protected:
     std::shared_ptr<Process> created()
     {
         auto process = std::make_shared<Process>(platform_);
+        process->setSettings(settings_);
         EXPECT_TRUE(process->initWithBsdInfo(target().info));
         return process;
     }
@@ -100,4 +94,5 @@ protected:
     static std::vector<std::string> takeNotices() { return HTNoticeLog::standardError().take(); }
 
     std::shared_ptr<HTFakePlatform> platform_;
+    HTSettings settings_;
 };

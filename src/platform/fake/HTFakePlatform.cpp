@@ -142,28 +142,10 @@ int HTFakePlatform::sysctl(const int* name, unsigned nameLength, void* oldp, siz
 
 int HTFakePlatform::sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
 {
+    // The owned-object query is the only setting heft asks for by name.
     if (std::strcmp(name, "vm.get_owned_vmobjects") == 0) return ownedVmObjects(oldp, oldlenp, newp, newlen);
-    auto found = sysctlValues.find(name);
-    if (found == sysctlValues.end()) {
-        errno = ENOENT;
-        return -1;
-    }
-    if (oldp != nullptr && oldlenp != nullptr) {
-        if (*oldlenp < sizeof(int32_t)) {
-            errno = ENOMEM;
-            return -1;
-        }
-        std::memcpy(oldp, &found->second, sizeof(int32_t));
-        *oldlenp = sizeof(int32_t);
-    }
-    if (newp != nullptr) {
-        if (newlen != sizeof(int32_t)) {
-            errno = EINVAL;
-            return -1;
-        }
-        std::memcpy(&found->second, newp, sizeof(int32_t));
-    }
-    return 0;
+    errno = ENOENT;
+    return -1;
 }
 
 kern_return_t HTFakePlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task)
@@ -397,6 +379,7 @@ int HTFakePlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int*
 // asks again with more room.
 int HTFakePlatform::ownedVmObjects(void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
 {
+    ++ownedVmObjectQueries;
     if (newp == nullptr || newlen != sizeof(int32_t) || oldlenp == nullptr) {
         errno = EINVAL;
         return -1;

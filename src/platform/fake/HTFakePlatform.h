@@ -9,6 +9,7 @@
 
 #include "platform/HTPlatform.h"
 
+#include <atomic>
 #include <cstdint>
 #include <map>
 #include <mutex>
@@ -110,13 +111,14 @@ public:
     uint32_t euid = 0;
     std::set<int> terminals;  // descriptors that are terminals
     std::set<std::string> existingFiles;
-    std::map<std::string, int32_t> sysctlValues;  // sysctlbyname integers; absent: ENOENT
-    std::vector<std::string> machErrors;          // what mach_error wrote
+    std::vector<std::string> machErrors;  // what mach_error wrote
     // The ledger template's entry names; none fails with ledgerTemplateErrno.
     // Unscripted, the template has no entries, so no ledger is read.
     std::optional<std::vector<std::string>> ledgerTemplate = std::vector<std::string>{};
     int ledgerTemplateErrno = ENOTSUP;
     int ledgerTemplateReads = 0;
+    // How often the owned-object query was made, from any thread.
+    std::atomic<int> ownedVmObjectQueries{0};
     // realpath: the mapped paths; any other path resolves to itself.
     std::map<std::string, std::string> realpaths;
 

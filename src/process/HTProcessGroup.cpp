@@ -1,4 +1,4 @@
-#include "analysis/HTProcessGroup.h"
+#include "process/HTProcessGroup.h"
 
 #include "base/HTAssert.h"
 #include "process/HTProcess.h"
