@@ -73,9 +73,7 @@ public:
     }
 
     const ProcessToProcessGroups& processToProcessGroups() const { return processToProcessGroups_; }
-    void setProcessToProcessGroups(ProcessToProcessGroups map) { processToProcessGroups_ = std::move(map); }
     const HTProcessGroupObjectMap& processGroupToObjects() const { return processGroupToObjects_; }
-    void setProcessGroupToObjects(HTProcessGroupObjectMap map) { processGroupToObjects_ = std::move(map); }
 
 private:
     ProcessToProcessGroups processToProcessGroups_;

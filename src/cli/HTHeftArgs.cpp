@@ -177,7 +177,6 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
         break;
     case OptionVmObjectDirty:
         shouldGetPhysHeftBreakdown_ = false;
-        didSetShouldGetPhysHeftBreakdown_ = true;
         break;
     case 'w':
         textOptions_ |= HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide;
@@ -277,6 +276,5 @@ HTTargetSelection::Request HTHeftArgs::targetRequest() const
     request.targetChildren = targetChildren_;
     request.searchForUnmapped = searchForUnmapped_;
     request.skipIdleExitClean = skipIdleExitClean_;
-    request.excludeSelf = excludeSelf_;
     return request;
 }

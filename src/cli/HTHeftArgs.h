@@ -19,9 +19,6 @@
 // and files into process objects.
 class HTHeftArgs {
 public:
-    // Pid to the name it was found by, or nullopt when it was given as a pid.
-    using PidMap = HTProcess::PidDescriptionMap;
-
     // The defaults of a command line without options.
     HTHeftArgs() = default;
 
@@ -40,39 +37,10 @@ public:
     // The processes the command line names, for target selection.
     HTTargetSelection::Request targetRequest() const;
 
-    // --- fields ----------------------------------------------------------
-    bool targetChildren() const { return targetChildren_; }
-    void setTargetChildren(bool value) { targetChildren_ = value; }
+    // --- what was written, for the checks before the analysis -------------
     bool targetAll() const { return targetAll_; }
-    void setTargetAll(bool value) { targetAll_ = value; }
-    bool skipIdleExitClean() const { return skipIdleExitClean_; }
-    void setSkipIdleExitClean(bool value) { skipIdleExitClean_ = value; }
-    bool spanlistLikeOutput() const { return spanlistLikeOutput_; }
-    void setSpanlistLikeOutput(bool value) { spanlistLikeOutput_ = value; }
-    bool summarize() const { return summarize_; }
-    void setSummarize(bool value) { summarize_ = value; }
-    bool shouldGetPhysHeftBreakdown() const { return shouldGetPhysHeftBreakdown_; }
-    void setShouldGetPhysHeftBreakdown(bool value) { shouldGetPhysHeftBreakdown_ = value; }
-    bool didSetShouldGetPhysHeftBreakdown() const { return didSetShouldGetPhysHeftBreakdown_; }
-    void setDidSetShouldGetPhysHeftBreakdown(bool value) { didSetShouldGetPhysHeftBreakdown_ = value; }
     bool searchForUnmapped() const { return searchForUnmapped_; }
-    void setSearchForUnmapped(bool value) { searchForUnmapped_ = value; }
-    bool excludeSelf() const { return excludeSelf_; }
-    void setExcludeSelf(bool value) { excludeSelf_ = value; }
-    int64_t summaryFormat() const { return summaryFormat_; }
-    void setSummaryFormat(int64_t value) { summaryFormat_ = value; }
-    int64_t textOptions() const { return textOptions_; }
-    void setTextOptions(int64_t value) { textOptions_ = value; }
-    const std::string& textSort() const { return textSort_; }
-    void setTextSort(std::string value) { textSort_ = std::move(value); }
     const std::optional<std::string>& JSONOutputFile() const { return JSONOutputFile_; }
-    void setJSONOutputFile(std::optional<std::string> value) { JSONOutputFile_ = std::move(value); }
-    const PidMap& targetPids() const { return targetPids_; }
-    void setTargetPids(PidMap value) { targetPids_ = std::move(value); }
-    const HTOrderedStringSet& potentialTargetProcesses() const { return potentialTargetProcesses_; }
-    void setPotentialTargetProcesses(HTOrderedStringSet value) { potentialTargetProcesses_ = std::move(value); }
-    const HTOrderedStringSet& excludedPidsOrProcesses() const { return excludedPidsOrProcesses_; }
-    void setExcludedPidsOrProcesses(HTOrderedStringSet value) { excludedPidsOrProcesses_ = std::move(value); }
 
 private:
     // One option as getopt_long reported it; false with *error filled when
@@ -90,14 +58,12 @@ private:
     bool spanlistLikeOutput_ = false;
     bool summarize_ = true;
     bool shouldGetPhysHeftBreakdown_ = true;
-    bool didSetShouldGetPhysHeftBreakdown_ = false;
     bool searchForUnmapped_ = false;
-    bool excludeSelf_ = true;
     int64_t summaryFormat_ = HTTextFormatFormatted;
     int64_t textOptions_ = 0;
     std::string textSort_ = defaultSortColumn();
     std::optional<std::string> JSONOutputFile_;
-    PidMap targetPids_;
+    HTProcess::PidDescriptionMap targetPids_;
     HTOrderedStringSet potentialTargetProcesses_;
     HTOrderedStringSet excludedPidsOrProcesses_;
 };

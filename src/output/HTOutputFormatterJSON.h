@@ -45,18 +45,10 @@ public:
     HTOutputFormatterJSON& operator=(const HTOutputFormatterJSON&) = delete;
 
     // --- fields ----------------------------------------------------------
-    // Whether every process object gets a "regions" array.
-    bool verbose() const { return verbose_; }
-    void setVerbose(bool value) { verbose_ = value; }
-    const std::vector<SharedEntry>& shared() const { return shared_; }
-    // Groups whose common table has been collected, by identity.
-    const std::unordered_set<const HTProcessGroup*>& addedProcessGroups() const { return addedProcessGroups_; }
     // The page size the document ends with: that of the first process whose
     // header was written, 0 before.
     uint64_t pageSize() const { return pageSize_; }
     void setPageSize(uint64_t value) { pageSize_ = value; }
-    // False once end() has closed the file.
-    bool hasWriter() const { return json_ != nullptr; }
     // Set by end() when the file could not be written whole; the file is
     // then left as it was before the run.
     const std::optional<std::string>& writeError() const { return writeError_; }

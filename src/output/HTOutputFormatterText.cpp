@@ -95,14 +95,7 @@ HTOutputFormatterText::HTOutputFormatterText(const HTSettings& settings, FILE* o
       output_(output),
       breakDownPhysHeft_(settings.breakDownPhysHeft)
 {
-    setOptions(settings.textOptions);
-}
-
-void HTOutputFormatterText::setOptions(int64_t value)
-{
-    options_ = value;
-    swappedColumnName_.reset();
-    wiredColumnName_.reset();
+    options_ = settings.textOptions;
     if (options_ & HTTextOptionSwapped) swappedColumnName_ = "(Swapped)";
     if (options_ & HTTextOptionWired) wiredColumnName_ = "(Wired)";
 }

@@ -24,20 +24,9 @@ public:
     // summary says so.
     explicit HTOutputFormatterText(const HTSettings& settings, FILE* output = stdout);
 
-    int64_t summaryFormat() const { return summaryFormat_; }
-    void setSummaryFormat(int64_t value) { summaryFormat_ = value; }
-    int64_t options() const { return options_; }
-    // Also switches the swapped and wired columns after the new bits.
-    void setOptions(int64_t value);
-    const std::string& sort() const { return sort_; }
-    void setSort(std::string value) { sort_ = std::move(value); }
-    FILE* output() const { return output_; }
-    void setOutput(FILE* value) { output_ = value; }
-    uint64_t pageSize() const { return pageSize_; }
+    // The page size sizes in pages are counted in; each process header
+    // sets it to that process's.
     void setPageSize(uint64_t value) { pageSize_ = value; }
-    // 0, 1, or 2 for two or more process headers printed.
-    uint8_t processCount() const { return processCount_; }
-    bool breakDownPhysHeft() const { return breakDownPhysHeft_; }
 
     // A size as the summary format writes it: "16384 B", "16 KB", "4 pages".
     std::string formattedStringForSize(uint64_t size) const;

@@ -67,8 +67,6 @@ void HTProcess::setMemoryRegions(std::optional<std::vector<std::shared_ptr<HTMem
     memoryRegions_ = std::move(regions);
 }
 
-std::string HTProcess::description() const { return "HTProcess[" + std::to_string(pid_) + "]"; }
-
 std::string HTProcess::_nameForBsdInfo(HTPlatform& platform, const proc_bsdinfo& info)
 {
     int32_t argmax = 0;

@@ -79,14 +79,10 @@ public:
     uint64_t pageSize() const { return pageSize_; }
     void setPageSize(uint64_t value) { pageSize_ = value; }
 
-    // "HTProcess[pid]".
-    std::string description() const;
     // Processes are equal by pid, whatever their kind.
     bool isEqual(const HTProcess& other) const { return pid_ == other.pid_; }
-    size_t hash() const { return static_cast<size_t>(pid_); }
 
     HTPlatform& platform() const { return *platform_; }
-    const std::shared_ptr<HTPlatform>& sharedPlatform() const { return platform_; }
 
     // The name a process record stands for: the executable's file name from
     // its arguments, else the record's own short name.

@@ -24,7 +24,6 @@ void HTProcessGroup::addProcess(const std::shared_ptr<HTProcess>& process)
     const int32_t pid = process->pid();
     if (containsPid(pid)) return;
 
-    hashValue_ = (hashValue_ * 37) ^ static_cast<uint64_t>(static_cast<int64_t>(pid));
     processes_.push_back(process);
     pids_.push_back(pid);
     if (pidIndex_) {
@@ -32,33 +31,4 @@ void HTProcessGroup::addProcess(const std::shared_ptr<HTProcess>& process)
     } else if (pids_.size() > kIndexedGroupSize) {
         pidIndex_ = std::make_unique<std::unordered_set<int32_t>>(pids_.begin(), pids_.end());
     }
-}
-
-bool HTProcessGroup::isEqual(const HTProcessGroup& other) const
-{
-    if (other.immutable_) {
-        HT_ASSERT("HTProcessGroup", immutable_, "self->_immutable");
-        return this == &other;
-    }
-    if (pids_.size() != other.pids_.size()) return false;
-    for (int32_t pid : other.pids_)
-        if (!containsPid(pid)) return false;
-    return true;
-}
-
-std::shared_ptr<HTProcessGroup> HTProcessGroup::copy(const std::shared_ptr<HTProcessGroup>& group)
-{
-    HT_ASSERT("HTProcessGroup", group->immutable_, "_immutable");
-    return group;
-}
-
-std::string HTProcessGroup::description() const
-{
-    std::string text = "HTProcessGroup{";
-    for (size_t i = 0; i < processes_.size(); ++i) {
-        if (i > 0) text += ", ";
-        text += processes_[i]->description();
-    }
-    text += "}";
-    return text;
 }

@@ -1,7 +1,9 @@
 #include "analysis/HTHeftSharingData.h"
 #include "analysis/HTHeftTestSupport.h"
 #include "analysis/HTMemoryObjectMap.h"
+#include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
+#include "process/HTProcessGroup.h"
 
 #include <gtest/gtest.h>
 
@@ -17,7 +19,7 @@ HTMemoryObject* objectOf(const HTProcess& process, size_t region)
     return process.memoryRegions().at(region)->memoryObject().get();
 }
 
-std::string pidsOf(const HTProcessGroup& group) { return HTRecordingFormatter::pids(group.processes()); }
+std::string pidsOf(const HTProcessGroup& group) { return pidsOf(group.processes()); }
 
 TEST_F(HTHeftRoutingTest, ObjectIdsAreSharedWithinOneMapOnly)
 {
@@ -149,8 +151,8 @@ TEST_F(HTHeftProcessHeftTest, HeftFollowsTheBreakdownSwitch)
     EXPECT_FALSE(heft->pidToHeft().contains(30));
     // Equal hefts: larger pid first.
     auto order = heft->_processesBySortingHeft(heft->_notHiddenProcesses());
-    EXPECT_EQ(HTRecordingFormatter::pids(order), "{10,25,20}");
-    EXPECT_EQ(HTRecordingFormatter::pids(HTHeftProbe::_processesBySortingPidDesc(heft->processes())), "{30,25,20,10}");
+    EXPECT_EQ(pidsOf(order), "{10,25,20}");
+    EXPECT_EQ(pidsOf(HTHeftProbe::_processesBySortingPidDesc(heft->processes())), "{30,25,20,10}");
 
     // With it each region counts as the kernel reported it.
     setBreakdown(true);
@@ -170,7 +172,6 @@ TEST_F(HTHeftSharingTest, GroupsAreUnifiedAndPrivateGroupsComeFirst)
     auto groupsOf = [&](int32_t pid) {
         std::string text;
         for (const auto& group : *sharing->processToProcessGroups().find(pid)) {
-            EXPECT_TRUE(group->immutable());
             text += pidsOf(*group);
         }
         return text;
@@ -233,7 +234,7 @@ TEST_F(HTHeftCategoriesTest, CategoriesAreKeyedByNameAndCountObjectsOnce)
     auto keys = [](const HTCategoryMap& map) {
         std::string text;
         for (const auto& [key, category] : map)
-            text += "<" + key + ">" + HTRecordingFormatter::pages(category->totalDirtySize());
+            text += "<" + key + ">" + std::to_string(category->totalDirtySize() / kPage);
         return text;
     };
     EXPECT_EQ(keys(heft->_categoriesForAllProcessesShouldSummarize(false)), "<lib a.so>1<lib b.so>1<unknown>1");

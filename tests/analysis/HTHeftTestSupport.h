@@ -4,7 +4,6 @@
 #include "analysis/HTHeftReport.h"
 #include "analysis/HTHeftSharingData.h"
 #include "analysis/HTMemoryObjectMap.h"
-#include "analysis/HTRecordingFormatter.h"
 #include "analysis/HTScriptedProcess.h"
 #include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
@@ -73,19 +72,17 @@ protected:
         return heft;
     }
 
-    // The driver, gathered and reported to one recording formatter.
-    std::vector<std::string> report(const HTHeft::ProcessList& processes, bool verbose = false, bool summarize = false)
-    {
-        auto log = std::make_shared<HTRecordingFormatter::Log>();
-        auto heft = gathered(processes);
-        heft->addOutputFormatter(std::make_shared<HTRecordingFormatter>("X", log, true));
-        heft->printOutputVerbose(verbose, summarize);
-        return *log;
-    }
-
     std::shared_ptr<HTFakePlatform> platform_;
     HTSettings settings_;
 };
+
+// The pids of the processes, as "{10,20}".
+inline std::string pidsOf(const std::vector<std::shared_ptr<HTProcess>>& processes)
+{
+    std::string text = "{";
+    for (const auto& process : processes) text += (text.size() > 1 ? "," : "") + std::to_string(process->pid());
+    return text + "}";
+}
 
 // `n` pages of object `id`, all dirty, mapped shared.
 inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n, const char* name = "region")

@@ -43,23 +43,28 @@ std::string joined(const std::vector<std::string>& values)
 std::string described(const HTHeftArgs& args)
 {
     const HTSettings settings = args.settings();
+    const HTTargetSelection::Request request = args.targetRequest();
     std::string text;
     auto flag = [&](bool on, const char* name) { text += on ? std::string(name) + " " : ""; };
-    flag(args.targetAll(), "all");
-    flag(args.targetChildren(), "children");
-    flag(args.skipIdleExitClean(), "skip");
-    flag(args.searchForUnmapped(), "unmapped");
+    flag(request.targetAll, "all");
+    flag(request.targetChildren, "children");
+    flag(request.skipIdleExitClean, "skip");
+    flag(request.searchForUnmapped, "unmapped");
     flag(!settings.breakDownPhysHeft, "vmObjectDirty");
     flag(settings.verbose, "verbose");
     flag(!settings.summarize, "full");
     text += "f" + std::to_string(settings.summaryFormat) + " o" + std::to_string(settings.textOptions) + " " +
         settings.textSort;
     if (args.JSONOutputFile()) text += " j=" + *args.JSONOutputFile();
-    if (!args.potentialTargetProcesses().empty()) text += " t=" + joined(args.potentialTargetProcesses().values());
+    if (!request.potentialTargetProcesses.empty()) text += " t=" + joined(request.potentialTargetProcesses);
     std::vector<std::string> pids;
-    for (const auto& [pid, name] : args.targetPids()) pids.push_back(std::to_string(pid) + (name ? "?" : ""));
+    for (const auto& [pid, name] : request.targetPids) pids.push_back(std::to_string(pid) + (name ? "?" : ""));
     if (!pids.empty()) text += " p=" + joined(pids);
-    if (!args.excludedPidsOrProcesses().empty()) text += " x=" + joined(args.excludedPidsOrProcesses().values());
+    if (!request.excludedPidsOrProcesses.empty()) text += " x=" + joined(request.excludedPidsOrProcesses);
+    // -a and --unmapped are what need root.
+    EXPECT_EQ(args.targetAll(), request.targetAll);
+    EXPECT_EQ(args.searchForUnmapped(), request.searchForUnmapped);
+    EXPECT_TRUE(request.excludeSelf);
     return text;
 }
 
