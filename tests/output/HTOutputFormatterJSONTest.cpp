@@ -43,29 +43,6 @@ std::shared_ptr<TestProcess> process(int32_t pid, std::string name = "proc")
     return std::make_shared<TestProcess>(pid, std::move(name));
 }
 
-// A category known only by its figures; it has no member to name it, so the
-// writer files it under its key.
-void addCategory(HTCategoryMap& map, const std::string& name, uint64_t dirty, uint64_t swapped = 0, uint64_t clean = 0,
-                 uint64_t reclaimable = 0, uint64_t wired = 0)
-{
-    auto category = std::make_shared<HTMemoryCategory>(HTSegmentNoImage);
-    category->setTotalDirtySize(dirty);
-    category->setTotalSwappedSize(swapped);
-    category->setTotalCleanSize(clean);
-    category->setTotalReclaimableSize(reclaimable);
-    category->setTotalWiredSize(wired);
-    map.add(name, std::move(category));
-}
-
-std::shared_ptr<HTAuxDataMap> auxMap(std::initializer_list<std::pair<std::string, HTAuxDataMap::Value>> values)
-{
-    auto map = std::make_shared<HTAuxDataMap>();
-    for (const auto& [key, value] : values) map->set(key, value);
-    return map;
-}
-
-HTAuxDataMap::Value datum(int64_t value) { return std::make_shared<HTAuxData>(value, false); }
-
 // Compact JSON text of a parsed value, keys in document order.
 std::string json(const rapidjson::Value& value)
 {
@@ -84,110 +61,67 @@ std::vector<std::string> keys(const rapidjson::Value& object)
     return names;
 }
 
-class HTOutputFormatterJSONTest : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
-        char pattern[] = "/tmp/heft-json-test-XXXXXX";
-        ASSERT_NE(mkdtemp(pattern), nullptr);
-        directory_ = pattern;
-        path_ = directory_ + "/report.json";
-    }
-
-    void TearDown() override
-    {
-        std::remove(path_.c_str());
-        rmdir(directory_.c_str());
-    }
-
-    std::shared_ptr<HTOutputFormatterJSON> open(bool breakDownPhysHeft = true)
-    {
-        std::string error;
-        auto formatter = HTOutputFormatterJSON::initWithPath(path_, breakDownPhysHeft, kKernelPage, &error);
-        EXPECT_NE(formatter, nullptr) << error;
-        return formatter;
-    }
-
-    // One process block as the report assembly sends it.
-    static void writeProcess(HTOutputFormatterJSON& formatter, const HTProcess& process, uint64_t heft,
-                             const HTCategoryMap& categories, const std::shared_ptr<HTAuxDataMap>& aux)
-    {
-        formatter.printProcessHeader(process);
-        if (process.errors().empty()) formatter.printProcessTotal(heft, process);
-        formatter.endProcessHeader(process);
-        formatter.printProcessCategories(categories, HTMemoryTotals{});
-        formatter.printProcessAuxData(aux);
-    }
-
-    // The rest of the run after the process blocks.
-    static void finishRun(HTOutputFormatterJSON& formatter, const HTCategoryMap& summary = {},
-                          const HTMemoryTotals& total = {}, const std::shared_ptr<HTAuxDataMap>& globalAux = nullptr,
-                          const HTOutputFormatter::ProcessList& withWarnings = {},
-                          const HTOutputFormatter::ProcessList& withErrors = {},
-                          const std::vector<std::string>& globalErrors = {})
-    {
-        formatter.printProcessesWithWarnings(withWarnings, withErrors, globalErrors);
-        formatter.printSummaryCategories(summary, total, !withErrors.empty() || !globalErrors.empty());
-        formatter.printGlobalAuxData(globalAux);
-        formatter.end();
-    }
-
-    // Parses the file, which must be valid UTF-8 JSON written compactly:
-    // the parsed document written back out gives the file byte for byte.
-    // Whole documents are compared with expected reports in
-    // analysis/HTReportGoldenTest.cpp.
-    rapidjson::Document read()
-    {
-        std::ifstream in(path_, std::ios::binary);
-        std::stringstream content;
-        content << in.rdbuf();
-        const std::string raw = content.str();
-
-        rapidjson::Document document;
-        document.Parse<rapidjson::kParseValidateEncodingFlag>(raw.data(), raw.size());
-        EXPECT_FALSE(document.HasParseError())
-            << "error " << document.GetParseError() << " at " << document.GetErrorOffset() << " in " << raw;
-        if (!document.HasParseError()) {
-            EXPECT_EQ(json(document), raw);
-        }
-        return document;
-    }
-
-    std::string directory_;
-    std::string path_;
-};
-
-TEST_F(HTOutputFormatterJSONTest, PageSizeFallsBackToTheKernelPageSize)
+// Writes one run with `process` as its only block, and parses the file,
+// which must be valid UTF-8 JSON written compactly: the parsed document
+// written back out gives the file byte for byte. Whole documents are
+// compared with expected reports in analysis/HTReportGoldenTest.cpp.
+rapidjson::Document writtenRun(const std::shared_ptr<TestProcess>& process, const HTCategoryMap& categories,
+                               const std::shared_ptr<HTAuxDataMap>& aux)
 {
-    for (bool withProcess : {false, true}) {
-        auto formatter = open();
-        if (withProcess) {
-            auto p = process(1);
-            p->setPageSize(0);
-            writeProcess(*formatter, *p, 0, HTCategoryMap{}, nullptr);
-        }
-        finishRun(*formatter);
-        auto doc = read();
+    char directory[] = "/tmp/heft-json-test-XXXXXX";
+    EXPECT_NE(mkdtemp(directory), nullptr);
+    const std::string path = std::string(directory) + "/report.json";
+    std::string error;
+    auto formatter = HTOutputFormatterJSON::initWithPath(path, true, kKernelPage, &error);
+    EXPECT_NE(formatter, nullptr) << error;
+    if (process) {
+        formatter->printProcessHeader(*process);
+        if (process->errors().empty()) formatter->printProcessTotal(0, *process);
+        formatter->endProcessHeader(*process);
+        formatter->printProcessCategories(categories, HTMemoryTotals{});
+        formatter->printProcessAuxData(aux);
+    }
+    formatter->printProcessesWithWarnings({}, {}, {});
+    formatter->printSummaryCategories({}, {}, false);
+    formatter->printGlobalAuxData(nullptr);
+    formatter->end();
+
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream content;
+    content << in.rdbuf();
+    const std::string raw = content.str();
+    std::remove(path.c_str());
+    rmdir(directory);
+    rapidjson::Document document;
+    document.Parse<rapidjson::kParseValidateEncodingFlag>(raw.data(), raw.size());
+    EXPECT_FALSE(document.HasParseError()) << "error " << document.GetParseError() << " in " << raw;
+    EXPECT_EQ(document.HasParseError() ? raw : json(document), raw);
+    return document;
+}
+
+TEST(HTOutputFormatterJSON, PageSizeFallsBackToTheKernelPageSize)
+{
+    auto noPageSize = process(1);
+    noPageSize->setPageSize(0);
+    for (const auto& p : {std::shared_ptr<TestProcess>(), noPageSize}) {
+        auto doc = writtenRun(p, {}, nullptr);
         ASSERT_TRUE(doc.IsObject());
-        EXPECT_EQ(doc["page size"].GetUint64(), kKernelPage)
-            << (withProcess ? "process without page size" : "no process");
+        EXPECT_EQ(doc["page size"].GetUint64(), kKernelPage) << (p ? "process without page size" : "no process");
     }
 }
 
-TEST_F(HTOutputFormatterJSONTest, AwkwardStringsStillGiveValidJSON)
+TEST(HTOutputFormatterJSON, AwkwardStringsStillGiveValidJSON)
 {
     const std::string awkward = std::string("a\"b\\c\x01\td") + '\0' + "e\xff" + "f\xc3\xbc";
     const std::string mended = std::string("a\"b\\c\x01\td") + '\0' + "e\xEF\xBF\xBD" + "f\xc3\xbc";
-
-    auto formatter = open();
     auto p = process(7, awkward);
     p->fail(awkward);
     HTCategoryMap categories;
-    addCategory(categories, awkward, 1);
-    writeProcess(*formatter, *p, 0, categories, auxMap({{awkward, datum(3)}}));
-    finishRun(*formatter, {}, {}, nullptr, {}, {p});
+    categories.add(awkward, std::make_shared<HTMemoryCategory>(HTSegmentNoImage));
+    auto aux = std::make_shared<HTAuxDataMap>();
+    aux->set(awkward, std::make_shared<HTAuxData>(3, false));
 
-    auto doc = read();
+    auto doc = writtenRun(p, categories, aux);
     ASSERT_TRUE(doc.IsObject());
     const auto& proc = doc["processes"][0];
     EXPECT_EQ(text(proc["name"]), mended);
