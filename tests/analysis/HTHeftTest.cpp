@@ -12,7 +12,6 @@ namespace {
 using HTHeftRoutingTest = HTAnalysisTest;
 using HTHeftProcessHeftTest = HTAnalysisTest;
 using HTHeftSharingTest = HTAnalysisTest;
-using HTHeftCategoriesTest = HTAnalysisTest;
 
 HTMemoryObject* objectOf(const HTProcess& process, size_t region)
 {
@@ -216,42 +215,6 @@ TEST_F(HTHeftSharingTest, HiddenProcessesJoinOnlyThroughOwnedMemoryWithAFakeRegi
     EXPECT_EQ(groupsFor(true), "{10,40}1{10}1 40 grouped");
     // Owners are known only in the breakdown mode.
     EXPECT_EQ(groupsFor(false), "{10}2");
-}
-
-TEST_F(HTHeftCategoriesTest, CategoriesAreKeyedByNameAndCountObjectsOnce)
-{
-    auto named = [](uint64_t id, std::optional<std::string> name, std::optional<std::string> detail) {
-        HTScriptedRegion region = dirtyPages(id, 1);
-        region.name = std::move(name);
-        region.detailedName = std::move(detail);
-        return region;
-    };
-    auto p10 = process(10, {named(1, "lib", "a.so"), named(2, "lib", "b.so"), named(3, std::nullopt, std::nullopt)});
-    auto p20 = process(20, {named(1, "lib", "a.so")});
-    auto p30 = process(30, {named(1, "lib", "a.so")});
-    auto heft = gathered({p10, p20, p30});
-
-    auto keys = [](const HTCategoryMap& map) {
-        std::string text;
-        for (const auto& [key, category] : map)
-            text += "<" + key + ">" + std::to_string(category->totalDirtySize() / kPage);
-        return text;
-    };
-    EXPECT_EQ(keys(heft->_categoriesForAllProcessesShouldSummarize(false)), "<lib a.so>1<lib b.so>1<unknown>1");
-    EXPECT_EQ(keys(heft->_categoriesForAllProcessesShouldSummarize(true)), "<lib>2<unknown>1");
-
-    HTMemoryTotals total{1, 2, 3, 4, 5, 6};
-    HTHeftProbe::_totalForCategories(HTCategoryMap(), &total);
-    EXPECT_EQ(total, HTMemoryTotals{});
-    HTHeftProbe::_totalForCategories(heft->_categoriesForAllProcessesShouldSummarize(true), &total);
-    EXPECT_EQ(total, (HTMemoryTotals{3 * kPage, 0, 0, 0, 0, 5}));  // lib a.so has a region in each process
-
-    // Three processes that map an object whole see it whole.
-    HTHeft::ObjectSet shared;
-    shared.insert(p20->memoryRegions()[0]->memoryObject());
-    bool hasProcessView = true;
-    EXPECT_EQ(keys(heft->_categoriesForObjects(shared, *p20, &hasProcessView, false)), "<lib a.so>1");
-    EXPECT_FALSE(hasProcessView);
 }
 
 TEST(HTMemoryObjectMapTest, FindsEveryKeyAndKeepsInsertionOrder)

@@ -172,10 +172,12 @@ TEST_F(HTReportGoldenTest, Reports)
                                         process(30, {region(7, "shm", 1), secondPage})};
          }},
         // Memory p10 owns is clean to p20; the summary counts it once, dirty.
+        // Memory without a name is still shown, under "unknown".
         {"owned-memory",
          [&] {
+             HTScriptedRegion unnamed{.objectId = 10, .dirty = kPage, .name = std::nullopt};
              return HTHeft::ProcessList{process(10, {owned(region(8, "shm", 1))}),
-                                        process(20, {region(8, "shm", 1), region(9, "heap", 2)})};
+                                        process(20, {region(8, "shm", 1), region(9, "heap", 2), unnamed})};
          },
          [](HTSettings& s) { s.breakDownPhysHeft = true; }},
         // The hidden process maps memory p10 owns and has a fake region

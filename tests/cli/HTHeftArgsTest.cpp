@@ -4,6 +4,8 @@
 
 #include <optional>
 #include <string>
+#include <tuple>
+#include <utility>
 #include <vector>
 
 namespace {
@@ -68,61 +70,75 @@ std::string described(const HTHeftArgs& args)
     return text;
 }
 
-const std::string kUnmappedIgnored = "WARNING: ignoring '--unmapped' because the requested analysis mode "
-                                     "'--vmObjectDirty' does not support unmapped owned VM objects\n";
-const std::string kSummaryDeprecated =
-    "WARNING: -y/--summary options are deprecated because summary is the default mode\n";
+// The words of `text`; "_" stands for a blank inside a word.
+Arguments words(const std::string& text)
+{
+    Arguments result(1);
+    for (char c : text) {
+        if (c != ' ')
+            result.back() += c == '_' ? ' ' : c;
+        else if (!result.back().empty())
+            result.emplace_back();
+    }
+    if (result.back().empty()) result.pop_back();
+    return result;
+}
 
 TEST(HTHeftArgsTest, CommandLinesAndWhatTheySay)
 {
-    struct Row {
-        Arguments arguments;
-        std::string described;
-        std::string standardError;
-    } rows[] = {
-        {{}, "f1 o0 Dirty", ""},
+    const std::pair<const char*, const char*> rows[] = {
+        {"", "f1 o0 Dirty"},
         // Later values override; sets accumulate, each member once.
-        {{"-a", "-t", "-s", "-j", "a.json", "--json", "b.json", "-f", "pages", "--format", "bytes"},
-         "all children skip f0 o0 Dirty j=b.json",
-         ""},
-        {{"-x", "7", "--exclude", "name", "-x", "7", "--format", "formatted"}, "f1 o0 Dirty x=7,name", ""},
+        {"-a -t -s -j a.json --json b.json -f pages --format bytes", "all children skip f0 o0 Dirty j=b.json"},
+        {"-x 7 --exclude name -x 7 --format formatted", "f1 o0 Dirty x=7,name"},
         // -v trades the summary for the full listing.
-        {{"-v"}, "verbose full f1 o0 Dirty", ""},
+        {"-v", "verbose full f1 o0 Dirty"},
         // The column options are bits.
-        {{"--wired"}, "f1 o1 Dirty", ""},
-        {{"--swapped", "--wired"}, "f1 o3 Dirty", ""},
-        {{"-w", "--wired"}, "f1 o7 Dirty", ""},
-        {{"--swapped", "--wide"}, "f1 o7 Dirty", ""},
+        {"--wired", "f1 o1 Dirty"},
+        {"--swapped --wired", "f1 o3 Dirty"},
+        {"-w --wired", "f1 o7 Dirty"},
+        {"--swapped --wide", "f1 o7 Dirty"},
         // Sort columns match in any case and are stored as named.
-        {{"--sort", "regions"}, "f1 o0 Regions", ""},
-        {{"--sort", "cAtEgOrY"}, "f1 o0 Category", ""},
-        {{"--sort", "wired", "--sort", "reclaimable"}, "f1 o0 Reclaimable", ""},
+        {"--sort regions", "f1 o0 Regions"},
+        {"--sort cAtEgOrY", "f1 o0 Category"},
+        {"--sort wired --sort reclaimable", "f1 o0 Reclaimable"},
         // Pids are whole numbers in range, leading blanks allowed.
-        {{"--pid", "42", "--pid", " 7", "--pid", "0", "--pid", "2147483647"}, "f1 o0 Dirty p=42,7,0,2147483647", ""},
+        {"--pid 42 --pid _7 --pid 0 --pid 2147483647", "f1 o0 Dirty p=42,7,0,2147483647"},
         // Options are taken in order wherever they stand, operands after
         // them; --pid between two --proc options is not one of them; -p does
         // not read its argument as a number.
-        {{"7", "x", "-p", "9", "7", "--proc", "x", "--pid", "12", "--proc", "y", "9", "z"},
-         "f1 o0 Dirty t=9,x,y,7,z p=12",
-         ""},
-        {{"-p", "42x"}, "f1 o0 Dirty t=42x", ""},
-        // Deprecated options only warn.
-        {{"-y"}, "f1 o0 Dirty", kSummaryDeprecated},
-        {{"--physHeft", "--summary"},
-         "f1 o0 Dirty",
-         "WARNING: --physHeft option is deprecated because it is the default mode\n" + kSummaryDeprecated},
-        // --unmapped is settled after every option: the mode given after it
-        // still wins, and -a makes it redundant.
-        {{"--unmapped", "7"}, "unmapped f1 o0 Dirty t=7", ""},
-        {{"--vmObjectDirty", "--unmapped"}, "vmObjectDirty f1 o0 Dirty", kUnmappedIgnored},
-        {{"--unmapped", "--vmObjectDirty", "-a"}, "all vmObjectDirty f1 o0 Dirty", kUnmappedIgnored},
-        {{"--unmapped", "--all"}, "all f1 o0 Dirty", "NOTICE: '--unmapped' is redundant when using -a/--all\n"},
+        {"7 x -p 9 7 --proc x --pid 12 --proc y 9 z", "f1 o0 Dirty t=9,x,y,7,z p=12"},
+        {"-p 42x", "f1 o0 Dirty t=42x"},
+        {"--unmapped 7", "unmapped f1 o0 Dirty t=7"},
     };
-    for (const Row& row : rows) {
-        Parsed parsed = parse(row.arguments);
-        ASSERT_TRUE(parsed.args) << joined(row.arguments);
-        EXPECT_EQ(described(*parsed.args), row.described) << joined(row.arguments);
-        EXPECT_EQ(parsed.standardError, row.standardError) << joined(row.arguments);
+    for (const auto& [arguments, expected] : rows) {
+        Parsed parsed = parse(words(arguments));
+        ASSERT_TRUE(parsed.args) << arguments;
+        EXPECT_EQ(described(*parsed.args), expected) << arguments;
+        EXPECT_EQ(parsed.standardError, "") << arguments;
+    }
+}
+
+TEST(HTHeftArgsTest, WarningsAndHowTheyAreSettled)
+{
+    const std::string unmappedIgnored = "WARNING: ignoring '--unmapped' because the requested analysis mode "
+                                        "'--vmObjectDirty' does not support unmapped owned VM objects\n";
+    const std::string summary = "WARNING: -y/--summary options are deprecated because summary is the default mode\n";
+    const std::string physHeft = "WARNING: --physHeft option is deprecated because it is the default mode\n";
+    // --unmapped is settled after every option: the mode given after it
+    // still wins, and -a makes it redundant. Deprecated options only warn.
+    const std::tuple<const char*, const char*, std::string> rows[] = {
+        {"-y", "f1 o0 Dirty", summary},
+        {"--physHeft --summary", "f1 o0 Dirty", physHeft + summary},
+        {"--vmObjectDirty --unmapped", "vmObjectDirty f1 o0 Dirty", unmappedIgnored},
+        {"--unmapped --vmObjectDirty -a", "all vmObjectDirty f1 o0 Dirty", unmappedIgnored},
+        {"--unmapped --all", "all f1 o0 Dirty", "NOTICE: '--unmapped' is redundant when using -a/--all\n"},
+    };
+    for (const auto& [arguments, expected, standardError] : rows) {
+        Parsed parsed = parse(words(arguments));
+        ASSERT_TRUE(parsed.args) << arguments;
+        EXPECT_EQ(described(*parsed.args), expected) << arguments;
+        EXPECT_EQ(parsed.standardError, standardError) << arguments;
     }
 }
 
@@ -132,47 +148,42 @@ TEST(HTHeftArgsTest, BadCommandLinesAndTheirErrors)
                                 "reclaimable, wired, regions, category";
     const std::string badFormat =
         "Unrecognized argument to -f / --format.\nAccepted arguments: 'bytes', 'formatted', 'pages'.";
-    auto badPid = [](const std::string& value) {
-        return "'" + value + "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a " +
-            "process name.";
+    // Trailing characters, values that would wrap to another pid, and
+    // negative numbers name no process; the format must match exactly.
+    const std::pair<const char*, std::string> rejected[] = {
+        {"--sort size", badSort},
+        {"--pid 5 --pid 42x", "42x"},
+        {"--pid 12_abc", "12 abc"},
+        {"--pid -7", "-7"},
+        {"--pid 2147483648", "2147483648"},
+        {"--pid 4294967297", "4294967297"},
+        {"-f Bytes", badFormat},
+        {"-f page", badFormat},
     };
-    struct Row {
-        Arguments arguments;
-        int64_t code;
-        std::optional<std::string> description;
-    } rows[] = {
-        {{"--sort", "size"}, 3, badSort},
-        // Trailing characters, values that would wrap to another pid, and
-        // negative numbers name no process.
-        {{"--pid", "5", "--pid", "42x"}, 4, badPid("42x")},
-        {{"--pid", "12 abc"}, 4, badPid("12 abc")},
-        {{"--pid", ""}, 4, badPid("")},
-        {{"--pid", "-7"}, 4, badPid("-7")},
-        {{"--pid", "2147483648"}, 4, badPid("2147483648")},
-        {{"--pid", "4294967297"}, 4, badPid("4294967297")},
-        {{"--pid", "99999999999999999999"}, 4, badPid("99999999999999999999")},
-        // The format must match exactly.
-        {{"-f", "Bytes"}, 2, badFormat},
-        {{"-f", "page"}, 2, badFormat},
-        // Help stops the parse; the option parser names other culprits
-        // itself, so their errors carry no text.
-        {{"-a", "-h", "--sort", "size"}, 1, std::nullopt},
-        {{"--help"}, 1, std::nullopt},
-        {{"--bogus"}, 5, std::nullopt},
-        {{"-q"}, 5, std::nullopt},
-        {{"-j"}, 5, std::nullopt},
-        {{"--sort"}, 5, std::nullopt},
-    };
-    for (const Row& row : rows) {
-        Parsed parsed = parse(row.arguments);
-        EXPECT_FALSE(parsed.args) << joined(row.arguments);
+    for (const auto& [arguments, description] : rejected) {
+        Parsed parsed = parse(words(arguments));
+        EXPECT_FALSE(parsed.args) << arguments;
         EXPECT_EQ(parsed.error.domain, "HTHeftError");
-        EXPECT_EQ(parsed.error.code, row.code) << joined(row.arguments);
-        EXPECT_EQ(parsed.error.description, row.description);
-        const bool parserSpoke = parsed.standardError.rfind("heft: ", 0) == 0;
-        EXPECT_EQ(parserSpoke, row.code == 5) << parsed.standardError;
+        const bool pid = description.size() < 20;
+        EXPECT_EQ(parsed.error.code, pid ? 4 : description == badSort ? 3 : 2) << arguments;
+        EXPECT_EQ(parsed.error.description,
+                  pid ? "'" + description +
+                          "' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to specify a process "
+                          "name."
+                      : description);
+        EXPECT_EQ(parsed.standardError, "") << arguments;
     }
-
+    // Help stops the parse; the option parser names other culprits itself,
+    // so their errors carry no text.
+    const std::pair<const char*, int64_t> silent[] = {
+        {"-a -h --sort size", 1}, {"--help", 1}, {"--bogus", 5}, {"-q", 5}, {"-j", 5}, {"--sort", 5}};
+    for (const auto& [arguments, code] : silent) {
+        Parsed parsed = parse(words(arguments));
+        EXPECT_FALSE(parsed.args) << arguments;
+        EXPECT_EQ(parsed.error.code, code) << arguments;
+        EXPECT_EQ(parsed.error.description, std::nullopt) << arguments;
+        EXPECT_EQ(parsed.standardError.rfind("heft: ", 0) == 0, code == 5) << parsed.standardError;
+    }
     // The first parse stops inside a group of short options; a parser that
     // kept its place would carry the -s into the next command line.
     EXPECT_FALSE(parse({"-hs"}).args);
