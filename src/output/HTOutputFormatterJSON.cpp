@@ -1,6 +1,5 @@
 #include "output/HTOutputFormatterJSON.h"
 
-#include "process/HTProcessGroup.h"
 #include "base/HTAssert.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
@@ -8,6 +7,7 @@
 #include "model/HTMemoryRegion.h"
 #include "output/HTOutputFile.h"
 #include "process/HTProcess.h"
+#include "process/HTProcessGroup.h"
 
 #include <rapidjson/filewritestream.h>
 #include <rapidjson/writer.h>
