@@ -1,13 +1,12 @@
 #include "platform/linux/HTElfImageReader.h"
-#include "platform/HTTestChildren.h"
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTSmapsParser.h"
+#include "support/HTLayoutChild.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <chrono>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -18,7 +17,6 @@
 #include <gnu/libc-version.h>
 #include <string>
 #include <sys/mman.h>
-#include <thread>
 #include <unistd.h>
 #include <vector>
 
@@ -142,16 +140,6 @@ const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images,
         if (resolved(image.path) == resolved(path)) return &image;
     }
     return nullptr;
-}
-
-// The state letter of the process (R, S, D, ...); 0 when unreadable.
-char processState(pid_t pid)
-{
-    HTProcBuffer stat;
-    if (!stat.readFile(AT_FDCWD, ("/proc/" + std::to_string(pid) + "/stat").c_str())) return 0;
-    std::string_view text = stat.view();
-    size_t close = text.rfind(')');
-    return close != std::string_view::npos && close + 2 < text.size() ? text[close + 2] : 0;
 }
 
 // The name of the image segment holding the address; empty when none.
@@ -295,21 +283,17 @@ TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
 
 TEST(HTElfImageReader, ListsAChildProcess)
 {
-    HTTestChild child = HTTestChild::exec("/bin/sleep", {"sleep", "30"});
-    ASSERT_TRUE(child.valid());
+    // Ready, the child has loaded everything and protected its relocated
+    // data: its mappings stay as they are.
+    HTLayoutChild child({});
+    ASSERT_TRUE(child.ready());
     HTLinuxPlatform platform;
     auto task = openTask(platform, child.pid());
     ASSERT_NE(task, nullptr);
-    // exec has returned; the dynamic loader may still be mapping libraries
-    // and protecting their relocated data. Once the child sleeps, its
-    // mappings stay as they are.
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    while (processState(child.pid()) != 'S' && std::chrono::steady_clock::now() < deadline)
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
     std::vector<HTPlatformImage> images = listImages(platform, *task);
-    const HTPlatformImage* sleep = imageWithPath(images, "/bin/sleep");
-    ASSERT_NE(sleep, nullptr);
-    EXPECT_EQ(segmentAt(*sleep, sleep->baseAddress), "__LINKEDIT");
+    const HTPlatformImage* program = imageWithPath(images, HEFT_LAYOUT_PROGRAM);
+    ASSERT_NE(program, nullptr);
+    EXPECT_EQ(segmentAt(*program, program->baseAddress), "__LINKEDIT");
     expectMappingsMatchSegments(child.pid(), images);
 
     child.reap();
