@@ -113,19 +113,6 @@ TEST(HTLinuxPlatform, ChildStoppedZombieAndGone)
     EXPECT_EQ(task, nullptr);
 }
 
-TEST(HTLinuxPlatform, ProcessWhoseMainThreadExitedLivesThroughItsOtherThread)
-{
-    // The main thread's stat says zombie, but the process lives, and the
-    // live thread has its memory figures.
-    HTLinuxPlatform platform;
-    HTLayoutChild child({"anon", std::to_string(1 << 20), "exit-main"});
-    ASSERT_TRUE(child.ready());
-    EXPECT_NE(shortRecord(platform, child.pid()).pbsi_status, SZOMB);
-    rusage_info_v4 usage{};
-    EXPECT_EQ(platform.proc_pid_rusage(child.pid(), RUSAGE_INFO_V4, &usage), 0);
-    EXPECT_GE(usage.ri_phys_heft, 1u << 20);
-}
-
 TEST(HTLinuxPlatform, ListingHoldsKernelAndProcessesButNoKernelThreads)
 {
     HTLinuxPlatform platform;

@@ -7,7 +7,7 @@
  * numbers. Then it prints "ready" and waits, its memory exactly as laid out,
  * until it is killed. Every process it starts is in its process group.
  *
- *   anon SIZE          written private anonymous memory: ADDRESS
+ *   anon SIZE          written private anonymous memory: ADDRESS 0
  *   free SIZE          the same, then MADV_FREE'd: ADDRESS ERRNO
  *   lock SIZE          the same, then mlocked: ADDRESS ERRNO
  *   pageout SIZE       the same, then pushed to swap (MADV_PAGEOUT): ADDRESS ERRNO
@@ -173,6 +173,8 @@ static void* worker(void* unused)
     return unused;
 }
 
+#define IS(name) (strcmp(directive, name) == 0)
+
 int main(int argc, char** argv)
 {
     page = (size_t)sysconf(_SC_PAGESIZE);
@@ -185,24 +187,20 @@ int main(int argc, char** argv)
         size_t size = i + 1 < argc ? strtoull(argv[i + 1], NULL, 10) : 0;
         char* pages = NULL;
         int error = 0;
-        if (strcmp(directive, "anon") == 0 || strcmp(directive, "free") == 0 || strcmp(directive, "lock") == 0 ||
-            strcmp(directive, "pageout") == 0) {
+        if (IS("anon") || IS("free") || IS("lock") || IS("pageout")) {
             pages = mapWritten(size);
-            if (strcmp(directive, "free") == 0) error = madvise(pages, size, MADV_FREE) ? errno : 0;
-            if (strcmp(directive, "lock") == 0) error = mlock(pages, size) ? errno : 0;
-            if (strcmp(directive, "pageout") == 0) error = madvise(pages, size, MADV_PAGEOUT) ? errno : 0;
-            if (strcmp(directive, "anon") == 0)
-                printf("%lu\n", (unsigned long)pages);
-            else
-                printf("%lu %d\n", (unsigned long)pages, error);
+            if (IS("free")) error = madvise(pages, size, MADV_FREE) ? errno : 0;
+            if (IS("lock")) error = mlock(pages, size) ? errno : 0;
+            if (IS("pageout")) error = madvise(pages, size, MADV_PAGEOUT) ? errno : 0;
+            printf("%lu %d\n", (unsigned long)pages, error);
             ++i;
-        } else if (strcmp(directive, "file") == 0 && i + 3 < argc) {
+        } else if (IS("file") && i + 3 < argc) {
             size = strtoull(argv[i + 2], NULL, 10);
             pages = mapFile(argv[i + 1], size, MAP_SHARED, 1);
             touch(pages, strtoull(argv[i + 3], NULL, 10));
             printf("%lu\n", (unsigned long)pages);
             i += 3;
-        } else if (strcmp(directive, "private") == 0 && i + 2 < argc) {
+        } else if (IS("private") && i + 2 < argc) {
             int written = strcmp(argv[i + 2], "written") == 0;
             pages = mapFile(argv[i + 1], 0, MAP_PRIVATE, written);
             struct stat status;
@@ -217,7 +215,7 @@ int main(int argc, char** argv)
             }
             printf("%lu\n", (unsigned long)pages);
             i += 2;
-        } else if (strcmp(directive, "mappings") == 0) {
+        } else if (IS("mappings")) {
             /* Every other page inaccessible: no two mappings can merge. */
             pages = mmap(NULL, 2 * size * page, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
             if (pages == MAP_FAILED) return 3;
@@ -225,18 +223,18 @@ int main(int argc, char** argv)
                 if (mprotect(pages + 2 * m * page, page, PROT_READ) != 0) return 3;
             printf("%lu\n", (unsigned long)pages);
             ++i;
-        } else if (strcmp(directive, "fork") == 0 && i + 3 < argc && first != NULL) {
+        } else if (IS("fork") && i + 3 < argc && first != NULL) {
             forkFamily((int)size, strtoull(argv[i + 2], NULL, 10), strtoull(argv[i + 3], NULL, 10), first, firstSize);
             i += 3;
-        } else if (strcmp(directive, "tree") == 0) {
+        } else if (IS("tree")) {
             tree();
-        } else if (strcmp(directive, "churn") == 0) {
+        } else if (IS("churn")) {
             printf("0\nready\n");
             fflush(stdout);
             churn();
-        } else if (strcmp(directive, "exit") == 0) {
+        } else if (IS("exit")) {
             return 0;
-        } else if (strcmp(directive, "exit-main") == 0) {
+        } else if (IS("exit-main")) {
             fflush(stdout);
             pthread_t thread;
             if (pthread_create(&thread, NULL, worker, NULL) != 0) return 3;
