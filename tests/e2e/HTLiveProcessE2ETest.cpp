@@ -183,7 +183,7 @@ TEST_F(HTLiveProcessE2ETest, ProcessesExitingDuringTheRunLeaveAWholeReport)
     HTLayoutChild churn({"churn"});
     ASSERT_TRUE(churn.ready());
     const std::string path = directory_.file("all.json");
-    for (int run = 0; run < 5; ++run) {
+    for (int run = 0; run < 3; ++run) {
         SCOPED_TRACE("run " + n(run));
         // The test itself is left out: built with a sanitizer, it reserves
         // terabytes of shadow memory, which is not what this test is about.

@@ -114,31 +114,21 @@ std::string temporaryFile(const std::string& bytes, int& fd)
     return pattern;
 }
 
-std::shared_ptr<HTTaskPort> openTask(HTLinuxPlatform& platform, pid_t pid)
-{
-    std::shared_ptr<HTTaskPort> task;
-    return platform.task_for_pid(pid, &task) == KERN_SUCCESS ? task : nullptr;
-}
-
-std::vector<HTPlatformImage> listImages(HTLinuxPlatform& platform, HTTaskPort& task)
+// The images of process `pid`, through `task` (opened here when empty).
+std::vector<HTPlatformImage> listImages(HTLinuxPlatform& platform, pid_t pid, std::shared_ptr<HTTaskPort>& task)
 {
     std::vector<HTPlatformImage> images;
-    EXPECT_TRUE(platform.forEachTaskImage(task, 0, [&](const HTPlatformImage& image) { images.push_back(image); }));
+    EXPECT_TRUE(task || platform.task_for_pid(pid, &task) == KERN_SUCCESS);
+    EXPECT_TRUE(task &&
+                platform.forEachTaskImage(*task, 0, [&](const HTPlatformImage& image) { images.push_back(image); }));
     return images;
-}
-
-std::string resolved(const std::string& path)
-{
-    std::error_code error;
-    std::string real = std::filesystem::canonical(path, error);
-    return error ? path : real;
 }
 
 const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images, const std::string& path)
 {
-    for (const auto& image : images) {
-        if (resolved(image.path) == resolved(path)) return &image;
-    }
+    std::error_code error;
+    for (const auto& image : images)
+        if (std::filesystem::equivalent(image.path, path, error)) return &image;
     return nullptr;
 }
 
@@ -257,10 +247,8 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
 TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
 {
     HTLinuxPlatform platform;
-    auto task = openTask(platform, ::getpid());
-    ASSERT_NE(task, nullptr);
-    auto images = listImages(platform, *task);
-
+    std::shared_ptr<HTTaskPort> task;
+    auto images = listImages(platform, ::getpid(), task);
     const HTPlatformImage* self = imageWithPath(images, "/proc/self/exe");
     ASSERT_NE(self, nullptr);
     EXPECT_EQ(segmentAt(*self, reinterpret_cast<uintptr_t>(&listImages)), "__TEXT");
@@ -288,9 +276,8 @@ TEST(HTElfImageReader, ListsAChildProcess)
     HTLayoutChild child({});
     ASSERT_TRUE(child.ready());
     HTLinuxPlatform platform;
-    auto task = openTask(platform, child.pid());
-    ASSERT_NE(task, nullptr);
-    std::vector<HTPlatformImage> images = listImages(platform, *task);
+    std::shared_ptr<HTTaskPort> task;
+    std::vector<HTPlatformImage> images = listImages(platform, child.pid(), task);
     const HTPlatformImage* program = imageWithPath(images, HEFT_LAYOUT_PROGRAM);
     ASSERT_NE(program, nullptr);
     EXPECT_EQ(segmentAt(*program, program->baseAddress), "__LINKEDIT");
@@ -321,9 +308,8 @@ TEST(HTElfImageReader, MappedFilesGiveImagesOnlyWhenTheyAreElf)
     ASSERT_NE(dataMap, MAP_FAILED);
 
     HTLinuxPlatform platform;
-    auto task = openTask(platform, ::getpid());
-    ASSERT_NE(task, nullptr);
-    auto images = listImages(platform, *task);
+    std::shared_ptr<HTTaskPort> task;
+    auto images = listImages(platform, ::getpid(), task);
     const HTPlatformImage* object = imageWithPath(images, elfPath);
     EXPECT_EQ(imageWithPath(images, textPath), nullptr);
     ::unlink(textPath.c_str());
