@@ -86,8 +86,7 @@ inline Outcome runHeft(std::vector<std::string> arguments)
 // heft run by the unprivileged user nobody.
 inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
 {
-    arguments.insert(arguments.begin(),
-                     {"setpriv", "--reuid=" + n(kNobody), "--regid=" + n(kNobody), "--clear-groups", kHeftBinary});
+    arguments.insert(arguments.begin(), {"setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", kHeftBinary});
     return runProgram(kSetpriv, std::move(arguments));
 }
 
@@ -218,7 +217,7 @@ inline auto arrayIn(const rapidjson::Value& object, const char* key)
 inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t pid)
 {
     for (const auto& process : arrayIn(report, "processes"))
-        if (process.HasMember("pid") && process["pid"].IsInt() && process["pid"].GetInt() == pid) return &process;
+        if (number(&process, "pid") == static_cast<uint64_t>(pid)) return &process;
     return nullptr;
 }
 

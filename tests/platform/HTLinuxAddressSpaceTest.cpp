@@ -206,55 +206,6 @@ TEST_F(HTLinuxAddressSpace, PagesFreedWithMadvFreeAreReusable)
               std::vector<int32_t>(kFreed, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE));
 }
 
-TEST_F(HTLinuxAddressSpace, PagesOnlyReadAgreeWithTheKernelsPageFlags)
-{
-    // Anonymous memory only read holds the shared zero page on most kernels
-    // (in a huge-page-aligned stretch, the huge zero page); a kernel may also
-    // give such a read a page of its own. Either way the answer must be what
-    // the page's own flags say: zero pages are present but cost nothing,
-    // other pages are dirty. Asked of the test itself.
-    if (!pageFlagsReadable()) GTEST_SKIP() << "needs /proc/kpageflags (root)";
-    constexpr uint64_t kHuge = 2u << 20;
-    void* base = ::mmap(nullptr, 3 * kHuge, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-    ASSERT_NE(base, MAP_FAILED);
-    auto* aligned = reinterpret_cast<volatile char*>((reinterpret_cast<uintptr_t>(base) + kHuge - 1) & ~(kHuge - 1));
-    ::madvise(const_cast<char*>(aligned), kHuge, MADV_HUGEPAGE);
-    const uint64_t pages = kHuge / kPage + 8;
-    char sink = 0;
-    for (uint64_t i = 0; i < pages; ++i) sink = static_cast<char>(sink + aligned[i * kPage]);
-    aligned[kHuge + 4 * kPage] = sink;  // one page written among the read ones
-
-    std::shared_ptr<HTTaskPort> task;
-    ASSERT_EQ(platform_.task_for_pid(::getpid(), &task), KERN_SUCCESS);
-    kern_return_t result;
-    walk(platform_, *task, result);
-    const auto start = reinterpret_cast<uint64_t>(aligned);
-    // Asked alone, and after a scan of the mapping's populated pages, which
-    // learns on its way whether the mapping holds zero pages.
-    std::vector<int32_t> answers = dispositions(platform_, *task, start, pages, result);
-    ASSERT_EQ(result, KERN_SUCCESS);
-    std::vector<HTPageRun> runs;
-    platform_.populatedRuns(*task, reinterpret_cast<uint64_t>(base), reinterpret_cast<uint64_t>(base) + 3 * kHuge,
-                            runs);
-    EXPECT_EQ(dispositions(platform_, *task, start, pages, result), answers);
-
-    int pagemap = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
-    int kpageflags = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
-    ASSERT_GE(std::min(pagemap, kpageflags), 0);
-    for (uint64_t i = 0; i < pages; ++i) {
-        uint64_t entry = 0, flags = 0;
-        ASSERT_EQ(::pread(pagemap, &entry, 8, static_cast<off_t>((start / kPage + i) * 8)), 8);
-        ASSERT_EQ(::pread(kpageflags, &flags, 8, static_cast<off_t>((entry & ((uint64_t{1} << 55) - 1)) * 8)), 8);
-        if ((flags & (uint64_t{1} << 24)) != 0)  // the zero page
-            EXPECT_EQ(answers[i] & ~VM_PAGE_QUERY_PAGE_EXTERNAL, VM_PAGE_QUERY_PAGE_PRESENT) << "zero page " << i;
-        else
-            EXPECT_EQ(answers[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
-    }
-    ::close(pagemap);
-    ::close(kpageflags);
-    ::munmap(base, 3 * kHuge);
-}
-
 TEST_F(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
 {
     // Parsed and with its pagemap open while the child lives.
@@ -312,4 +263,53 @@ TEST(HTLinuxAddressSpaceExit, ProcessKilledWhileItsMappingsAreReadIsNeverWhole)
         else
             EXPECT_GT(regions.size(), kMappings) << "result " << result;
     }
+}
+
+TEST(HTLinuxAddressSpaceOfItself, PagesOnlyReadAgreeWithTheKernelsPageFlags)
+{
+    // Anonymous memory only read holds the shared zero page on most kernels
+    // (in a huge-page-aligned stretch, the huge zero page); a kernel may also
+    // give such a read a page of its own. Either way the answer must be what
+    // the page's own flags say: zero pages are present but cost nothing,
+    // other pages are dirty. Asked of the test itself.
+    if (!pageFlagsReadable()) GTEST_SKIP() << "needs /proc/kpageflags (root)";
+    HTLinuxPlatform platform;
+    constexpr uint64_t kHuge = 2u << 20;
+    void* base = ::mmap(nullptr, 3 * kHuge, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+    ASSERT_NE(base, MAP_FAILED);
+    auto* aligned = reinterpret_cast<volatile char*>((reinterpret_cast<uintptr_t>(base) + kHuge - 1) & ~(kHuge - 1));
+    ::madvise(const_cast<char*>(aligned), kHuge, MADV_HUGEPAGE);
+    const uint64_t pages = kHuge / kPage + 8;
+    char sink = 0;
+    for (uint64_t i = 0; i < pages; ++i) sink = static_cast<char>(sink + aligned[i * kPage]);
+    aligned[kHuge + 4 * kPage] = sink;  // one page written among the read ones
+
+    std::shared_ptr<HTTaskPort> task;
+    ASSERT_EQ(platform.task_for_pid(::getpid(), &task), KERN_SUCCESS);
+    kern_return_t result;
+    walk(platform, *task, result);
+    const auto start = reinterpret_cast<uint64_t>(aligned);
+    // Asked alone, and after a scan of the mapping's populated pages, which
+    // learns on its way whether the mapping holds zero pages.
+    std::vector<int32_t> answers = dispositions(platform, *task, start, pages, result);
+    ASSERT_EQ(result, KERN_SUCCESS);
+    std::vector<HTPageRun> runs;
+    platform.populatedRuns(*task, reinterpret_cast<uint64_t>(base), reinterpret_cast<uint64_t>(base) + 3 * kHuge, runs);
+    EXPECT_EQ(dispositions(platform, *task, start, pages, result), answers);
+
+    int pagemap = ::open("/proc/self/pagemap", O_RDONLY | O_CLOEXEC);
+    int kpageflags = ::open("/proc/kpageflags", O_RDONLY | O_CLOEXEC);
+    ASSERT_GE(std::min(pagemap, kpageflags), 0);
+    for (uint64_t i = 0; i < pages; ++i) {
+        uint64_t entry = 0, flags = 0;
+        ASSERT_EQ(::pread(pagemap, &entry, 8, static_cast<off_t>((start / kPage + i) * 8)), 8);
+        ASSERT_EQ(::pread(kpageflags, &flags, 8, static_cast<off_t>((entry & ((uint64_t{1} << 55) - 1)) * 8)), 8);
+        if ((flags & (uint64_t{1} << 24)) != 0)  // the zero page
+            EXPECT_EQ(answers[i] & ~VM_PAGE_QUERY_PAGE_EXTERNAL, VM_PAGE_QUERY_PAGE_PRESENT) << "zero page " << i;
+        else
+            EXPECT_EQ(answers[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
+    }
+    ::close(pagemap);
+    ::close(kpageflags);
+    ::munmap(base, 3 * kHuge);
 }
