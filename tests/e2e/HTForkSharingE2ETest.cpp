@@ -1,14 +1,11 @@
-// The built heft measuring a family of processes that share memory only
-// because they forked: anonymous memory the parent wrote, pages it pushed to
-// swap and a file it mapped privately, all still mapped by the children
-// where they did not write them. Every process's heft holds all the pages it
-// maps; the summary holds each page once, and the tables show each page with
-// exactly the processes that map it. The figures are checked against the
-// kernel's own count of the family's distinct memory.
+// The built heft measuring a family that shares memory only because it
+// forked: anonymous memory the parent wrote, pages it pushed to swap and a
+// file it mapped privately, still mapped by the children where they did not
+// write them. Each process's heft holds all the pages it maps; the summary
+// holds each page once, and the tables show each page with exactly the
+// processes that map it.
 
-#include "e2e/HTE2EReport.h"
-
-#include <rapidjson/document.h>
+#include "e2e/HTE2ESupport.h"
 
 #include <optional>
 
@@ -19,23 +16,42 @@ using namespace heft_e2e;
 constexpr const char* kUnidentifiedNotice =
     "Memory shared after fork may be counted more than once: telling its pages apart needs root\n";
 constexpr uint64_t kFileSize = 8 * kMiB;
-
-// Beyond what the layout program writes, a process writes a few pages of
-// anonymous memory of its own (the C library's and the allocator's), and a
-// child a few more after the fork; a table of the layout may hold this much
-// over it.
+// A process writes a few pages of its own (the C library's, the
+// allocator's) besides what it lays out; a table may hold this much more.
 constexpr uint64_t kSlack = 128 * 1024;
 
-// What a process's own table holds besides its page tables (which no other
-// process can share).
+// What a parent lays out before and after forking its children: `shared`
+// bytes written, of which child i overwrites slice i and then writes `own`
+// bytes of its own; then, optionally, a separate mapping pushed to swap or a
+// file mapped privately (directive 1); last, `after` bytes written.
+struct Family {
+    uint64_t shared = 64 * kMiB, children = 4, slice = kMiB, own = 8 * kMiB, after = 16 * kMiB;
+    std::vector<std::string> extra;
+
+    std::vector<std::string> directives() const
+    {
+        std::vector<std::string> all = {"anon", n(shared)};
+        all.insert(all.end(), extra.begin(), extra.end());
+        all.insert(all.end(), {"fork", n(children), n(slice), n(own), "anon", n(after)});
+        return all;
+    }
+};
+
+std::set<int> membersOf(const HTLayoutChild& family, const Family& layout)
+{
+    const std::vector<uint64_t>& children = family.line(layout.extra.empty() ? 1 : 2);
+    std::set<int> all(children.begin(), children.end());
+    all.insert(family.pid());
+    return all;
+}
+
 uint64_t ownDirtyBesidesPageTables(const rapidjson::Value* process)
 {
-    const rapidjson::Value* categories = process ? member(*process, "categories") : nullptr;
     uint64_t total = 0;
-    if (categories && categories->IsObject()) {
+    const rapidjson::Value* categories = member(process, "categories");
+    if (categories && categories->IsObject())
         for (const auto& entry : categories->GetObject())
-            total += entry.name == "page table" ? 0 : number(entry.value, "dirty");
-    }
+            total += entry.name == "page table" ? 0 : number(&entry.value, "dirty");
     return total;
 }
 
@@ -47,46 +63,36 @@ protected:
         HTE2EReportTest::SetUp();
     }
 
-    // Lays out `layout`, first writing the file it maps (when it maps one),
-    // written back or left dirty in the page cache; then runs heft on the
-    // family.
-    void layOutAndMeasure(const PreforkLayout& layout, bool writtenBack = true)
+    // Writes the file at `path` a MiB at a time (written at once, it may land
+    // in folios big enough for the parent to map by the page-middle
+    // directory, which fork does not copy), written back or left dirty.
+    static void writeFile(const std::string& path, bool writtenBack)
     {
-        if (layout.path != "-") {
-            // Written a MiB at a time: written at once, the file may land in
-            // page cache folios big enough for the parent to map by the
-            // page-middle directory, which fork does not copy, and the
-            // children would not share the pages this test is about.
-            int fd = open(layout.path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
-            ASSERT_GE(fd, 0) << std::strerror(errno);
-            std::string block(kMiB, '\x5a');
-            for (uint64_t written = 0; written < kFileSize; written += kMiB) {
-                ASSERT_EQ(write(fd, block.data(), kMiB), static_cast<ssize_t>(kMiB));
-            }
-            EXPECT_TRUE(!writtenBack || fsync(fd) == 0) << std::strerror(errno);
-            close(fd);
-        }
-        family_.emplace(layout);
+        int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
+        ASSERT_GE(fd, 0) << std::strerror(errno);
+        std::string block(kMiB, '\x5a');
+        for (uint64_t written = 0; written < kFileSize; written += kMiB)
+            ASSERT_EQ(write(fd, block.data(), kMiB), static_cast<ssize_t>(kMiB));
+        EXPECT_TRUE(!writtenBack || fsync(fd) == 0) << std::strerror(errno);
+        close(fd);
+    }
+
+    void layOutAndMeasure(const Family& layout)
+    {
+        family_.emplace(layout.directives());
         ASSERT_TRUE(family_->ready());
-        text_ = runForReport({"-t", std::to_string(family_->parent())}, report_);
+        members_ = membersOf(*family_, layout);
+        ASSERT_EQ(members_.size(), layout.children + 1);
+        text_ = runForReport({"-t", family_->pidString()}, report_);
     }
 
-    // The summary counts each page of the family once, as the kernel's
-    // shares do when summed over the family. 1%: heft and the kernel's
-    // figures are read a moment apart, in which the children's stacks and
-    // the C library's data may change by a page or two; a page counted once
-    // per process would be off by far more. Every process's heft still holds
-    // all the pages it maps.
-    void expectSummaryIsTheFamilysDistinctMemory()
+    const rapidjson::Value* summary(const std::string& category)
     {
-        uint64_t kernel = 0;
-        for (int pid : family_->all()) kernel += kernelHeft(pid, true);
-        EXPECT_NEAR(static_cast<double>(number(report_["summary"]["total"], "dirty")), static_cast<double>(kernel),
-                    static_cast<double>(kernel) / 100);
-        for (int pid : family_->all()) expectHeftMatchesKernel(report_, pid);
+        return member(member(&report_, "summary"), category);
     }
 
-    std::optional<LaidOutFamily> family_;
+    std::optional<HTLayoutChild> family_;
+    std::set<int> members_;
     rapidjson::Document report_;
     Outcome text_;
 };
@@ -94,116 +100,110 @@ protected:
 TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProcessesThatMapIt)
 {
     SwapArea swap;  // without one the paged-out pages stay in memory, dirty
-    const PreforkLayout layout{.pagedOut = 16 * kMiB};
+    const Family layout{.extra = {"pageout", n(16 * kMiB)}};
     ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout));
-    expectSummaryIsTheFamilysDistinctMemory();
-    EXPECT_NE(text_.standardOutput.find(
-                  "\nSummary Heft: " + std::to_string(number(report_["summary"]["total"], "dirty")) + " B\n"),
-              std::string::npos);
 
-    // Untouched by the children, the shared mapping is the five's; the slice
-    // a child wrote is its own copy, and the parent's original is left to
-    // the other four. Dirty figures include the swapped pages.
-    const uint64_t untouched = layout.shared - layout.children * layout.slice;
-    EXPECT_PRED3(between, figure(sharedBy(report_, family_->all()), kUntagged, "dirty"), untouched, untouched + kSlack);
-    for (pid_t child : family_->children()) {
-        SCOPED_TRACE("child " + std::to_string(child));
+    // The summary counts each page once, as the kernel's shares summed over
+    // the family do. 1%: the two are read a moment apart, in which stacks
+    // and the C library's data may change by a page or two; a page counted
+    // once a process would be off by far more.
+    uint64_t kernel = 0;
+    for (int pid : members_) kernel += kernelHeft(pid, true);
+    const uint64_t total = number(summary("total"), "dirty");
+    EXPECT_NEAR(static_cast<double>(total), static_cast<double>(kernel), static_cast<double>(kernel) / 100);
+    for (int pid : members_) expectHeftMatchesKernel(report_, pid);
+    EXPECT_NE(text_.standardOutput.find("\nSummary Heft: " + n(total) + " B\n"), std::string::npos);
+
+    // Untouched by the children, the shared mapping and the swapped one are
+    // the five's; the slice a child wrote is its own copy, and the parent's
+    // original is left to the other four. Dirty figures include swap.
+    const uint64_t untouched = layout.shared - layout.children * layout.slice + 16 * kMiB;
+    EXPECT_PRED3(between, figure(sharedBy(report_, members_), kUntagged, "dirty"), untouched, untouched + kSlack);
+    for (int child : members_) {
+        if (child == family_->pid()) continue;
+        SCOPED_TRACE("child " + n(child));
         EXPECT_GE(figure(processIn(report_, child), kUntagged, "dirty"), layout.own + layout.slice);
         EXPECT_LE(ownDirtyBesidesPageTables(processIn(report_, child)), layout.own + layout.slice + kSlack);
-        std::set<int> others = family_->all();
+        std::set<int> others = members_;
         others.erase(child);
-        uint64_t slice = figure(sharedBy(report_, others), kUntagged, "dirty");
-        EXPECT_PRED3(between, slice, layout.slice, layout.slice + kSlack);
+        EXPECT_PRED3(between, figure(sharedBy(report_, others), kUntagged, "dirty"), layout.slice,
+                     layout.slice + kSlack);
     }
-    EXPECT_GE(figure(processIn(report_, family_->parent()), kUntagged, "dirty"), layout.after);
-    EXPECT_LE(ownDirtyBesidesPageTables(processIn(report_, family_->parent())), layout.after + kSlack);
+    EXPECT_GE(figure(processIn(report_, family_->pid()), kUntagged, "dirty"), layout.after);
+    EXPECT_LE(ownDirtyBesidesPageTables(processIn(report_, family_->pid())), layout.after + kSlack);
 
-    // Every process maps the same swap slots; nothing else of the family is
-    // out (there is no memory pressure that would push it). The slots stay
-    // as they are while the family sits still.
-    uint64_t swappedOnce = kernelField(mappingAt(family_->parent(), family_->sharedAddress()), "Swap");
-    EXPECT_EQ(number(report_["summary"]["total"], "swapped"), swappedOnce);
-    EXPECT_EQ(figure(sharedBy(report_, family_->all()), kUntagged, "swapped"), swappedOnce);
-    if (!swap.available() || family_->pageoutError() != 0) {
-        GTEST_SKIP() << "no swap (" << swap.reason() << ") or MADV_PAGEOUT: " << std::strerror(family_->pageoutError());
-    }
-    EXPECT_GT(swappedOnce, layout.pagedOut / 2) << "the kernel left most pages in memory";
+    // Every process maps the same swap slots, which stay as they are while
+    // the family sits still; nothing else of it is out.
+    uint64_t swapped = kernelField(mappingAt(family_->pid(), family_->value(1)), "Swap");
+    EXPECT_EQ(number(summary("total"), "swapped"), swapped);
+    EXPECT_EQ(figure(sharedBy(report_, members_), kUntagged, "swapped"), swapped);
+    if (!swap.available() || family_->value(1, 1) != 0)
+        GTEST_SKIP() << "no swap (" << swap.reason() << ") or MADV_PAGEOUT failed";
+    EXPECT_GT(swapped, 8 * kMiB) << "the kernel left most pages in memory";
 }
 
-TEST_F(HTForkSharingE2ETest, PrivateFileMappingCountsItsCopiesAndItsFilePagesOnce)
+TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePagesOnce)
 {
-    for (bool writtenBack : {true, false}) {
-        const char* name = writtenBack ? "written-back.bin" : "still-dirty.bin";
-        SCOPED_TRACE(name);
-        const PreforkLayout layout{.shared = 4 * kMiB,
-                                   .slice = 64 * 1024,
-                                   .own = kMiB,
-                                   .after = kMiB,
-                                   .file = "written",
-                                   .path = directory_.file(name)};
-        ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout, writtenBack));
-
-        // The parent wrote the first half (its copies, which the children
-        // inherit) and read the second (the file's pages, whether still
-        // dirty in the page cache or written back). Each counts once.
-        const std::string category = "mapped file " + layout.path;
-        const rapidjson::Value* summary = member(report_["summary"], category);
-        ASSERT_NE(summary, nullptr);
-        EXPECT_EQ(number(*summary, "dirty") + number(*summary, "clean"), kFileSize)
-            << "the parent's own table holds " << figure(processIn(report_, family_->parent()), category, "dirty");
-        EXPECT_GE(number(*summary, "dirty"), kFileSize / 2);
-        EXPECT_TRUE(!writtenBack || number(*summary, "dirty") == kFileSize / 2) << number(*summary, "dirty");
-        EXPECT_GE(figure(sharedBy(report_, family_->all()), category, "dirty"), kFileSize / 2);
-
-        // Writeback may clean the file's pages after heft read them, never
-        // the other way round.
-        for (int pid : family_->all()) expectHeftMatchesKernel(report_, pid, writtenBack ? 0 : kFileSize / 2);
+    // Written: the parent wrote the first half (its copies, which the
+    // children inherit) and read the second (the file's pages, still dirty
+    // in the page cache or written back). Read: a read-only mapping has no
+    // copies, so fork leaves the child's page tables for it empty, and only
+    // the parent has the file's pages, in two runs with a gap between them.
+    for (const char* how : {"written", "read"}) {
+        for (bool writtenBack : {true, false}) {
+            if (how == std::string("read") && !writtenBack) continue;
+            const std::string path = directory_.file(writtenBack ? "written-back.bin" : "dirty.bin");
+            SCOPED_TRACE(std::string(how) + " " + path);
+            ASSERT_NO_FATAL_FAILURE(writeFile(path, writtenBack));
+            const Family layout{.shared = 4 * kMiB,
+                                .children = how == std::string("read") ? 1u : 4u,
+                                .slice = 64 * 1024,
+                                .own = kMiB,
+                                .after = kMiB,
+                                .extra = {"private", path, how}};
+            ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout));
+            const std::string category = "mapped file " + path;
+            const uint64_t dirty = number(summary(category), "dirty"), clean = number(summary(category), "clean");
+            if (how == std::string("written")) {
+                EXPECT_EQ(dirty + clean, kFileSize);
+                EXPECT_GE(dirty, kFileSize / 2);
+                EXPECT_TRUE(!writtenBack || dirty == kFileSize / 2) << dirty;
+                EXPECT_GE(figure(sharedBy(report_, members_), category, "dirty"), kFileSize / 2);
+                // Writeback may clean pages after heft read them, never the
+                // other way round.
+                for (int pid : members_) expectHeftMatchesKernel(report_, pid, writtenBack ? 0 : kFileSize / 2);
+                continue;
+            }
+            const pid_t child = *members_.begin() == family_->pid() ? *members_.rbegin() : *members_.begin();
+            uint64_t resident = kernelField(mappingAt(family_->pid(), family_->value(1)), "Rss");
+            EXPECT_GE(resident, kFileSize / 2);
+            EXPECT_EQ(kernelField(mappingAt(child, family_->value(1)), "Rss"), 0u);
+            // The parent sees the pages in its own table and the ones it shares.
+            uint64_t parentClean = figure(processIn(report_, family_->pid()), category, "clean");
+            for (const auto& shared : arrayIn(report_, "shared")) {
+                bool mine = shared.HasMember("specific_to_pid") ? shared["specific_to_pid"].GetInt() == family_->pid()
+                                                                : pidsOf(shared).count(family_->pid()) != 0;
+                if (mine) parentClean += figure(&shared, category, "clean");
+            }
+            EXPECT_GE(parentClean, resident);
+            EXPECT_PRED3(between, clean, parentClean, kFileSize);
+        }
     }
-}
-
-TEST_F(HTForkSharingE2ETest, SummaryHoldsTheFilePagesOnlyTheParentHasResident)
-{
-    // A read-only private mapping has no copies, so fork leaves the child's
-    // page tables for it empty: only the parent has the file's pages mapped,
-    // in two runs with a gap between them.
-    const PreforkLayout layout{.shared = kMiB,
-                               .children = 1,
-                               .slice = 64 * 1024,
-                               .own = kMiB,
-                               .after = kMiB,
-                               .file = "read",
-                               .path = directory_.file("read.bin")};
-    ASSERT_NO_FATAL_FAILURE(layOutAndMeasure(layout));
-    const std::string category = "mapped file " + layout.path;
-
-    uint64_t residentInParent = kernelField(mappingAt(family_->parent(), family_->fileAddress()), "Rss");
-    EXPECT_GE(residentInParent, kFileSize / 2);
-    EXPECT_EQ(kernelField(mappingAt(family_->children()[0], family_->fileAddress()), "Rss"), 0u);
-    // The parent sees the pages in its own table and in the ones it shares.
-    uint64_t parentClean = figure(processIn(report_, family_->parent()), category, "clean");
-    for (const auto& shared : arrayIn(report_, "shared")) {
-        bool mine = shared.HasMember("specific_to_pid") ? shared["specific_to_pid"].GetInt() == family_->parent()
-                                                        : pidsOf(shared).count(family_->parent()) != 0;
-        if (mine) parentClean += figure(&shared, category, "clean");
-    }
-    EXPECT_GE(parentClean, residentInParent);
-    const rapidjson::Value* summary = member(report_["summary"], category);
-    ASSERT_NE(summary, nullptr);
-    EXPECT_PRED3(between, number(*summary, "clean"), parentClean, kFileSize);
 }
 
 TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceThatForkedMemoryMayCountTwice)
 {
     if (access(kSetpriv, X_OK) != 0) GTEST_SKIP() << kSetpriv << " is needed to change the user";
     ASSERT_EQ(chmod(directory_.path.c_str(), 0777), 0);
-    const PreforkLayout layout{.shared = 4 * kMiB, .children = 3, .slice = 64 * 1024, .own = kMiB, .after = kMiB};
-    LaidOutFamily family(layout, kNobody);
+    const Family layout{.shared = 4 * kMiB, .children = 3, .slice = 64 * 1024, .own = kMiB, .after = kMiB, .extra = {}};
+    HTLayoutChild family(layout.directives(), kNobody);
     ASSERT_TRUE(family.ready());
     const std::string path = directory_.file("nobody.json");
     std::vector<std::string> arguments = {"-v", "-j", path, "1"};
-    for (int pid : family.all()) arguments.push_back(std::to_string(pid));
+    for (int pid : membersOf(family, layout)) arguments.push_back(n(pid));
 
-    // Init is not nobody's to read: it is left out, and the rest measured.
+    // Init is not nobody's to read: it is left out, and the rest measured;
+    // the notice comes once, however many processes share forked memory.
     Outcome outcome = runHeftAsNobody(arguments);
     EXPECT_EQ(outcome.status, 0) << outcome.standardError;
     EXPECT_NE(outcome.standardError.find("Unable to analyze process with pid 1 (try as root?)\n"), std::string::npos)
@@ -216,14 +216,11 @@ TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceTh
     EXPECT_EQ(processIn(report, 1), nullptr);
     // Without root the page flags are hidden, but the region figures come
     // from the processes' own smaps, which their owner may read in full.
-    for (int pid : family.all()) expectHeftMatchesKernel(report, pid);
-    const rapidjson::Value* process = processIn(report, family.parent());
-    ASSERT_NE(process, nullptr);
-    const rapidjson::Value& region = regionAt(*process, family.sharedAddress());
-    EXPECT_EQ(number(region, "dirty"), layout.shared);
+    for (int pid : membersOf(family, layout)) expectHeftMatchesKernel(report, pid);
+    EXPECT_EQ(number(regionAt(processIn(report, family.pid()), family.value(0)), "dirty"), layout.shared);
 
     // Root tells the pages apart, and has nothing to say.
-    outcome = runHeft({"-t", std::to_string(family.parent())});
+    outcome = runHeft({"-t", family.pidString()});
     EXPECT_EQ(outcome.status, 0);
     EXPECT_EQ(outcome.standardError.find(kUnidentifiedNotice), std::string::npos) << outcome.standardError;
 }

@@ -1,13 +1,12 @@
 #include "platform/linux/HTElfImageReader.h"
-#include "platform/HTTestChildren.h"
 #include "platform/linux/HTLinuxPlatform.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTSmapsParser.h"
+#include "support/HTLayoutChild.h"
 
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <chrono>
 #include <climits>
 #include <cstdlib>
 #include <cstring>
@@ -18,7 +17,6 @@
 #include <gnu/libc-version.h>
 #include <string>
 #include <sys/mman.h>
-#include <thread>
 #include <unistd.h>
 #include <vector>
 
@@ -116,42 +114,22 @@ std::string temporaryFile(const std::string& bytes, int& fd)
     return pattern;
 }
 
-std::shared_ptr<HTTaskPort> openTask(HTLinuxPlatform& platform, pid_t pid)
-{
-    std::shared_ptr<HTTaskPort> task;
-    return platform.task_for_pid(pid, &task) == KERN_SUCCESS ? task : nullptr;
-}
-
-std::vector<HTPlatformImage> listImages(HTLinuxPlatform& platform, HTTaskPort& task)
+// The images of process `pid`, through `task` (opened here when empty).
+std::vector<HTPlatformImage> listImages(HTLinuxPlatform& platform, pid_t pid, std::shared_ptr<HTTaskPort>& task)
 {
     std::vector<HTPlatformImage> images;
-    EXPECT_TRUE(platform.forEachTaskImage(task, 0, [&](const HTPlatformImage& image) { images.push_back(image); }));
+    EXPECT_TRUE(task || platform.task_for_pid(pid, &task) == KERN_SUCCESS);
+    EXPECT_TRUE(task &&
+                platform.forEachTaskImage(*task, 0, [&](const HTPlatformImage& image) { images.push_back(image); }));
     return images;
-}
-
-std::string resolved(const std::string& path)
-{
-    std::error_code error;
-    std::string real = std::filesystem::canonical(path, error);
-    return error ? path : real;
 }
 
 const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images, const std::string& path)
 {
-    for (const auto& image : images) {
-        if (resolved(image.path) == resolved(path)) return &image;
-    }
+    std::error_code error;
+    for (const auto& image : images)
+        if (std::filesystem::equivalent(image.path, path, error)) return &image;
     return nullptr;
-}
-
-// The state letter of the process (R, S, D, ...); 0 when unreadable.
-char processState(pid_t pid)
-{
-    HTProcBuffer stat;
-    if (!stat.readFile(AT_FDCWD, ("/proc/" + std::to_string(pid) + "/stat").c_str())) return 0;
-    std::string_view text = stat.view();
-    size_t close = text.rfind(')');
-    return close != std::string_view::npos && close + 2 < text.size() ? text[close + 2] : 0;
 }
 
 // The name of the image segment holding the address; empty when none.
@@ -269,10 +247,8 @@ TEST(HTElfImageReader, BiasFromAnyFileMapping)
 TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
 {
     HTLinuxPlatform platform;
-    auto task = openTask(platform, ::getpid());
-    ASSERT_NE(task, nullptr);
-    auto images = listImages(platform, *task);
-
+    std::shared_ptr<HTTaskPort> task;
+    auto images = listImages(platform, ::getpid(), task);
     const HTPlatformImage* self = imageWithPath(images, "/proc/self/exe");
     ASSERT_NE(self, nullptr);
     EXPECT_EQ(segmentAt(*self, reinterpret_cast<uintptr_t>(&listImages)), "__TEXT");
@@ -295,21 +271,16 @@ TEST(HTElfImageReader, ListsThisProcessesExecutableAndLibc)
 
 TEST(HTElfImageReader, ListsAChildProcess)
 {
-    HTTestChild child = HTTestChild::exec("/bin/sleep", {"sleep", "30"});
-    ASSERT_TRUE(child.valid());
+    // Ready, the child has loaded everything and protected its relocated
+    // data: its mappings stay as they are.
+    HTLayoutChild child({});
+    ASSERT_TRUE(child.ready());
     HTLinuxPlatform platform;
-    auto task = openTask(platform, child.pid());
-    ASSERT_NE(task, nullptr);
-    // exec has returned; the dynamic loader may still be mapping libraries
-    // and protecting their relocated data. Once the child sleeps, its
-    // mappings stay as they are.
-    auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(5);
-    while (processState(child.pid()) != 'S' && std::chrono::steady_clock::now() < deadline)
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    std::vector<HTPlatformImage> images = listImages(platform, *task);
-    const HTPlatformImage* sleep = imageWithPath(images, "/bin/sleep");
-    ASSERT_NE(sleep, nullptr);
-    EXPECT_EQ(segmentAt(*sleep, sleep->baseAddress), "__LINKEDIT");
+    std::shared_ptr<HTTaskPort> task;
+    std::vector<HTPlatformImage> images = listImages(platform, child.pid(), task);
+    const HTPlatformImage* program = imageWithPath(images, HEFT_LAYOUT_PROGRAM);
+    ASSERT_NE(program, nullptr);
+    EXPECT_EQ(segmentAt(*program, program->baseAddress), "__LINKEDIT");
     expectMappingsMatchSegments(child.pid(), images);
 
     child.reap();
@@ -337,9 +308,8 @@ TEST(HTElfImageReader, MappedFilesGiveImagesOnlyWhenTheyAreElf)
     ASSERT_NE(dataMap, MAP_FAILED);
 
     HTLinuxPlatform platform;
-    auto task = openTask(platform, ::getpid());
-    ASSERT_NE(task, nullptr);
-    auto images = listImages(platform, *task);
+    std::shared_ptr<HTTaskPort> task;
+    auto images = listImages(platform, ::getpid(), task);
     const HTPlatformImage* object = imageWithPath(images, elfPath);
     EXPECT_EQ(imageWithPath(images, textPath), nullptr);
     ::unlink(textPath.c_str());
