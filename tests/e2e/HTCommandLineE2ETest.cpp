@@ -110,6 +110,8 @@ TEST(HTCommandLineE2ETest, UnprivilegedRunsNeedingRootStop)
 {
     if (geteuid() != 0) GTEST_SKIP() << "running heft as another user needs root";
     if (access(kSetpriv, X_OK) != 0) GTEST_SKIP() << kSetpriv << " is needed to change the user";
+    if (!everyoneMayRun(kHeftBinary) || !everyoneMayRun(HEFT_LAYOUT_PROGRAM))
+        GTEST_SKIP() << "the user nobody may not run the programs of this build tree";
     // A process it may not read is reported by pid; when heft tried to open
     // it, the reason follows, naming the process.
     const std::string unanalyzed = "Unable to analyze process with pid 1 (try as root?)\n";

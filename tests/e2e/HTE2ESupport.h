@@ -9,6 +9,7 @@
 
 #include <sys/mman.h>
 #include <sys/resource.h>
+#include <sys/stat.h>
 #include <sys/swap.h>
 
 #include <gtest/gtest.h>
@@ -81,6 +82,17 @@ inline Outcome runHeft(std::vector<std::string> arguments)
 {
     arguments.insert(arguments.begin(), "heft");
     return runProgram(kHeftBinary, std::move(arguments));
+}
+
+// Whether another user may run the program at `path`: every directory on
+// the way must be searchable by all and the file executable by all. A build
+// tree under a private temporary directory is not.
+inline bool everyoneMayRun(const std::string& path)
+{
+    struct stat info {};
+    for (size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1))
+        if (stat(path.substr(0, slash).c_str(), &info) != 0 || (info.st_mode & S_IXOTH) == 0) return false;
+    return stat(path.c_str(), &info) == 0 && (info.st_mode & S_IXOTH) != 0;
 }
 
 // heft run by the unprivileged user nobody.

@@ -194,6 +194,8 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePage
 TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceThatForkedMemoryMayCountTwice)
 {
     if (access(kSetpriv, X_OK) != 0) GTEST_SKIP() << kSetpriv << " is needed to change the user";
+    if (!everyoneMayRun(kHeftBinary) || !everyoneMayRun(HEFT_LAYOUT_PROGRAM))
+        GTEST_SKIP() << "the user nobody may not run the programs of this build tree";
     ASSERT_EQ(chmod(directory_.path.c_str(), 0777), 0);
     const Family layout{.shared = 4 * kMiB, .children = 3, .slice = 64 * 1024, .own = kMiB, .after = kMiB, .extra = {}};
     HTLayoutChild family(layout.directives(), kNobody);
