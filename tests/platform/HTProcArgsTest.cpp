@@ -1,4 +1,5 @@
 #include "platform/linux/HTProcArgs.h"
+#include "platform/linux/HTDeletedMark.h"
 #include "platform/linux/HTProcBuffer.h"
 
 #include <gtest/gtest.h>
@@ -66,9 +67,9 @@ TEST(HTProcArgs, ShortBufferKeepsTheBeginningAndNeverOverruns)
 
 TEST(HTProcArgs, DeletedExecutableKeepsItsPath)
 {
-    EXPECT_EQ(htExecutablePathFromLink("/usr/lib/app/worker (deleted)"), "/usr/lib/app/worker");
-    EXPECT_EQ(htExecutablePathFromLink("/usr/bin/worker"), "/usr/bin/worker");
-    EXPECT_EQ(htExecutablePathFromLink("/tmp/a (deleted) (deleted)"), "/tmp/a (deleted)");
+    EXPECT_EQ(htPathWithoutDeletedMark("/usr/lib/app/worker (deleted)"), "/usr/lib/app/worker");
+    EXPECT_EQ(htPathWithoutDeletedMark("/usr/bin/worker"), "/usr/bin/worker");
+    EXPECT_EQ(htPathWithoutDeletedMark("/tmp/a (deleted) (deleted)"), "/tmp/a (deleted)");
 }
 
 TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)

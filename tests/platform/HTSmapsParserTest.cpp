@@ -1,4 +1,5 @@
 #include "platform/linux/HTSmapsParser.h"
+#include "platform/linux/HTDeletedMark.h"
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTProcBuffer.h"
 
@@ -67,7 +68,7 @@ TEST(HTSmapsParser, MapsLinesOfEveryKind)
     // anonymous memory's maps line ends in a blank, which is no path.
     const HTSmapsEntry& privateFile = at(entries, 0x7f8955dc8000);
     EXPECT_EQ(privateFile.path, "/tmp/walkx/file with blank (deleted)");
-    EXPECT_EQ(htSmapsPathWithoutDeleted(privateFile.path), "/tmp/walkx/file with blank");
+    EXPECT_EQ(htPathWithoutDeletedMark(privateFile.path), "/tmp/walkx/file with blank");
     EXPECT_EQ(at(entries, 0x7f8955800000).path, "");
     // System V shows its segment id as the inode: 0 for the first segment.
     EXPECT_EQ(at(entries, 0x7f8955dcc000).devMinor, 1u);

@@ -1,31 +1,28 @@
 #pragma once
 
-// The platform calls answered from Linux's /proc. Every call may run on
-// any thread: reads go through per-thread buffers and the only shared
-// state is the /proc and /proc/kpageflags descriptors and the breakdown
-// setting. A task handle is used by one thread at a time.
+// The platform calls answered from Linux's /proc. The work lives in rooms of
+// its own, which this class owns and forwards to: the process table, the
+// status figures, the address space and its page queries, and the path
+// cache. Every call may run on any thread: reads go through per-thread
+// buffers and the only shared state is the /proc and /proc/kpageflags
+// descriptors and the caches. A task handle is used by one thread at a
+// time.
 
 #include "platform/HTPlatform.h"
-#include "platform/linux/HTElfImageReader.h"
+#include "platform/linux/HTLinuxMappings.h"
+#include "platform/linux/HTLinuxPageQueries.h"
+#include "platform/linux/HTLinuxPathCache.h"
+#include "platform/linux/HTLinuxProcessTable.h"
+#include "platform/linux/HTLinuxStatusReader.h"
 
 #include <atomic>
 #include <cstdint>
-#include <mutex>
 #include <optional>
 #include <string>
-#include <string_view>
-#include <unordered_map>
-
-class HTLinuxTaskPort;
-class HTProcBuffer;
-struct HTProcStatus;
-
-struct HTSmapsEntry;
 
 class HTLinuxPlatform : public HTPlatform {
 public:
-    HTLinuxPlatform();
-    ~HTLinuxPlatform() override;
+    HTLinuxPlatform() = default;
     HTLinuxPlatform(const HTLinuxPlatform&) = delete;
     HTLinuxPlatform& operator=(const HTLinuxPlatform&) = delete;
 
@@ -93,55 +90,10 @@ public:
     bool stat(const char* path) override;
 
 private:
-    // The task's first mapping that ends above the address, read anew when
-    // the address is 0 (a walk begins); KERN_INVALID_ADDRESS when none.
-    kern_return_t vmaAtOrAbove(HTTaskPort& task, uint64_t address, const HTSmapsEntry** vma);
-    // Opens /proc/PID followed by `suffix` ("" for the directory itself,
-    // with O_DIRECTORY in `flags`); -1 with errno, ESRCH when it is gone.
-    int openProcessFile(int32_t pid, std::string_view suffix, int flags = 0) const;
-    // Reads one of the small files of /proc/PID whole (stat, status,
-    // cmdline); false with errno, ESRCH when the process is gone.
-    bool readProcessFile(int32_t pid, std::string_view suffix, HTProcBuffer& buffer) const;
-    // Reads the small file `name` of a live thread of the process, for one
-    // whose main thread has exited; false with errno, ESRCH when no thread
-    // lives.
-    bool readLiveThreadFile(int32_t pid, const char* name, HTProcBuffer& buffer) const;
-    // The record of a process (or of the kernel for pid 0); false with
-    // errno, ESRCH for a process that is gone or a kernel thread.
-    bool readBsdInfo(int32_t pid, proc_bsdinfo& info);
-    void fillKernelInfo(proc_bsdinfo& info);
-    int readProcArgs(int32_t pid, void* oldp, size_t* oldlenp);
-    // Parses the task's smaps when `refresh` is set or nothing was parsed
-    // yet. KERN_SUCCESS, MACH_SEND_INVALID_DEST for a process that is gone
-    // or a zombie, else HT_KERN_ERRNO_BASE | errno.
-    kern_return_t loadVmas(HTLinuxTaskPort& task, bool refresh);
-    // Reads the memory figures of /proc/PID/status, or of a live thread's
-    // when the main thread has exited; false with errno, ESRCH for a zombie.
-    bool readStatus(int32_t pid, HTProcStatus& status);
-    // The identities of the pages [from, to) of the task's mapping at
-    // `index` into `identities`.
-    kern_return_t identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to, uint64_t* identities);
-    // Whether the frame is a zero page, from its kpageflags.
-    bool isZeroFrame(uint64_t frame);
-    // /proc/kpageflags when heft may read it (as root), else -1; opened once.
-    int kpageflagsFd();
-    // Seconds since the epoch at boot, read once.
-    uint64_t bootTime();
-
-    int procFd_ = -1;
-    int procErrno_ = 0;
-    long clockTicks_ = 100;
-    std::once_flag bootTimeOnce_;
-    uint64_t bootTime_ = 0;
     std::atomic<int32_t> selfRegionHeft_{0};
-    std::once_flag identifyOnce_;
-    bool canIdentify_ = false;
-    std::once_flag kpageflagsOnce_;
-    int kpageflagsFd_ = -1;
-    // Parsed program headers are cached per file for the whole run.
-    HTElfImageReader imageReader_;
-    // Resolved paths, for the whole run: every process maps the same
-    // libraries, and resolving one path reads every link on the way.
-    std::mutex realpathLock_;
-    std::unordered_map<std::string, std::optional<std::string>> realpaths_;
+    HTLinuxProcessTable processes_;
+    HTLinuxStatusReader status_{processes_};
+    HTLinuxMappings mappings_;
+    HTLinuxPageQueries pages_;
+    HTLinuxPathCache paths_;
 };

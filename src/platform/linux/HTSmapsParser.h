@@ -92,6 +92,3 @@ size_t htParseSmaps(std::string_view text, std::vector<HTSmapsEntry>& entries);
 // The kind of a mapping from its path, sharing and VmFlags (exposed for
 // tests).
 HTSmapsKind htSmapsKind(std::string_view path, bool shared, uint32_t vmFlags);
-
-// The path with a trailing " (deleted)" removed.
-std::string_view htSmapsPathWithoutDeleted(std::string_view path);
