@@ -3,15 +3,10 @@
 #include "platform/HTMachErrorText.h"
 
 #include <cerrno>
-#include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <sys/stat.h>
 #include <unistd.h>
-
-namespace {
-constexpr const char* kSelfRegionHeftName = "vm.self_region_heft";
-}
 
 int HTLinuxPlatform::proc_listallpids(int32_t* buffer, int bufferSize)
 {
@@ -75,35 +70,10 @@ int HTLinuxPlatform::sysctl(const int* name, unsigned nameLength, void* oldp, si
     return HTLinuxProcessTable::readArgMax(oldp, oldlenp);
 }
 
-int HTLinuxPlatform::sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
+int HTLinuxPlatform::sysctlbyname(const char*, void*, size_t*, const void*, size_t)
 {
-    // The breakdown setting has no kernel counterpart on Linux: heft keeps
-    // it here. Every other name, the owned-object query included, is absent.
-    if (name == nullptr || std::strcmp(name, kSelfRegionHeftName) != 0) {
-        errno = ENOENT;
-        return -1;
-    }
-    if (newp != nullptr && newlen != sizeof(int32_t)) {
-        errno = EINVAL;
-        return -1;
-    }
-    if (oldlenp != nullptr) {
-        if (oldp != nullptr) {
-            if (*oldlenp < sizeof(int32_t)) {
-                errno = ENOMEM;
-                return -1;
-            }
-            int32_t value = selfRegionHeft_.load();
-            std::memcpy(oldp, &value, sizeof(value));
-        }
-        *oldlenp = sizeof(int32_t);
-    }
-    if (newp != nullptr) {
-        int32_t value;
-        std::memcpy(&value, newp, sizeof(value));
-        selfRegionHeft_.store(value);
-    }
-    return 0;
+    errno = ENOENT;
+    return -1;
 }
 
 uint64_t HTLinuxPlatform::vm_kernel_page_size() { return htKernelPageSize(); }

@@ -15,7 +15,6 @@
 #include "platform/linux/HTLinuxProcessTable.h"
 #include "platform/linux/HTLinuxStatusReader.h"
 
-#include <atomic>
 #include <cstdint>
 #include <optional>
 #include <string>
@@ -35,6 +34,7 @@ public:
     int proc_get_dirty(int32_t pid, uint32_t* flags) override;
     int sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
                size_t newlen) override;
+    // No setting by name exists on Linux: always ENOENT.
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
     uint64_t vm_kernel_page_size() override;
     // An HTLinuxTaskPort, once the process's memory maps can be opened (the
@@ -90,7 +90,6 @@ public:
     bool stat(const char* path) override;
 
 private:
-    std::atomic<int32_t> selfRegionHeft_{0};
     HTLinuxProcessTable processes_;
     HTLinuxStatusReader status_{processes_};
     HTLinuxMappings mappings_;
