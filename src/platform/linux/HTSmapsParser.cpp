@@ -118,7 +118,6 @@ uint64_t* sizeField(HTSmapsEntry& entry, std::string_view name)
         if (name == "Shared_Hugetlb") return &entry.sharedHugetlb;
         break;
     case 'P':
-        if (name == "Private_Clean") return &entry.privateClean;
         if (name == "Private_Dirty") return &entry.privateDirty;
         if (name == "Private_Hugetlb") return &entry.privateHugetlb;
         break;

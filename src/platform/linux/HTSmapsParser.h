@@ -58,7 +58,6 @@ struct HTSmapsEntry {
     uint64_t rss = 0;
     uint64_t sharedClean = 0;
     uint64_t sharedDirty = 0;
-    uint64_t privateClean = 0;
     uint64_t privateDirty = 0;
     uint64_t anonymous = 0;
     uint64_t lazyFree = 0;
