@@ -3,15 +3,14 @@
 
 #include <gtest/gtest.h>
 
+#include <tuple>
 #include <vector>
 
 namespace {
 
-constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
-constexpr int32_t kDirty = VM_PAGE_QUERY_PAGE_DIRTY;
-constexpr int32_t kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-constexpr int32_t kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL;
-constexpr int32_t kReusable = VM_PAGE_QUERY_PAGE_REUSABLE;
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT, kDirty = VM_PAGE_QUERY_PAGE_DIRTY,
+                  kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT, kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL,
+                  kReusable = VM_PAGE_QUERY_PAGE_REUSABLE, kCopied = VM_PAGE_QUERY_PAGE_COPIED;
 
 constexpr uint64_t kFrame = 0x1234;
 constexpr uint64_t kPresentEntry = HT_PAGEMAP_PRESENT | kFrame;
@@ -36,7 +35,6 @@ int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPriva
 
 TEST(HTPageDisposition, FromPagemapAndPageFlags)
 {
-    constexpr int32_t kCopied = VM_PAGE_QUERY_PAGE_COPIED;
     struct Row {
         uint64_t entry, flags;
         HTPageMapping mapping;
@@ -115,13 +113,11 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     }
     // File pages, anonymous pages (MADV_FREE, the zero page) and copies in
     // a private mapping of shared memory need them.
-    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPrivate));
-    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kPrivate));
-    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kSharedMemory));
-    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kSharedMemory));
-    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kCleanFile));
-    EXPECT_FALSE(htPageFlagsMatter(kPresentEntry, kPlainAnonymous));
-    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPlainAnonymous));
+    const std::tuple<uint64_t, HTPageMapping, bool> rows[] = {
+        {kFileEntry, kPrivate, true},       {kPresentEntry, kPrivate, true}, {kPresentEntry, kSharedMemory, true},
+        {kFileEntry, kSharedMemory, false}, {kFileEntry, kCleanFile, false}, {kPresentEntry, kPlainAnonymous, false},
+        {kFileEntry, kPlainAnonymous, true}};
+    for (auto [entry, mapping, matters] : rows) EXPECT_EQ(htPageFlagsMatter(entry, mapping), matters) << entry;
 }
 
 TEST(HTPageDisposition, SharedPageIdentities)
