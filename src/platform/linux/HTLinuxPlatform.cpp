@@ -93,7 +93,6 @@ void HTLinuxPlatform::mach_error(const char* label, kern_return_t code)
 kern_return_t HTLinuxPlatform::mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size,
                                                       uint32_t* depth, vm_region_submap_info_64* info, uint32_t* count)
 {
-    // Linux has no submaps: the depth stays as it was.
     return mappings_.regionRecurse(task, address, size, info, count);
 }
 

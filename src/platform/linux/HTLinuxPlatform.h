@@ -25,65 +25,47 @@ public:
     HTLinuxPlatform(const HTLinuxPlatform&) = delete;
     HTLinuxPlatform& operator=(const HTLinuxPlatform&) = delete;
 
-    // Pid 0 first (the kernel), then the processes with an address space of
-    // their own; kernel threads are left out. With a null buffer: an upper
-    // bound of that number.
+    // The process table (HTLinuxProcessTable.h).
     int proc_listallpids(int32_t* buffer, int bufferSize) override;
     int proc_pidinfo(int32_t pid, int flavor, uint64_t arg, void* buffer, int bufferSize) override;
     // Linux has no idle-exit control: always ENOTSUP.
     int proc_get_dirty(int32_t pid, uint32_t* flags) override;
+    // KERN_ARGMAX and KERN_PROCARGS2, from the process table.
     int sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
                size_t newlen) override;
     // No setting by name exists on Linux: always ENOENT.
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
+
+    // The address space (HTLinuxMappings.h, HTLinuxPageQueries.h).
     uint64_t vm_kernel_page_size() override;
-    // An HTLinuxTaskPort, once the process's memory maps can be opened (the
-    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno. The
-    // handle holds no descriptor until it is used.
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
-    std::string mach_error_string(kern_return_t code) override;
-    void mach_error(const char* label, kern_return_t code) override;
-    // The address-space calls read /proc/PID/smaps once per walk (when the
-    // walk starts at address 0, or the handle has no mappings yet) and
-    // answer from the parsed mappings. A process that is gone or a zombie
-    // answers MACH_SEND_INVALID_DEST; no mapping at or above the address
-    // KERN_INVALID_ADDRESS; other failures HT_KERN_ERRNO_BASE | errno.
+    // Linux has no submaps: the depth stays as it was.
     kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
                                          vm_region_submap_info_64* info, uint32_t* count) override;
     kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
                                  uint32_t* count) override;
     // Linux has no purgeable memory: always KERN_INVALID_ARGUMENT.
     kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
-    // From /proc/PID/pagemap, and /proc/kpageflags when it is readable.
-    // KERN_INVALID_ARGUMENT when the process is gone or a zombie.
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
-    // True when heft may read physical frame numbers from pagemap (as root).
     bool canIdentifySharedPages() override;
-    // From /proc/PID/pagemap: frames of resident anonymous pages that are not
-    // mapped exclusively, and swap slots where smaps shows shared swap
-    // (SwapPss below Swap). Only private mappings whose smaps shows pages
-    // shared with other processes are read; zero pages are left out.
     kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
                                        uint64_t* identities) override;
-    // The path of the mapping that holds the address, as smaps shows it: a
-    // file that was deleted or replaced keeps its " (deleted)" mark.
     int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
-
-    // From /proc/PID/status: anonymous resident + swapped + page tables, and
-    // the peak resident set.
-    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
-    // One ledger, "page_table": the bytes of the process's page tables.
-    int ledger_template(ledger_template_info* entries, int* count) override;
-    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
-    std::optional<std::string> realpath(const std::string& path) override;
-    // From the kernel's pagemap scan; the whole range where the kernel
-    // lacks it.
     void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs) override;
-    // The ELF objects mapped by the task, with their segments.
     bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
                           const std::function<void(const HTPlatformImage&)>& callback) override;
 
+    // The status figures (HTLinuxStatusReader.h).
+    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
+    int ledger_template(ledger_template_info* entries, int* count) override;
+    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
+
+    // The path cache (HTLinuxPathCache.h).
+    std::optional<std::string> realpath(const std::string& path) override;
+
+    std::string mach_error_string(kern_return_t code) override;
+    void mach_error(const char* label, kern_return_t code) override;
     int32_t getpid() override;
     uint32_t geteuid() override;
     bool isatty(int fd) override;
