@@ -9,13 +9,22 @@
 
 namespace {
 
-// Whether the thread behind the directory still runs.
-bool threadLives(int threadDir)
+// Reads and parses the stat file of the thread behind the directory; false
+// with errno when it cannot be read. The record's name points into a
+// per-thread buffer that the next call reuses.
+bool readThreadStat(int threadDir, std::optional<HTProcStat>& stat)
 {
     thread_local HTProcBuffer buffer;
     if (!buffer.readFile(threadDir, "stat", HTProcBuffer::End::ShortRead)) return false;
-    std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
-    return stat && !stat->hasExited();
+    stat = htParseProcStat(buffer.view());
+    return true;
+}
+
+// Whether the thread behind the directory still runs.
+bool threadLives(int threadDir)
+{
+    std::optional<HTProcStat> stat;
+    return readThreadStat(threadDir, stat) && stat && !stat->hasExited();
 }
 
 }  // namespace
@@ -46,8 +55,7 @@ HTFileDescriptor htOpenLiveThreadDirectory(int processDir)
 
 bool htThreadHasExited(int dirfd)
 {
-    thread_local HTProcBuffer buffer;
-    if (!buffer.readFile(dirfd, "stat", HTProcBuffer::End::ShortRead)) return htMeansGone(errno);
-    std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
+    std::optional<HTProcStat> stat;
+    if (!readThreadStat(dirfd, stat)) return htMeansGone(errno);
     return !stat || stat->hasExited();
 }
