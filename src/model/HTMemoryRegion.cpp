@@ -169,11 +169,11 @@ bool HTMemoryRegion::eligibleForSubrangesUsingPageSize(uint64_t pageSize) const
 std::optional<std::string> HTMemoryRegion::describeRegionType(uint32_t tag)
 {
     switch (tag) {
-    case 100:
+    case HT_VM_TAG_SHARED_MEMORY:
         return "shared memory";
-    case 101:
+    case HT_VM_TAG_KERNEL_PROVIDED:
         return "kernel-provided (vdso/vvar)";
-    case 102:
+    case HT_VM_TAG_NAMED_ANONYMOUS:
         return "named anonymous";
     default:
         return std::nullopt;

@@ -45,6 +45,16 @@ inline constexpr int KERN_PROCARGS2 = 49;
 
 inline constexpr int MAXCOMLEN = 16;
 
+// VM tags (user_tag) of the regions the Linux backend reports.
+inline constexpr uint32_t HT_VM_TAG_UNTAGGED = 0;
+inline constexpr uint32_t HT_VM_TAG_HEAP = 5;
+inline constexpr uint32_t HT_VM_TAG_STACK = 30;
+inline constexpr uint32_t HT_VM_TAG_GUARD = 31;
+// Kinds of mapping that have no tag of their own among the others.
+inline constexpr uint32_t HT_VM_TAG_SHARED_MEMORY = 100;
+inline constexpr uint32_t HT_VM_TAG_KERNEL_PROVIDED = 101;
+inline constexpr uint32_t HT_VM_TAG_NAMED_ANONYMOUS = 102;
+
 // Share modes of a mapping.
 inline constexpr uint8_t SM_COW = 1;
 inline constexpr uint8_t SM_PRIVATE = 2;

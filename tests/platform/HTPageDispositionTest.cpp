@@ -1,18 +1,16 @@
 #include "platform/linux/HTPageDisposition.h"
 #include "platform/HTPlatformTypes.h"
-#include "platform/linux/HTProcStatusParser.h"
 
 #include <gtest/gtest.h>
 
+#include <tuple>
 #include <vector>
 
 namespace {
 
-constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT;
-constexpr int32_t kDirty = VM_PAGE_QUERY_PAGE_DIRTY;
-constexpr int32_t kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT;
-constexpr int32_t kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL;
-constexpr int32_t kReusable = VM_PAGE_QUERY_PAGE_REUSABLE;
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT, kDirty = VM_PAGE_QUERY_PAGE_DIRTY,
+                  kPagedOut = VM_PAGE_QUERY_PAGE_PAGED_OUT, kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL,
+                  kReusable = VM_PAGE_QUERY_PAGE_REUSABLE, kCopied = VM_PAGE_QUERY_PAGE_COPIED;
 
 constexpr uint64_t kFrame = 0x1234;
 constexpr uint64_t kPresentEntry = HT_PAGEMAP_PRESENT | kFrame;
@@ -37,31 +35,29 @@ int32_t withFlags(uint64_t entry, uint64_t flags, HTPageMapping mapping = kPriva
 
 TEST(HTPageDisposition, FromPagemapAndPageFlags)
 {
-    constexpr int32_t kCopied = VM_PAGE_QUERY_PAGE_COPIED;
     struct Row {
         uint64_t entry, flags;
         HTPageMapping mapping;
         int32_t expected;
     };
     const Row rows[] = {
-        // Anonymous memory and shared memory are swap-backed: dirty while present.
+        // Swap-backed memory is dirty while present; file pages only when the kernel says so.
         {kPresentEntry, HT_KPF_ANON | HT_KPF_SWAPBACKED, kPrivate, kPresent | kDirty},
         {kFileEntry, HT_KPF_SWAPBACKED, kSharedMemory, kPresent | kDirty},
-        // File pages: external, dirty only when the kernel says so.
         {kFileEntry, 0, kPrivate, kPresent | kExternal},
         {kFileEntry, HT_KPF_DIRTY, kPrivate, kPresent | kExternal | kDirty},
         // Freed with MADV_FREE: anonymous without swap backing.
         {kPresentEntry, HT_KPF_ANON, kPrivate, kPresent | kReusable},
-        // hugetlbfs pages carry no swap-backed flag yet are neither external nor reusable.
+        // hugetlbfs pages: no swap-backed flag, yet neither external nor reusable.
         {kPresentEntry, HT_KPF_ANON, kHugetlb, kPresent | kDirty},
         {kFileEntry, 0, kHugetlb, kPresent | kDirty},
         // The shared zero page of a read-only touch: present, clean.
         {kPresentEntry, 0, kPrivate, kPresent},
-        // From the pagemap alone.
+        // From the pagemap alone. Shared memory pages carry the file bit
+        // but have no file behind them.
         {0, kNoFlags, kPrivate, 0},
         {HT_PAGEMAP_PRESENT, kNoFlags, kPrivate, kPresent | kDirty},
         {kFileEntry, kNoFlags, kPrivate, kPresent | kExternal},
-        // Shared memory pages carry the file bit but have no file behind them.
         {kFileEntry, kNoFlags, kSharedMemory, kPresent | kDirty},
         {kFileEntry, kNoFlags, kHugetlb, kPresent | kDirty},
         {kSwappedEntry, kNoFlags, kPrivate, kPagedOut},
@@ -117,13 +113,11 @@ TEST(HTPageDisposition, FlagsAreSkippedOnlyWhereTheyCannotMatter)
     }
     // File pages, anonymous pages (MADV_FREE, the zero page) and copies in
     // a private mapping of shared memory need them.
-    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPrivate));
-    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kPrivate));
-    EXPECT_TRUE(htPageFlagsMatter(kPresentEntry, kSharedMemory));
-    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kSharedMemory));
-    EXPECT_FALSE(htPageFlagsMatter(kFileEntry, kCleanFile));
-    EXPECT_FALSE(htPageFlagsMatter(kPresentEntry, kPlainAnonymous));
-    EXPECT_TRUE(htPageFlagsMatter(kFileEntry, kPlainAnonymous));
+    const std::tuple<uint64_t, HTPageMapping, bool> rows[] = {
+        {kFileEntry, kPrivate, true},       {kPresentEntry, kPrivate, true}, {kPresentEntry, kSharedMemory, true},
+        {kFileEntry, kSharedMemory, false}, {kFileEntry, kCleanFile, false}, {kPresentEntry, kPlainAnonymous, false},
+        {kFileEntry, kPlainAnonymous, true}};
+    for (auto [entry, mapping, matters] : rows) EXPECT_EQ(htPageFlagsMatter(entry, mapping), matters) << entry;
 }
 
 TEST(HTPageDisposition, SharedPageIdentities)
@@ -154,22 +148,4 @@ TEST(HTPageDisposition, SharedPageIdentities)
     EXPECT_NE(htSharedPageIdentity(HT_PAGEMAP_PRESENT | 0x5678, false, false),
               htSharedPageIdentity(kSwappedEntry, true, false));
     EXPECT_EQ(htSharedPageIdentity(kPresentEntry, false, false), htSharedPageIdentity(kPresentEntry, true, false));
-}
-
-TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)
-{
-    constexpr std::string_view live = "Name:\tcat\nState:\tR (running)\nVmPeak:\t    3060 kB\n"
-                                      "VmHWM:\t    1764 kB\nVmRSS:\t    1764 kB\nRssAnon:\t     116 kB\n"
-                                      "RssFile:\t    1648 kB\nVmPTE:\t      44 kB\nVmSwap:\t       8 kB\n"
-                                      "HugetlbPages:\t       0 kB\nThreads:\t1\n";
-    HTProcStatus status = htParseProcStatus(live);
-    ASSERT_TRUE(status.hasMemoryFigures());
-    EXPECT_EQ(*status.rssAnon, 116u * 1024);
-    EXPECT_EQ(*status.vmSwap, 8u * 1024);
-    EXPECT_EQ(*status.vmPTE, 44u * 1024);
-    EXPECT_EQ(*status.vmHWM, 1764u * 1024);
-
-    constexpr std::string_view zombie = "Name:\tpython3\nState:\tZ (zombie)\nTgid:\t13382\nThreads:\t1\n";
-    EXPECT_FALSE(htParseProcStatus(zombie).hasMemoryFigures());
-    EXPECT_FALSE(htParseProcStatus("VmPTE:\n").vmPTE.has_value());
 }

@@ -1,4 +1,6 @@
 #include "platform/linux/HTProcArgs.h"
+#include "platform/linux/HTDeletedMark.h"
+#include "platform/linux/HTFileDescriptor.h"
 #include "platform/linux/HTProcBuffer.h"
 
 #include <gtest/gtest.h>
@@ -10,65 +12,51 @@
 
 using namespace std::string_literals;
 
-namespace {
-
-int32_t argcOf(const std::string& area)
-{
-    int32_t argc;
-    std::memcpy(&argc, area.data(), sizeof(argc));
-    return argc;
-}
-
-std::string build(std::string_view path, std::string_view cmdline)
-{
-    std::string area(htBuildProcArgs(path, cmdline, nullptr, 0), 'x');
-    EXPECT_EQ(htBuildProcArgs(path, cmdline, area.data(), area.size()), area.size());
-    return area;
-}
-
-}  // namespace
-
 TEST(HTProcArgs, LaysOutCountPathPaddingAndArguments)
 {
-    std::string area = build("/usr/bin/tool", "tool\0-v\0file\0"s);
-    EXPECT_EQ(argcOf(area), 3);
-    // 4 + 13 + NUL = 18, padded to 24.
-    ASSERT_EQ(area.size(), 24u + 13u);
-    EXPECT_EQ(area.substr(4, 14), "/usr/bin/tool\0"s);
-    EXPECT_EQ(area.substr(18, 6), std::string(6, '\0'));
-    EXPECT_EQ(area.substr(24), "tool\0-v\0file\0"s);
-
-    // A process that rewrote its arguments may leave the last one
-    // unterminated; the area terminates it.
-    std::string rewritten = build("/bin/d", "daemon: idle");
-    EXPECT_EQ(argcOf(rewritten), 1);
-    EXPECT_EQ(rewritten.substr(htProcArgsHeaderSize("/bin/d")), "daemon: idle\0"s);
-
-    // No arguments at all (a process that is exiting).
-    std::string bare = build("/bin/d", "");
-    EXPECT_EQ(argcOf(bare), 0);
-    EXPECT_EQ(bare.size(), htProcArgsHeaderSize("/bin/d"));
-}
-
-TEST(HTProcArgs, ShortBufferKeepsTheBeginningAndNeverOverruns)
-{
-    std::string path = "/opt/app/bin/server";
-    std::string cmdline = "server\0--port\0"
-                          "8080\0"s;
-    std::string whole = build(path, cmdline);
-    for (size_t capacity = 1; capacity < whole.size(); ++capacity) {
-        std::string buffer(capacity + 8, '#');
-        EXPECT_EQ(htBuildProcArgs(path, cmdline, buffer.data(), capacity), whole.size());
-        EXPECT_EQ(buffer.substr(0, capacity), whole.substr(0, capacity)) << capacity;
-        EXPECT_EQ(buffer.substr(capacity), std::string(8, '#')) << capacity;
+    struct Row {
+        std::string path, cmdline;
+        int32_t argc;
+        size_t header;         // count, path and padding
+        std::string expected;  // after the count
+    };
+    const Row rows[] = {
+        // 4 + 13 + NUL = 18, padded to 24.
+        {"/usr/bin/tool", "tool\0-v\0file\0"s, 3, 24, "/usr/bin/tool\0\0\0\0\0\0\0tool\0-v\0file\0"s},
+        // A process that rewrote its arguments may leave the last one
+        // unterminated; the area terminates it.
+        {"/bin/d", "daemon: idle", 1, 16, "/bin/d\0\0\0\0\0\0daemon: idle\0"s},
+        // No arguments at all (a process that is exiting).
+        {"/bin/d", "", 0, 16, "/bin/d\0\0\0\0\0\0"s},
+    };
+    for (const Row& row : rows) {
+        std::string area(htBuildProcArgs(row.path, row.cmdline, nullptr, 0), 'x');
+        ASSERT_EQ(htBuildProcArgs(row.path, row.cmdline, area.data(), area.size()), area.size());
+        int32_t argc;
+        std::memcpy(&argc, area.data(), sizeof(argc));
+        EXPECT_EQ(argc, row.argc) << row.path;
+        EXPECT_EQ(area.substr(4), row.expected) << row.path;
+        EXPECT_EQ(htProcArgsHeaderSize(row.path), row.header) << row.path;
+        // A short buffer keeps the beginning and is never overrun.
+        for (size_t capacity = 1; capacity < area.size(); ++capacity) {
+            std::string buffer(capacity + 8, '#');
+            EXPECT_EQ(htBuildProcArgs(row.path, row.cmdline, buffer.data(), capacity), area.size());
+            EXPECT_EQ(buffer, area.substr(0, capacity) + std::string(8, '#')) << capacity;
+        }
     }
 }
 
-TEST(HTProcArgs, DeletedExecutableKeepsItsPath)
+TEST(HTDeletedMark, OneTrailingMarkOfARealPathIsDropped)
 {
-    EXPECT_EQ(htExecutablePathFromLink("/usr/lib/app/worker (deleted)"), "/usr/lib/app/worker");
-    EXPECT_EQ(htExecutablePathFromLink("/usr/bin/worker"), "/usr/bin/worker");
-    EXPECT_EQ(htExecutablePathFromLink("/tmp/a (deleted) (deleted)"), "/tmp/a (deleted)");
+    const std::pair<const char*, const char*> rows[] = {
+        {"/usr/lib/app/worker (deleted)", "/usr/lib/app/worker"},   {"/usr/bin/worker", "/usr/bin/worker"},
+        {"/tmp/a (deleted) (deleted)", "/tmp/a (deleted)"},         {" (deleted)", " (deleted)"},
+        {"/tmp/file with blank (deleted)", "/tmp/file with blank"},
+    };
+    for (auto [path, expected] : rows) {
+        EXPECT_EQ(htPathWithoutDeletedMark(path), expected) << path;
+        EXPECT_EQ(htHasDeletedMark(path), std::string_view(path) != expected) << path;
+    }
 }
 
 TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
@@ -79,13 +67,11 @@ TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
     EXPECT_GT(buffer.size(), 16384u);
     EXPECT_EQ(buffer.view().back(), '\n');
     size_t grown = buffer.capacity();
-
     // status is written whole: its last line arrives in the first read.
     ASSERT_TRUE(buffer.readFile(AT_FDCWD, "/proc/self/status", HTProcBuffer::End::ShortRead));
     EXPECT_EQ(buffer.view().find("Name:"), 0u);
     EXPECT_NE(buffer.view().find("\nnonvoluntary_ctxt_switches:"), std::string_view::npos);
     EXPECT_EQ(buffer.capacity(), grown);
-
     errno = 0;
     EXPECT_FALSE(buffer.readFile(AT_FDCWD, "/proc/self/no-such-file"));
     EXPECT_EQ(errno, ENOENT);
@@ -94,14 +80,13 @@ TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
     // A file larger than a fresh buffer fills it, grows it and goes on to
     // the end, also where a short read could end a /proc file.
     char path[] = "/tmp/heft-procbuffer-XXXXXX";
-    int fd = ::mkstemp(path);
-    ASSERT_GE(fd, 0);
+    HTFileDescriptor fd(::mkstemp(path));
+    ASSERT_TRUE(fd.isOpen());
     ::unlink(path);
     std::string text(3 * 4096 + 100, 'x');
-    ASSERT_EQ(::write(fd, text.data(), text.size()), static_cast<ssize_t>(text.size()));
-    ASSERT_EQ(::lseek(fd, 0, SEEK_SET), 0);
+    ASSERT_EQ(::write(fd.get(), text.data(), text.size()), static_cast<ssize_t>(text.size()));
+    ASSERT_EQ(::lseek(fd.get(), 0, SEEK_SET), 0);
     HTProcBuffer fresh;
-    ASSERT_TRUE(fresh.readDescriptor(fd, HTProcBuffer::End::ShortRead));
-    ::close(fd);
+    ASSERT_TRUE(fresh.readDescriptor(fd.get(), HTProcBuffer::End::ShortRead));
     EXPECT_EQ(fresh.view(), text);
 }

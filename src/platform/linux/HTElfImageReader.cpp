@@ -1,5 +1,9 @@
 #include "platform/linux/HTElfImageReader.h"
 
+#include "platform/linux/HTDeletedMark.h"
+#include "platform/linux/HTFileDescriptor.h"
+#include "platform/linux/HTPreadFully.h"
+
 #include <algorithm>
 #include <cerrno>
 #include <charconv>
@@ -39,23 +43,6 @@ bool pageUp(uint64_t value, uint64_t pageSize, uint64_t* out)
     return true;
 }
 
-// pread until `size` bytes or the end of the file; the count read, -1 on
-// an error.
-ssize_t readFully(int fd, void* buffer, size_t size, off_t offset)
-{
-    size_t done = 0;
-    while (done < size) {
-        ssize_t count = ::pread(fd, static_cast<char*>(buffer) + done, size - done, offset + static_cast<off_t>(done));
-        if (count < 0) {
-            if (errno == EINTR) continue;
-            return -1;
-        }
-        if (count == 0) break;
-        done += static_cast<size_t>(count);
-    }
-    return static_cast<ssize_t>(done);
-}
-
 // Splits a writable PT_LOAD [start, end) at the page-aligned part of the
 // RELRO range that the loader makes read-only after relocation (it rounds
 // both ends down to the page, leaving a partial last page writable).
@@ -88,7 +75,7 @@ HTElfImageReader::ReadResult readLayoutOf(int fd, const unsigned char* headerByt
     }
     size_t tableSize = static_cast<size_t>(header.e_phnum) * header.e_phentsize;
     std::unique_ptr<unsigned char[]> table(new unsigned char[tableSize]);
-    ssize_t count = readFully(fd, table.get(), tableSize, static_cast<off_t>(header.e_phoff));
+    ssize_t count = htPreadFully(fd, table.get(), tableSize, header.e_phoff);
     if (count < 0) return Result::Unreadable;
     if (static_cast<size_t>(count) != tableSize) return Result::NotImage;
 
@@ -145,7 +132,7 @@ HTElfImageReader::ReadResult readLayoutOf(int fd, const unsigned char* headerByt
 // from its root, else the path as we see it. Only regular files are opened:
 // opening a device node can have effects of its own. -1 when none opens;
 // *notRegular is set when the mapped file is known not to be a regular file.
-int openMappedFile(int procDirFd, const HTSmapsEntry& mapping, bool* notRegular)
+HTFileDescriptor openMappedFile(int procDirFd, const HTSmapsEntry& mapping, bool* notRegular)
 {
     *notRegular = false;
     char mapFile[64];
@@ -155,13 +142,13 @@ int openMappedFile(int procDirFd, const HTSmapsEntry& mapping, bool* notRegular)
     if (::fstatat(procDirFd, mapFile, &status, 0) == 0) {
         if (!S_ISREG(status.st_mode)) {
             *notRegular = true;
-            return -1;
+            return HTFileDescriptor();
         }
-        int fd = ::openat(procDirFd, mapFile, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
-        if (fd >= 0) return fd;
+        HTFileDescriptor fd(::openat(procDirFd, mapFile, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+        if (fd.isOpen()) return fd;
     }
     // A deleted file's path names nothing, or some other file.
-    if (htSmapsPathWithoutDeleted(mapping.path).size() != mapping.path.size()) return -1;
+    if (htHasDeletedMark(mapping.path)) return HTFileDescriptor();
     const std::string& path = mapping.path;
     std::string rootPath = "root" + path;
     const std::pair<int, const char*> candidates[] = {{procDirFd, rootPath.c_str()}, {AT_FDCWD, path.c_str()}};
@@ -169,12 +156,12 @@ int openMappedFile(int procDirFd, const HTSmapsEntry& mapping, bool* notRegular)
         if (::fstatat(dirfd, name, &status, 0) != 0) continue;
         if (!S_ISREG(status.st_mode)) {
             *notRegular = true;
-            return -1;
+            return HTFileDescriptor();
         }
-        int fd = ::openat(dirfd, name, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY);
-        if (fd >= 0) return fd;
+        HTFileDescriptor fd(::openat(dirfd, name, O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
+        if (fd.isOpen()) return fd;
     }
-    return -1;
+    return HTFileDescriptor();
 }
 
 }  // namespace
@@ -189,7 +176,7 @@ HTElfImageReader::ReadResult HTElfImageReader::readLayout(int fd, uint64_t pageS
                                                           std::shared_ptr<const Layout>* layout)
 {
     unsigned char header[sizeof(Elf64_Ehdr)];
-    ssize_t count = readFully(fd, header, sizeof(header), 0);
+    ssize_t count = htPreadFully(fd, header, sizeof(header), 0);
     if (count < 0) return ReadResult::Unreadable;
     size_t length = static_cast<size_t>(count);
     if (length < EI_NIDENT || std::memcmp(header, ELFMAG, SELFMAG) != 0) return ReadResult::NotImage;
@@ -235,12 +222,11 @@ std::shared_ptr<const HTElfImageReader::Layout> HTElfImageReader::layoutForMappi
     // Read outside the lock: two threads may both read a new file, and the
     // first to store its layout wins.
     bool notRegular = false;
-    int fd = openMappedFile(procDirFd, mapping, &notRegular);
+    HTFileDescriptor fd = openMappedFile(procDirFd, mapping, &notRegular);
     std::shared_ptr<const Layout> layout;
     ReadResult result = ReadResult::NotImage;
-    if (fd >= 0) {
-        result = readLayout(fd, pageSize_, &layout);
-        ::close(fd);
+    if (fd.isOpen()) {
+        result = readLayout(fd.get(), pageSize_, &layout);
     } else if (!notRegular) {
         // Not opened this time; another process's view of it may be.
         return nullptr;

@@ -1,147 +1,80 @@
 #pragma once
 
-// The platform calls answered from Linux's /proc. Every call may run on
-// any thread: reads go through per-thread buffers and the only shared
-// state is the /proc and /proc/kpageflags descriptors and the breakdown
-// setting. A task handle is used by one thread at a time.
+// The platform calls answered from Linux's /proc. The work lives in rooms of
+// its own, which this class owns and forwards to: the process table, the
+// status figures, the address space and its page queries, and the path
+// cache. Every call may run on any thread: reads go through per-thread
+// buffers and the only shared state is the /proc and /proc/kpageflags
+// descriptors and the caches. A task handle is used by one thread at a
+// time.
 
 #include "platform/HTPlatform.h"
-#include "platform/linux/HTElfImageReader.h"
+#include "platform/linux/HTLinuxMappings.h"
+#include "platform/linux/HTLinuxPageQueries.h"
+#include "platform/linux/HTLinuxPathCache.h"
+#include "platform/linux/HTLinuxProcessTable.h"
+#include "platform/linux/HTLinuxStatusReader.h"
 
-#include <atomic>
 #include <cstdint>
-#include <mutex>
 #include <optional>
 #include <string>
-#include <string_view>
-#include <unordered_map>
-
-class HTLinuxTaskPort;
-class HTProcBuffer;
-struct HTProcStatus;
-
-struct HTSmapsEntry;
 
 class HTLinuxPlatform : public HTPlatform {
 public:
-    HTLinuxPlatform();
-    ~HTLinuxPlatform() override;
+    HTLinuxPlatform() = default;
     HTLinuxPlatform(const HTLinuxPlatform&) = delete;
     HTLinuxPlatform& operator=(const HTLinuxPlatform&) = delete;
 
-    // Pid 0 first (the kernel), then the processes with an address space of
-    // their own; kernel threads are left out. With a null buffer: an upper
-    // bound of that number.
+    // The process table (HTLinuxProcessTable.h).
     int proc_listallpids(int32_t* buffer, int bufferSize) override;
     int proc_pidinfo(int32_t pid, int flavor, uint64_t arg, void* buffer, int bufferSize) override;
     // Linux has no idle-exit control: always ENOTSUP.
     int proc_get_dirty(int32_t pid, uint32_t* flags) override;
+    // KERN_ARGMAX and KERN_PROCARGS2, from the process table.
     int sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
                size_t newlen) override;
+    // No setting by name exists on Linux: always ENOENT.
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
+
+    // The address space (HTLinuxMappings.h, HTLinuxPageQueries.h).
     uint64_t vm_kernel_page_size() override;
-    // An HTLinuxTaskPort, once the process's memory maps can be opened (the
-    // kernel's ptrace read check); else HT_KERN_ERRNO_BASE | errno. The
-    // handle holds no descriptor until it is used.
     kern_return_t task_for_pid(int32_t pid, std::shared_ptr<HTTaskPort>* task) override;
-    std::string mach_error_string(kern_return_t code) override;
-    void mach_error(const char* label, kern_return_t code) override;
-    // The address-space calls read /proc/PID/smaps once per walk (when the
-    // walk starts at address 0, or the handle has no mappings yet) and
-    // answer from the parsed mappings. A process that is gone or a zombie
-    // answers MACH_SEND_INVALID_DEST; no mapping at or above the address
-    // KERN_INVALID_ADDRESS; other failures HT_KERN_ERRNO_BASE | errno.
+    // Linux has no submaps: the depth stays as it was.
     kern_return_t mach_vm_region_recurse(HTTaskPort& task, uint64_t* address, uint64_t* size, uint32_t* depth,
                                          vm_region_submap_info_64* info, uint32_t* count) override;
     kern_return_t mach_vm_region(HTTaskPort& task, uint64_t* address, uint64_t* size, vm_region_basic_info_64* info,
                                  uint32_t* count) override;
     // Linux has no purgeable memory: always KERN_INVALID_ARGUMENT.
     kern_return_t mach_vm_purgable_control(HTTaskPort& task, uint64_t address, int control, int32_t* state) override;
-    // From /proc/PID/pagemap, and /proc/kpageflags when it is readable.
-    // KERN_INVALID_ARGUMENT when the process is gone or a zombie.
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
-    // True when heft may read physical frame numbers from pagemap (as root).
     bool canIdentifySharedPages() override;
-    // From /proc/PID/pagemap: frames of resident anonymous pages that are not
-    // mapped exclusively, and swap slots where smaps shows shared swap
-    // (SwapPss below Swap). Only private mappings whose smaps shows pages
-    // shared with other processes are read; zero pages are left out.
     kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
                                        uint64_t* identities) override;
-    // The path of the mapping that holds the address, as smaps shows it: a
-    // file that was deleted or replaced keeps its " (deleted)" mark.
     int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;
-
-    // From /proc/PID/status: anonymous resident + swapped + page tables, and
-    // the peak resident set.
-    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
-    // One ledger, "page_table": the bytes of the process's page tables.
-    int ledger_template(ledger_template_info* entries, int* count) override;
-    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
-    std::optional<std::string> realpath(const std::string& path) override;
-    // From the kernel's pagemap scan; the whole range where the kernel
-    // lacks it.
     void populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs) override;
-    // The ELF objects mapped by the task, with their segments.
     bool forEachTaskImage(HTTaskPort& task, uint32_t flags,
                           const std::function<void(const HTPlatformImage&)>& callback) override;
 
+    // The status figures (HTLinuxStatusReader.h).
+    int proc_pid_rusage(int32_t pid, int flavor, rusage_info_v4* info) override;
+    int ledger_template(ledger_template_info* entries, int* count) override;
+    int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
+
+    // The path cache (HTLinuxPathCache.h).
+    std::optional<std::string> realpath(const std::string& path) override;
+
+    std::string mach_error_string(kern_return_t code) override;
+    void mach_error(const char* label, kern_return_t code) override;
     int32_t getpid() override;
     uint32_t geteuid() override;
     bool isatty(int fd) override;
     bool stat(const char* path) override;
 
 private:
-    // The task's first mapping that ends above the address, read anew when
-    // the address is 0 (a walk begins); KERN_INVALID_ADDRESS when none.
-    kern_return_t vmaAtOrAbove(HTTaskPort& task, uint64_t address, const HTSmapsEntry** vma);
-    // Opens /proc/PID followed by `suffix` ("" for the directory itself,
-    // with O_DIRECTORY in `flags`); -1 with errno, ESRCH when it is gone.
-    int openProcessFile(int32_t pid, std::string_view suffix, int flags = 0) const;
-    // Reads one of the small files of /proc/PID whole (stat, status,
-    // cmdline); false with errno, ESRCH when the process is gone.
-    bool readProcessFile(int32_t pid, std::string_view suffix, HTProcBuffer& buffer) const;
-    // Reads the small file `name` of a live thread of the process, for one
-    // whose main thread has exited; false with errno, ESRCH when no thread
-    // lives.
-    bool readLiveThreadFile(int32_t pid, const char* name, HTProcBuffer& buffer) const;
-    // The record of a process (or of the kernel for pid 0); false with
-    // errno, ESRCH for a process that is gone or a kernel thread.
-    bool readBsdInfo(int32_t pid, proc_bsdinfo& info);
-    void fillKernelInfo(proc_bsdinfo& info);
-    int readProcArgs(int32_t pid, void* oldp, size_t* oldlenp);
-    // Parses the task's smaps when `refresh` is set or nothing was parsed
-    // yet. KERN_SUCCESS, MACH_SEND_INVALID_DEST for a process that is gone
-    // or a zombie, else HT_KERN_ERRNO_BASE | errno.
-    kern_return_t loadVmas(HTLinuxTaskPort& task, bool refresh);
-    // Reads the memory figures of /proc/PID/status, or of a live thread's
-    // when the main thread has exited; false with errno, ESRCH for a zombie.
-    bool readStatus(int32_t pid, HTProcStatus& status);
-    // The identities of the pages [from, to) of the task's mapping at
-    // `index` into `identities`.
-    kern_return_t identifyPages(HTLinuxTaskPort& task, size_t index, uint64_t from, uint64_t to, uint64_t* identities);
-    // Whether the frame is a zero page, from its kpageflags.
-    bool isZeroFrame(uint64_t frame);
-    // /proc/kpageflags when heft may read it (as root), else -1; opened once.
-    int kpageflagsFd();
-    // Seconds since the epoch at boot, read once.
-    uint64_t bootTime();
-
-    int procFd_ = -1;
-    int procErrno_ = 0;
-    long clockTicks_ = 100;
-    std::once_flag bootTimeOnce_;
-    uint64_t bootTime_ = 0;
-    std::atomic<int32_t> selfRegionHeft_{0};
-    std::once_flag identifyOnce_;
-    bool canIdentify_ = false;
-    std::once_flag kpageflagsOnce_;
-    int kpageflagsFd_ = -1;
-    // Parsed program headers are cached per file for the whole run.
-    HTElfImageReader imageReader_;
-    // Resolved paths, for the whole run: every process maps the same
-    // libraries, and resolving one path reads every link on the way.
-    std::mutex realpathLock_;
-    std::unordered_map<std::string, std::optional<std::string>> realpaths_;
+    HTLinuxProcessTable processes_;
+    HTLinuxStatusReader status_{processes_};
+    HTLinuxMappings mappings_;
+    HTLinuxPageQueries pages_;
+    HTLinuxPathCache paths_;
 };

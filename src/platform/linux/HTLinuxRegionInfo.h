@@ -9,16 +9,7 @@
 
 #include <cstdint>
 
-// The VM tags of mappings that have no tag of their own elsewhere.
-inline constexpr uint32_t HT_VM_TAG_SHARED_MEMORY = 100;
-inline constexpr uint32_t HT_VM_TAG_KERNEL_PROVIDED = 101;
-inline constexpr uint32_t HT_VM_TAG_NAMED_ANONYMOUS = 102;
-// Tags shared with the rest of the table.
-inline constexpr uint32_t HT_VM_TAG_UNTAGGED = 0;
-inline constexpr uint32_t HT_VM_TAG_HEAP = 5;
-inline constexpr uint32_t HT_VM_TAG_STACK = 30;
-inline constexpr uint32_t HT_VM_TAG_GUARD = 31;
-
+// The VM tag of a mapping (HT_VM_TAG_*, HTPlatformTypes.h).
 uint32_t htRegionTag(const HTSmapsEntry& entry);
 
 // The identity of the VM object behind a mapping, never 0 nor all ones.

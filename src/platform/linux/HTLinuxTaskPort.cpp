@@ -13,67 +13,49 @@
 
 namespace {
 enum : uint8_t { kNotAsked, kNoZeroPage, kZeroPage, kUnknown };
-
-void closeKeepingErrno(int fd)
-{
-    int savedErrno = errno;
-    ::close(fd);
-    errno = savedErrno;
-}
 }  // namespace
 
 HTLinuxTaskPort::HTLinuxTaskPort(int32_t pid, std::optional<uint64_t> startTime) : pid_(pid), startTime_(startTime) {}
 
-HTLinuxTaskPort::~HTLinuxTaskPort()
-{
-    closePagemap();
-    closeDirectory();
-}
+HTLinuxTaskPort::~HTLinuxTaskPort() = default;
 
 bool HTLinuxTaskPort::openDirectory()
 {
-    if (procDirFd_ >= 0) return true;
+    if (procDirFd_.isOpen()) return true;
     char path[32] = "/proc/";
     *std::to_chars(path + 6, path + sizeof(path) - 1, pid_).ptr = '\0';
-    int process = ::open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (process < 0) {
+    HTFileDescriptor process(::open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!process.isOpen()) {
         if (errno == ENOENT) errno = ESRCH;
         return false;
     }
     thread_local HTProcBuffer buffer;
-    const bool read = buffer.readFile(process, "stat", HTProcBuffer::End::ShortRead);
+    const bool read = buffer.readFile(process.get(), "stat", HTProcBuffer::End::ShortRead);
     std::optional<HTProcStat> stat = read ? htParseProcStat(buffer.view()) : std::nullopt;
     if (!stat || (startTime_ && stat->starttime != *startTime_)) {
         // Gone, or the pid names another process now.
         int error = read || errno == ENOENT ? ESRCH : errno;
-        ::close(process);
+        process.reset();
         errno = error;
         return false;
     }
     startTime_ = stat->starttime;
-    procDirFd_ = process;
     // A main thread that has exited reads an empty address space: a live
     // thread reads the process's. With none left the process is a zombie,
     // and reads through its own directory say so.
     if (stat->hasExited()) {
-        int thread = htOpenLiveThreadDirectory(process);
-        if (thread >= 0) {
-            ::close(process);
-            procDirFd_ = thread;
-        }
+        HTFileDescriptor thread = htOpenLiveThreadDirectory(process.get());
+        if (thread.isOpen()) process = std::move(thread);
     }
+    procDirFd_ = std::move(process);
     return true;
 }
 
-void HTLinuxTaskPort::closeDirectory()
-{
-    if (procDirFd_ >= 0) closeKeepingErrno(procDirFd_);
-    procDirFd_ = -1;
-}
+void HTLinuxTaskPort::closeDirectory() { procDirFd_.reset(); }
 
 HTLinuxTaskPort::DirectoryUse::DirectoryUse(HTLinuxTaskPort& task) : task_(task)
 {
-    if (task.procDirFd_ >= 0) return;
+    if (task.procDirFd_.isOpen()) return;
     opened_ = task.openDirectory();
     if (!opened_) error_ = errno;
 }
@@ -85,8 +67,8 @@ HTLinuxTaskPort::DirectoryUse::~DirectoryUse()
 
 int HTLinuxTaskPort::DirectoryUse::fd() const
 {
-    if (task_.procDirFd_ < 0) errno = error_;
-    return task_.procDirFd_;
+    if (!task_.procDirFd_.isOpen()) errno = error_;
+    return task_.procDirFd_.get();
 }
 
 void HTLinuxTaskPort::parseVmas(std::string_view smaps)
@@ -131,18 +113,14 @@ const HTSmapsEntry* HTLinuxTaskPort::vmaContaining(uint64_t address) const
 
 int HTLinuxTaskPort::pagemapFd()
 {
-    if (pagemapFd_ >= 0) return pagemapFd_;
+    if (pagemapFd_.isOpen()) return pagemapFd_.get();
     DirectoryUse directory(*this);
     if (directory.fd() < 0) return -1;
-    pagemapFd_ = ::openat(directory.fd(), "pagemap", O_RDONLY | O_CLOEXEC);
-    return pagemapFd_;
+    pagemapFd_.reset(::openat(directory.fd(), "pagemap", O_RDONLY | O_CLOEXEC));
+    return pagemapFd_.get();
 }
 
-void HTLinuxTaskPort::closePagemap()
-{
-    if (pagemapFd_ >= 0) closeKeepingErrno(pagemapFd_);
-    pagemapFd_ = -1;
-}
+void HTLinuxTaskPort::closePagemap() { pagemapFd_.reset(); }
 
 std::optional<bool> HTLinuxTaskPort::mayMapZeroPage(size_t index)
 {

@@ -1,6 +1,7 @@
 #pragma once
 
 #include "platform/HTTaskPort.h"
+#include "platform/linux/HTFileDescriptor.h"
 #include "platform/linux/HTPagemapScan.h"
 #include "platform/linux/HTSmapsParser.h"
 
@@ -52,7 +53,7 @@ public:
     bool openDirectory();
     void closeDirectory();
     // The open directory; -1 when none is.
-    int procDirFd() const { return procDirFd_; }
+    int procDirFd() const { return procDirFd_.get(); }
 
     // Keeps the directory open for its own lifetime, opening it unless it
     // is open already, and then closes what it opened.
@@ -110,8 +111,8 @@ public:
 private:
     int32_t pid_;
     std::optional<uint64_t> startTime_;
-    int procDirFd_ = -1;
-    int pagemapFd_ = -1;
+    HTFileDescriptor procDirFd_;
+    HTFileDescriptor pagemapFd_;
     bool hasParsedVmas_ = false;
     bool keptForNextWalk_ = false;
     std::vector<HTSmapsEntry> vmas_;

@@ -4,17 +4,6 @@
 #include <cstdint>
 #include <cstring>
 
-namespace {
-constexpr std::string_view kDeletedSuffix = " (deleted)";
-}
-
-std::string_view htExecutablePathFromLink(std::string_view link)
-{
-    if (link.size() > kDeletedSuffix.size() && link.ends_with(kDeletedSuffix))
-        link.remove_suffix(kDeletedSuffix.size());
-    return link;
-}
-
 int32_t htArgumentCount(std::string_view cmdline)
 {
     if (cmdline.empty()) return 0;

@@ -9,10 +9,6 @@
 #include <cstdint>
 #include <string_view>
 
-// The executable path of an exe link's text: the kernel appends
-// " (deleted)" to the path of an executable removed while it runs.
-std::string_view htExecutablePathFromLink(std::string_view link);
-
 // The number of arguments in a cmdline file: NUL-terminated strings, the
 // last of which may lack its NUL when the process rewrote its arguments.
 int32_t htArgumentCount(std::string_view cmdline);

@@ -1,9 +1,10 @@
 #include "platform/linux/HTProcBuffer.h"
 
+#include "platform/linux/HTFileDescriptor.h"
+
 #include <cerrno>
 #include <cstring>
 #include <fcntl.h>
-#include <unistd.h>
 
 namespace {
 constexpr size_t kInitialCapacity = 4096;
@@ -42,11 +43,6 @@ bool HTProcBuffer::readDescriptor(int fd, End end)
 bool HTProcBuffer::readFile(int dirfd, const char* path, End end)
 {
     size_ = 0;
-    int fd = ::openat(dirfd, path, O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return false;
-    bool read = readDescriptor(fd, end);
-    int savedErrno = errno;
-    ::close(fd);
-    errno = savedErrno;
-    return read;
+    HTFileDescriptor fd(::openat(dirfd, path, O_RDONLY | O_CLOEXEC));
+    return fd.isOpen() && readDescriptor(fd.get(), end);
 }

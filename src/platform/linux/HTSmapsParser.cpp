@@ -8,8 +8,6 @@
 
 namespace {
 
-constexpr std::string_view kDeletedSuffix = " (deleted)";
-
 // Reads a number in `base` at the front of `text` and drops it; false when
 // there is none.
 template<typename T>
@@ -120,7 +118,6 @@ uint64_t* sizeField(HTSmapsEntry& entry, std::string_view name)
         if (name == "Shared_Hugetlb") return &entry.sharedHugetlb;
         break;
     case 'P':
-        if (name == "Private_Clean") return &entry.privateClean;
         if (name == "Private_Dirty") return &entry.privateDirty;
         if (name == "Private_Hugetlb") return &entry.privateHugetlb;
         break;
@@ -167,12 +164,6 @@ void resetEntry(HTSmapsEntry& entry)
 bool isHexDigit(char c) { return (c >= '0' && c <= '9') || (c >= 'a' && c <= 'f'); }
 
 }  // namespace
-
-std::string_view htSmapsPathWithoutDeleted(std::string_view path)
-{
-    if (path.ends_with(kDeletedSuffix)) path.remove_suffix(kDeletedSuffix.size());
-    return path;
-}
 
 HTSmapsKind htSmapsKind(std::string_view path, bool shared, uint32_t vmFlags)
 {

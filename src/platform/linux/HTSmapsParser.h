@@ -58,7 +58,6 @@ struct HTSmapsEntry {
     uint64_t rss = 0;
     uint64_t sharedClean = 0;
     uint64_t sharedDirty = 0;
-    uint64_t privateClean = 0;
     uint64_t privateDirty = 0;
     uint64_t anonymous = 0;
     uint64_t lazyFree = 0;
@@ -92,6 +91,3 @@ size_t htParseSmaps(std::string_view text, std::vector<HTSmapsEntry>& entries);
 // The kind of a mapping from its path, sharing and VmFlags (exposed for
 // tests).
 HTSmapsKind htSmapsKind(std::string_view path, bool shared, uint32_t vmFlags);
-
-// The path with a trailing " (deleted)" removed.
-std::string_view htSmapsPathWithoutDeleted(std::string_view path);
