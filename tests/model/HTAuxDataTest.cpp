@@ -60,7 +60,7 @@ TEST(HTAuxData, NestedMapsMergeAndDropOut)
     auto dropped = map({{"Maps", map({{"site", datum(1, false)}})}, {"x", datum(1, true)}})->mergeWithData(nullptr);
     EXPECT_EQ(dropped->find("Maps"), nullptr);
 
-    EXPECT_DEATH(HTAuxDataMap::mergeAuxDatum(datum(1, true), map({})), "HTAuxData.*datum1.isContainer");
+    EXPECT_DEATH(HTAuxDataMap::mergeAuxDatum(datum(1, true), map({})), "HTAuxData.*datum1->isContainer");
 }
 
 TEST(HTAuxData, ReplacingKeepsKeyOrder)
