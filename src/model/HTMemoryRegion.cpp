@@ -117,7 +117,7 @@ HTMemoryRegion::~HTMemoryRegion() = default;
 
 void HTMemoryRegion::setEnd(uint64_t end)
 {
-    HT_ASSERT("HTMemoryRegion", end >= start_, "end >= self.start");
+    HT_ASSERT("HTMemoryRegion", end >= start_, "end >= start_");
     size_ = end - start_;
 }
 

@@ -40,7 +40,7 @@ TEST(HTMemoryRegion, EndAndOrder)
     auto r = region(0x1000, 0x1000);
     r->setEnd(0x5000);
     EXPECT_EQ(r->size(), 0x4000u);
-    EXPECT_DEATH(r->setEnd(0xFFF), "HTMemoryRegion.*end >= self.start");
+    EXPECT_DEATH(r->setEnd(0xFFF), "HTMemoryRegion.*end >= start_");
 
     std::vector<std::shared_ptr<HTMemoryRegion>> regions{region(0x1000, 0x1000), region(0x1000, 0x3000),
                                                          region(0x800, 0x100)};

@@ -43,7 +43,6 @@ TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
     // Linux maps no shared library cache.
     EXPECT_EQ(process->sharedRegionBase(), 0u);
     EXPECT_EQ(process->sharedRegionSize(), 0u);
-    EXPECT_EQ(process->sharedRegionAlignmentSize(), 4096u);
 
     auto data = process->auxData();
     ASSERT_NE(data, nullptr);
