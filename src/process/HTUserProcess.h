@@ -58,15 +58,9 @@ public:
     // --- fields ----------------------------------------------------------
     // Null until _populateTask succeeded.
     const std::shared_ptr<HTTaskPort>& task() const { return task_; }
-    uint64_t sharedRegionBase() const { return sharedRegionBase_; }
-    uint64_t sharedRegionSize() const { return sharedRegionSize_; }
-    uint64_t phys_heft() const { return phys_heft_; }
-    uint64_t phys_heft_peak() const { return phys_heft_peak_; }
     // Set while gathering when some memory may be shared with other
     // processes after a fork but the platform cannot name its pages.
     bool sharedPagesUnidentified() const { return sharedPagesUnidentified_; }
-    // The balance of the "page_table" ledger entry, in bytes.
-    const std::array<uint64_t, 1>& ledgers() const { return ledgers_; }
 
 protected:
     // The ledger template is read once per run; this makes the next process
@@ -141,6 +135,7 @@ private:
     uint64_t sharedRegionSize_ = 0;
     uint64_t phys_heft_ = 0;
     uint64_t phys_heft_peak_ = 0;
+    // The balance of the "page_table" ledger entry, in bytes.
     std::array<uint64_t, 1> ledgers_{};
     std::vector<std::shared_ptr<HTImage>> images_;
     std::optional<HTOwnedVmObjectMap> ownedVmObjects_;

@@ -35,14 +35,12 @@ TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
     script.rusage = rusage_info_v4{40 * kPage, 90 * kPage};
     script.ledgerBalances = std::vector<int64_t>{7, 3 * static_cast<int64_t>(kPage), 9};
 
-    auto process = created();
-    EXPECT_EQ(process->phys_heft(), 40 * kPage);
-    EXPECT_EQ(process->phys_heft_peak(), 90 * kPage);
-    EXPECT_EQ(process->ledgers()[0], 3 * kPage);
+    auto process = gathered();
     EXPECT_EQ(process->idleExitStatus(), HTIdleExitStatusNotControlled);
-    // Linux maps no shared library cache.
-    EXPECT_EQ(process->sharedRegionBase(), 0u);
-    EXPECT_EQ(process->sharedRegionSize(), 0u);
+    // The page-table ledger becomes a region of its own.
+    ASSERT_EQ(process->memoryRegions().size(), 1u);
+    EXPECT_EQ(process->memoryRegions()[0]->name(), "page table");
+    EXPECT_EQ(process->memoryRegions()[0]->dirtySize(), 3 * kPage);
 
     auto data = process->auxData();
     ASSERT_NE(data, nullptr);
@@ -54,7 +52,8 @@ TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
     platform_->addProcess(kPid + 1, 1, "other").ledgerBalances = std::vector<int64_t>{0, -5, 0};
     auto other = std::make_shared<HTUserProcess>(platform_);
     ASSERT_TRUE(other->initWithBsdInfo(platform_->process(kPid + 1)->info));
-    EXPECT_EQ(other->ledgers()[0], 0u);
+    other->gatherData();
+    EXPECT_TRUE(other->memoryRegions().empty());
     EXPECT_EQ(platform_->ledgerTemplateReads, 1);
     // No physical heft, no auxiliary data.
     EXPECT_EQ(other->auxData(), nullptr);
