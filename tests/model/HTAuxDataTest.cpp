@@ -62,12 +62,3 @@ TEST(HTAuxData, NestedMapsMergeAndDropOut)
 
     EXPECT_DEATH(HTAuxDataMap::mergeAuxDatum(datum(1, true), map({})), "HTAuxData.*datum1->isContainer");
 }
-
-TEST(HTAuxData, ReplacingKeepsKeyOrder)
-{
-    auto data = map({{"z", datum(1, false)}, {"Maps", map({{"b", datum(2, false)}})}});
-    data->set("z", datum(9, false));
-    ASSERT_EQ(data->size(), 2u);
-    EXPECT_EQ(data->begin()->first, "z");
-    EXPECT_EQ(std::static_pointer_cast<HTAuxData>(data->find("z"))->value(), 9);
-}
