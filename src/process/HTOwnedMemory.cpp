@@ -11,7 +11,7 @@
 
 namespace {
 
-constexpr const char* kModule = "HTUserProcess";
+constexpr const char* kModule = "HTOwnedMemory";
 constexpr const char* kOwnedVmObjectsSetting = "vm.get_owned_vmobjects";
 // Room for 16 more owned-object records each time the list is asked for,
 // for objects created between two asks.

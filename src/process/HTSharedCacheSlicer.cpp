@@ -11,7 +11,7 @@
 
 namespace {
 
-constexpr const char* kModule = "HTUserProcess";
+constexpr const char* kModule = "HTSharedCacheSlicer";
 
 // A page of a shared-cache piece counts as dirty when the kernel says so or
 // when it is resident anonymous memory.
