@@ -46,7 +46,7 @@ bool HTPointerIndex::contains(const void* pointer) const
 
 std::pair<uint32_t, bool> HTPointerIndex::insert(const void* pointer)
 {
-    HT_ASSERT("HTPointerIndex", pointer != nullptr, "pointer != nil");
+    HT_ASSERT("HTPointerIndex", pointer != nullptr, "pointer != nullptr");
     if (slots_.empty()) allocate(slotCountFor(capacityHint_));
     size_t slot = slotFor(pointer);
     if (slots_[slot].pointer) return {slots_[slot].number, false};

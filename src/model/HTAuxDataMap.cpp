@@ -6,30 +6,24 @@
 void HTAuxDataMap::set(const std::string& key, Value value)
 {
     HT_ASSERT("HTAuxData", value != nullptr, "value != nullptr");
-    auto found = index_.find(key);
-    if (found != index_.end()) {
-        entries_[found->second].second = std::move(value);
-        return;
-    }
-    index_.emplace(key, entries_.size());
-    entries_.emplace_back(key, std::move(value));
+    values_.set(key, std::move(value));
 }
 
 HTAuxDataMap::Value HTAuxDataMap::find(const std::string& key) const
 {
-    auto found = index_.find(key);
-    return found == index_.end() ? nullptr : entries_[found->second].second;
+    const Value* found = values_.find(key);
+    return found ? *found : nullptr;
 }
 
 std::shared_ptr<HTAuxDataMap> HTAuxDataMap::mergeWithData(const std::shared_ptr<HTAuxDataMap>& other) const
 {
     auto merged = std::make_shared<HTAuxDataMap>();
-    for (const auto& [key, value] : entries_) {
+    for (const auto& [key, value] : values_) {
         if (Value result = mergeAuxDatum(value, other ? other->find(key) : nullptr)) merged->set(key, result);
     }
     if (other) {
         for (const auto& [key, value] : *other) {
-            if (index_.count(key)) continue;
+            if (values_.contains(key)) continue;
             if (Value result = mergeAuxDatum(value, nullptr)) merged->set(key, result);
         }
     }
@@ -39,7 +33,7 @@ std::shared_ptr<HTAuxDataMap> HTAuxDataMap::mergeWithData(const std::shared_ptr<
 HTAuxDataMap::Value HTAuxDataMap::mergeAuxDatum(const Value& datum1, const Value& datum2)
 {
     HT_ASSERT("HTAuxData", !datum2 || datum1->isContainer() == datum2->isContainer(),
-              "!datum2 || datum1.isContainer == datum2.isContainer");
+              "!datum2 || datum1->isContainer() == datum2->isContainer()");
     if (datum1->isContainer()) {
         // Maps are the only containers.
         const auto& map1 = static_cast<const HTAuxDataMap&>(*datum1);

@@ -1,13 +1,12 @@
 #pragma once
 
+#include "base/HTOrderedMap.h"
 #include "model/HTAuxDataType.h"
 
 #include <cstddef>
 #include <memory>
 #include <string>
-#include <unordered_map>
 #include <utility>
-#include <vector>
 
 // Auxiliary values under string keys; a value may itself be a map, to any
 // depth. Keys iterate in the order they were first set.
@@ -20,10 +19,10 @@ public:
     void set(const std::string& key, Value value);
     // The value under the key, or null.
     Value find(const std::string& key) const;
-    size_t size() const { return entries_.size(); }
-    bool empty() const { return entries_.empty(); }
-    std::vector<Entry>::const_iterator begin() const { return entries_.begin(); }
-    std::vector<Entry>::const_iterator end() const { return entries_.end(); }
+    size_t size() const { return values_.size(); }
+    bool empty() const { return values_.empty(); }
+    auto begin() const { return values_.begin(); }
+    auto end() const { return values_.end(); }
 
     bool isContainer() const override { return true; }
 
@@ -36,6 +35,5 @@ public:
     static Value mergeAuxDatum(const Value& datum1, const Value& datum2);
 
 private:
-    std::vector<Entry> entries_;
-    std::unordered_map<std::string, size_t> index_;
+    HTOrderedMap<std::string, Value> values_;
 };

@@ -23,7 +23,6 @@ public:
 
     explicit HTMemoryCategory(uint8_t segment, bool summary = false);
 
-    bool isSummary() const { return isSummary_; }
     uint8_t segment() const { return segment_; }
     const ObjectSet& memoryObjects() const { return memoryObjects_; }
     // The union of the members' regions, built when first asked for.

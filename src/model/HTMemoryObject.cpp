@@ -28,7 +28,7 @@ void HTMemoryObject::_addRegion(const std::shared_ptr<HTMemoryRegion>& region, u
                                 std::optional<int32_t> pid)
 {
     if (accurateSizes_) HT_FATAL("HTMemoryObject", "region added to a finalised object");
-    HT_ASSERT("HTMemoryObject", region != nullptr, "region != nil");
+    HT_ASSERT("HTMemoryObject", region != nullptr, "region != nullptr");
     memoryRegions_->append(region);
     // A region without an object id names and lists the object but counts
     // for nothing.

@@ -52,10 +52,8 @@ public:
     // For each process, the regions through which it maps the object; absent
     // when every process sees the object whole.
     const std::optional<ProcessRegionMap>& processMemoryRegions() const { return processMemoryRegions_; }
-    void setProcessMemoryRegions(std::optional<ProcessRegionMap> map) { processMemoryRegions_ = std::move(map); }
     // Null before the first counted region and after finalisation.
     const HTRangeList* rangeList() const { return rangeList_.get(); }
-    void setRangeList(std::unique_ptr<HTRangeList> list) { rangeList_ = std::move(list); }
 
     // Adds a region mapped by the process `pid`, whose pages are `pageSize`
     // bytes, recording it per process. Each region is added once: its pages

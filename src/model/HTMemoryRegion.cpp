@@ -1,7 +1,5 @@
 #include "model/HTMemoryRegion.h"
 
-#include "base/HTAssert.h"
-
 #include <array>
 #include <cstdio>
 #include <string_view>
@@ -114,12 +112,6 @@ const std::string& appSpecificTagName(uint32_t tag)
 
 HTMemoryRegion::HTMemoryRegion() = default;
 HTMemoryRegion::~HTMemoryRegion() = default;
-
-void HTMemoryRegion::setEnd(uint64_t end)
-{
-    HT_ASSERT("HTMemoryRegion", end >= start_, "end >= self.start");
-    size_ = end - start_;
-}
 
 std::optional<std::string> HTMemoryRegion::fullName() const
 {

@@ -86,8 +86,6 @@ public:
     // --- derived -----------------------------------------------------------
     // start + size; a region without an address has no end either.
     uint64_t end() const { return start_ == HTNoAddress ? HTNoAddress : start_ + size_; }
-    // Sets size so that the region ends at `end`, which must not lie below start.
-    void setEnd(uint64_t end);
     uint64_t wiredSize() const { return wired() ? size_ : 0; }
     bool isFake() const { return user_tag_ == HTFakeRegionTag; }
     // "name detailedName", or the name alone when there is no detail.

@@ -286,7 +286,7 @@ void HTRangeList::_addRange(const HTRangeListNode& added, uint64_t pageSize, HTR
 
 void HTRangeList::_addRangeList(const HTRangeList& other, uint64_t pageSize)
 {
-    HT_ASSERT("HTRangeList", &other != this, "rangeList != self");
+    HT_ASSERT("HTRangeList", &other != this, "&other != this");
     // The other list ascends, so each addition starts where the last one
     // left off (see _nodeBefore): one pass over both lists.
     HTRangeListTally tally;

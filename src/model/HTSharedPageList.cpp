@@ -27,7 +27,7 @@ HTMemoryTotals htTotalsForPageKind(HTPageKind kind, uint64_t bytes, bool wired)
 
 void HTSharedPageList::addPage(uint32_t page, HTPageKind kind, uint64_t identity)
 {
-    HT_ASSERT("HTSharedPageList", kind != HTPageKind::None, "kind != None");
+    HT_ASSERT("HTSharedPageList", kind != HTPageKind::None, "kind != HTPageKind::None");
     const bool identified = identity != 0;
     if (!runs_.empty()) {
         Run& last = runs_.back();

@@ -37,7 +37,6 @@ public:
     const std::vector<Run>& runs() const { return runs_; }
     // The identity of the run's `i`-th page; the run must be identified.
     uint64_t identity(const Run& run, uint32_t i) const { return identities_[run.firstIdentity + i]; }
-    bool hasIdentities() const { return !identities_.empty(); }
     size_t identifiedPages() const { return identities_.size(); }
 
 private:

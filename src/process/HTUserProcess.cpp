@@ -1,12 +1,10 @@
 #include "process/HTUserProcess.h"
 
 #include "base/HTAssert.h"
-#include "base/HTMix.h"
 #include "base/HTNoticeLog.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
-#include "model/HTSubrangeBuilder.h"
 #include "process/HTImage.h"
 #include "process/HTImageEnumerator.h"
 
@@ -16,13 +14,10 @@
 #include <cstdio>
 #include <cstring>
 #include <iterator>
-#include <mutex>
-#include <string_view>
 
 namespace {
 
 constexpr const char* kModule = "HTUserProcess";
-constexpr const char* kOwnedVmObjectsSetting = "vm.get_owned_vmobjects";
 constexpr const char* kBailOutNotice = "bailing out for process %s; data may be incomplete!";
 
 // What standard error says of processes that went away while heft read
@@ -33,21 +28,10 @@ constexpr const char* kExitedNotice =
 constexpr const char* kZombieNotice =
     "%s: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report";
 constexpr const char* kGoneBeforeOpenNotice = "%s: exited before it could be opened; not measured";
-// Room for 16 more owned-object records each time the list is asked for,
-// for objects created between two asks.
-constexpr size_t kOwnedVmObjectsHeadroom = 16 * sizeof(HTOwnedVmObject);
 // The bisection for the end of the private address space stops once its
 // interval is this small.
 constexpr uint64_t kBisectionResolution = 0x1000000;
-constexpr uint32_t kIOKitTag = 87;
 constexpr size_t kRegionPathLength = 1024;
-// Identities heft derives for regions of its own keep to the namespaces of
-// the platform's: the top bit for a file's pages, the top two bits 01 for
-// anonymous memory.
-constexpr uint64_t kFileIdentityBit = uint64_t{1} << 63;
-constexpr uint64_t kAnonymousIdentityBit = uint64_t{1} << 62;
-constexpr uint64_t kIdentityNamespaceBits = uint64_t{3} << 62;
-
 // The shared region that each platform code implies.
 struct SharedRegionLayout {
     uint64_t base;
@@ -61,33 +45,6 @@ constexpr SharedRegionLayout kSharedRegions[] = {
     {0x1A000000, 0x40000000},      // 4: 64-bit ARM with 32-bit pointers
     {0, 0},                        // 5: Linux, which has no shared library cache
 };
-
-uint64_t roundDown(uint64_t value, uint64_t unit) { return value / unit * unit; }
-uint64_t roundUp(uint64_t value, uint64_t unit) { return (value + unit - 1) / unit * unit; }
-
-// A page of a shared-cache piece counts as dirty when the kernel says so or
-// when it is resident anonymous memory.
-bool countsAsDirty(int32_t disposition)
-{
-    return (disposition & VM_PAGE_QUERY_PAGE_DIRTY) ||
-        ((disposition & VM_PAGE_QUERY_PAGE_PRESENT) && !(disposition & VM_PAGE_QUERY_PAGE_EXTERNAL));
-}
-
-HTPageKind pageKind(int32_t disposition, int32_t purgeState)
-{
-    if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT) return HTPageKind::Swapped;
-    if (disposition & VM_PAGE_QUERY_PAGE_DIRTY) return HTPageKind::Dirty;
-    // A volatile object may lose any present page; elsewhere only pages
-    // marked reusable can be taken back.
-    int32_t reclaimableBit =
-        purgeState == VM_PURGABLE_VOLATILE ? VM_PAGE_QUERY_PAGE_PRESENT : VM_PAGE_QUERY_PAGE_REUSABLE;
-    if (disposition & reclaimableBit) return HTPageKind::Reclaimable;
-    if (disposition & VM_PAGE_QUERY_PAGE_PRESENT) return HTPageKind::Clean;
-    return HTPageKind::None;
-}
-
-// A 64-bit mix of two values, for identities derived from another.
-uint64_t mixIdentity(uint64_t id, uint64_t salt) { return htMix(id ^ (salt * 0x9e3779b97f4a7c15ULL)); }
 
 // strerror_r comes in two flavours; both give the text here.
 [[maybe_unused]] const char* errnoText(int result, const char* buffer)
@@ -104,103 +61,7 @@ std::atomic<bool> outOfDescriptorsSaid{false};
 // The errno a platform call's failure carries; 0 for a kernel code.
 int errnoOf(kern_return_t code) { return (code & ~0xffff) == HT_KERN_ERRNO_BASE ? code & 0xffff : 0; }
 
-// The ledger template, read once per run by whichever process asks first.
-struct LedgerTemplate {
-    bool read = false;
-    bool known = false;
-    int entryCount = 0;
-    std::optional<size_t> pageTableIndex;
-};
-std::mutex ledgerTemplateLock;
-LedgerTemplate ledgerTemplateState;
-
-LedgerTemplate ledgerTemplate(HTPlatform& platform)
-{
-    std::lock_guard<std::mutex> guard(ledgerTemplateLock);
-    if (ledgerTemplateState.read) return ledgerTemplateState;
-    ledgerTemplateState = LedgerTemplate{};
-    ledgerTemplateState.read = true;
-
-    int room = 80;
-    std::vector<ledger_template_info> entries;
-    int count = 0;
-    while (true) {
-        entries.assign(static_cast<size_t>(room), ledger_template_info{});
-        count = room;
-        if (platform.ledger_template(entries.data(), &count) < 0) {
-            std::perror("Unable to retrieve ledger template info");
-            return ledgerTemplateState;
-        }
-        // A full array may have left entries out.
-        if (count < room) break;
-        room *= 2;
-    }
-    ledgerTemplateState.known = true;
-    ledgerTemplateState.entryCount = count;
-    for (int i = 0; i < count; ++i) {
-        const char* name = entries[static_cast<size_t>(i)].lti_name;
-        if (std::string_view(name, strnlen(name, sizeof(entries[0].lti_name))) == "page_table") {
-            ledgerTemplateState.pageTableIndex = static_cast<size_t>(i);
-            break;
-        }
-    }
-    return ledgerTemplateState;
-}
-
 }  // namespace
-
-// --- owned VM objects ------------------------------------------------------------
-
-uint64_t HTOwnedVmObject::ownedDirtySize() const
-{
-    if (flags & 0x1) return 0;
-    switch ((flags >> 4) & 0x3) {
-    case VM_PURGABLE_VOLATILE:
-    case VM_PURGABLE_EMPTY:
-        return wired_size;
-    default:
-        return resident_size > reusable_size ? resident_size - reusable_size : 0;
-    }
-}
-
-uint64_t HTOwnedVmObject::ownedSwappedSize() const
-{
-    if (flags & 0x1) return 0;
-    switch ((flags >> 4) & 0x3) {
-    case VM_PURGABLE_VOLATILE:
-    case VM_PURGABLE_EMPTY:
-        return 0;
-    default:
-        return compressed_size;
-    }
-}
-
-void HTOwnedVmObjectMap::set(const HTOwnedVmObject& object)
-{
-    auto found = index_.find(object.object_id);
-    if (found != index_.end()) {
-        entries_[found->second] = object;
-        return;
-    }
-    index_.emplace(object.object_id, entries_.size());
-    entries_.emplace_back(object);
-}
-
-std::optional<HTOwnedVmObject> HTOwnedVmObjectMap::take(uint64_t objectId)
-{
-    auto found = index_.find(objectId);
-    if (found == index_.end()) return std::nullopt;
-    std::optional<HTOwnedVmObject> taken;
-    taken.swap(entries_[found->second]);
-    index_.erase(found);
-    return taken;
-}
-
-void HTOwnedVmObjectMap::forEach(const std::function<void(const HTOwnedVmObject&)>& visit) const
-{
-    for (const auto& entry : entries_)
-        if (entry) visit(*entry);
-}
 
 // --- creation ---------------------------------------------------------------------
 
@@ -216,7 +77,6 @@ bool HTUserProcess::initWithBsdInfo(const proc_bsdinfo& info)
     _gatherPhysHeft();
     _gatherLedgers();
     _gatherIdleExitStatus();
-    sharedRegionAlignmentSize_ = 4096;
     return true;
 }
 
@@ -268,30 +128,21 @@ void HTUserProcess::_gatherPhysHeft()
     phys_heft_peak_ = usage.ri_lifetime_max_phys_heft;
 }
 
-void HTUserProcess::_forgetLedgerTemplate()
-{
-    std::lock_guard<std::mutex> guard(ledgerTemplateLock);
-    ledgerTemplateState = LedgerTemplate{};
-}
+void HTUserProcess::_forgetLedgerTemplate() { HTOwnedMemory::forgetLedgerTemplate(); }
 
 void HTUserProcess::_forgetOutOfDescriptors() { outOfDescriptorsSaid = false; }
 
 void HTUserProcess::_gatherLedgers()
 {
     if (!breakDownPhysHeft() || !_isAlive()) return;
-    LedgerTemplate layout = ledgerTemplate(platform());
-    if (!layout.known || !layout.pageTableIndex) return;
-
-    std::vector<ledger_entry_info> entries(static_cast<size_t>(layout.entryCount));
-    int count = layout.entryCount;
-    if (platform().ledger_entries(pid(), entries.data(), &count) < 0) {
+    std::optional<uint64_t> balance;
+    int error = 0;
+    if (!HTOwnedMemory::readPageTableLedger(platform(), pid(), balance, error)) {
+        errno = error;
         _addErrnoWarningWithDescription("Unable to retrieve ledger entry info");
         return;
     }
-    HT_ASSERT(kModule, count >= 0 && *layout.pageTableIndex < static_cast<size_t>(count),
-              "page_table ledger index < entry count");
-    int64_t balance = entries[*layout.pageTableIndex].lei_balance;
-    ledgers_[0] = balance < 0 ? 0 : static_cast<uint64_t>(balance);
+    if (balance) ledgers_[0] = *balance;
 }
 
 void HTUserProcess::_gatherIdleExitStatus()
@@ -322,41 +173,13 @@ void HTUserProcess::_gatherImageData()
 std::optional<HTOwnedVmObjectMap> HTUserProcess::_gatherOwnedVmObjects()
 {
     if (!breakDownPhysHeft()) return std::nullopt;
-    const int32_t target = task_ ? task_->pid() : pid();
-
-    size_t length = 0;
-    if (platform().sysctlbyname(kOwnedVmObjectsSetting, nullptr, &length, &target, sizeof(target)) != 0) {
-        // A kernel without the facility: the process owns nothing to report.
-        if (errno != ENOENT) _addErrnoWarningWithDescription(kOwnedVmObjectsSetting);
-        return std::nullopt;
-    }
-    HTOwnedVmObjectMap objects;
-    if (length == 0) return objects;
-
-    // Objects may appear between two asks: ask again while the answer
-    // fills the buffer to the last byte.
-    std::vector<unsigned char> buffer;
-    size_t answered = 0;
-    do {
-        length += kOwnedVmObjectsHeadroom;
-        buffer.resize(length);
-        answered = length;
-        if (platform().sysctlbyname(kOwnedVmObjectsSetting, buffer.data(), &answered, &target, sizeof(target)) != 0) {
-            _addErrnoWarningWithDescription(kOwnedVmObjectsSetting);
-            return std::nullopt;
-        }
-    } while (answered == length);
-
-    if (answered == 0) return objects;
-    HT_ASSERT(kModule, answered >= sizeof(uint64_t), "owned object list holds its count");
-    uint64_t count = 0;
-    std::memcpy(&count, buffer.data(), sizeof(count));
-    HT_ASSERT(kModule, count <= (answered - sizeof(uint64_t)) / sizeof(HTOwnedVmObject),
-              "owned object list holds count records");
-    for (uint64_t i = 0; i < count; ++i) {
-        HTOwnedVmObject object;
-        std::memcpy(&object, buffer.data() + sizeof(uint64_t) + i * sizeof(HTOwnedVmObject), sizeof(object));
-        objects.set(object);
+    bool failed = false;
+    int error = 0;
+    std::optional<HTOwnedVmObjectMap> objects =
+        HTOwnedMemory::readOwnedVmObjects(platform(), task_ ? task_->pid() : pid(), failed, error);
+    if (failed) {
+        errno = error;
+        _addErrnoWarningWithDescription("vm.get_owned_vmobjects");
     }
     return objects;
 }
@@ -549,301 +372,38 @@ void HTUserProcess::enumerateRegions(const RegionCallback& callback)
     }
 }
 
-// --- shared-cache pieces -----------------------------------------------------------
+// --- pages ---------------------------------------------------------------------------
 
-bool HTUserProcess::_addRegionsToArray(std::vector<std::shared_ptr<HTMemoryRegion>>& regions, uint64_t start,
-                                       uint64_t size, const vm_region_submap_info_64& info,
-                                       HTImageEnumerator& enumerator)
+bool HTUserProcess::_checkPageQuery(kern_return_t result)
 {
-    pendingUnusedSharedRegion_.reset();
-    const uint64_t alignment = sharedRegionAlignmentSize_;
-    const uint64_t page = pageSize();
-    const bool writable = (info.max_protection & VM_PROT_WRITE) != 0;
-    const uint64_t end = start + size;
-
-    auto makePiece = [&](uint64_t from, uint64_t to) {
-        auto piece = std::make_shared<HTMemoryRegion>();
-        piece->setStart(from);
-        piece->setSize(to - from);
-        piece->setUser_tag(info.user_tag);
-        piece->setObject_id(info.object_id_full);
-        piece->setShare_mode(info.share_mode);
-        piece->setOffset(info.offset + (from - start));
-        piece->setInSharedCache(true);
-        piece->setWired(info.user_wired_count != 0);
-        return piece;
-    };
-
-    std::shared_ptr<HTImage> image = enumerator.nextImageForStart(start, end);
-    uint64_t cursor = start;
-    while (cursor < end) {
-        if (!image || cursor < image->start()) {
-            const uint64_t to = image ? std::min(image->start(), end) : end;
-            auto piece = makePiece(cursor, to);
-            piece->setName("unused rtld shared cache area");
-            piece->setUnusedSharedCacheRegion(true);
-            // Only a piece that shares a page with its neighbour needs
-            // measuring; the rest of an unused area holds nothing.
-            if (writable && (cursor % page != 0 || to % page != 0) &&
-                !_populateMemoryRegionWithPageQueries(piece, info))
-                return false;
-            regions.push_back(piece);
-            cursor = to;
-            if (cursor >= end || !image) return true;
-        }
-
-        const uint64_t pieceStart = std::max(cursor, image->start());
-        uint64_t pieceEnd = std::min(image->end(), end);
-        std::shared_ptr<HTImage> next = enumerator.nextImageForStart(pieceEnd, end);
-        if (pieceEnd <= pieceStart) {
-            // An empty segment holds nothing; one the enumerator keeps
-            // answering would hold the walk here for good.
-            if (next == image) return true;
-            image = next;
-            continue;
-        }
-        const uint64_t nextStart = next ? next->start() : 0;
-        // Segments laid out on alignment boundaries own the padding up to
-        // the next boundary.
-        if (next != image && pieceStart % alignment == 0 && nextStart % alignment == 0)
-            pieceEnd = roundUp(pieceEnd, alignment);
-
-        auto piece = makePiece(pieceStart, pieceEnd);
-        piece->setName(image->name());
-        piece->setDetailedName(image->segment() == HTSegmentLinkEdit ? std::string("rtld shared cache")
-                                                                     : image->ownerPath());
-        piece->setSegment(image->segment());
-        if (writable && !_populateMemoryRegionWithPageQueries(piece, info)) return false;
-        regions.push_back(piece);
-        cursor = pieceEnd;
-        image = next;
-    }
-    return true;
-}
-
-// --- page dispositions -------------------------------------------------------------
-
-bool HTUserProcess::_enumerateDispositionChunksWithStartAddr(uint64_t start, uint64_t pages, bool populatedOnly,
-                                                             const DispositionChunkCallback& block)
-{
-    if (pages == 0) return true;
-    HT_ASSERT(kModule, task_ != nullptr, "task");
-    const uint64_t page = pageSize();
-    const uint64_t end = start + pages * page;
-    thread_local std::vector<HTPageRun> runs;
-    if (populatedOnly)
-        platform().populatedRuns(*task_, start, end, runs);
-    else
-        runs.assign(1, HTPageRun{start, end, 0});
-
-    int32_t dispositions[kDispositionChunkPages];
-    for (const HTPageRun& run : runs) {
-        const uint64_t from = std::max(start, roundDown(run.start, page));
-        const uint64_t to = std::min(end, roundUp(run.end, page));
-        if (run.disposition != 0 && from < to) {
-            block(nullptr, run.disposition, (to - from) / page, (from - start) / page);
-            continue;
-        }
-        for (uint64_t address = from; address < to; address += kDispositionChunkPages * page) {
-            const uint64_t wanted = std::min((to - address) / page, kDispositionChunkPages);
-            uint64_t count = wanted;
-            kern_return_t result =
-                platform().mach_vm_page_range_query(*task_, address, wanted * page, dispositions, &count);
-            if (result != KERN_SUCCESS) {
-                const HTCallFailure failure = _processMachVMError(result, KERN_INVALID_ARGUMENT);
-                if (!_saidOutOfDescriptors(errnoOf(result)))
-                    _addFailureNotice(failure,
-                                      "%s: its pages could not be read (" + platform().mach_error_string(result) +
-                                          "); data may be incomplete");
-                return false;
-            }
-            block(dispositions, 0, std::min(count, wanted), (address - start) / page);
-        }
-    }
-    return true;
+    if (result == KERN_SUCCESS) return true;
+    const HTCallFailure failure = _processMachVMError(result, KERN_INVALID_ARGUMENT);
+    if (!_saidOutOfDescriptors(errnoOf(result)))
+        _addFailureNotice(failure,
+                          "%s: its pages could not be read (" + platform().mach_error_string(result) +
+                              "); data may be incomplete");
+    return false;
 }
 
 bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<HTMemoryRegion>& region,
-                                                         const vm_region_submap_info_64& info)
+                                                         const vm_region_submap_info_64&)
 {
-    HTMemoryRegion& piece = *region;
-    HT_ASSERT(kModule, piece.dirtySize() == 0, "memoryRegion.dirtySize == 0");
-    HT_ASSERT(kModule, piece.swappedSize() == 0, "memoryRegion.swappedSize == 0");
-    const uint64_t page = pageSize();
-    const uint64_t start = piece.start();
-    const uint64_t end = piece.end();
-    const uint64_t size = piece.size();
-    const uint64_t alignedStart = roundDown(start, page);
-    const uint64_t alignedEnd = roundUp(end, page);
-    // The piece's bytes in its first page.
-    const uint64_t firstPageBytes = std::min(page - (start - alignedStart), size);
+    HT_ASSERT(kModule, task_ != nullptr, "task_ != nullptr");
+    if (!sharedCache_) sharedCache_.emplace(pageSize());
+    return _checkPageQuery(sharedCache_->measurePiece(region, HTPageRunWalker(platform(), *task_, pageSize())));
+}
 
-    uint64_t dirty = 0;
-    uint64_t swapped = 0;
-    auto count = [&](int32_t disposition, uint64_t amount) {
-        if (countsAsDirty(disposition))
-            dirty += amount;
-        else if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT)
-            swapped += amount;
-    };
-
-    uint64_t pages = (alignedEnd - alignedStart) / page;
-    uint64_t queryStart = alignedStart;
-    // The first page is the last page of the piece before, already queried.
-    const bool firstPageCached = alignedStart == cachedDispositionAddress_;
-    if (firstPageCached) {
-        count(cachedDisposition_, firstPageBytes);
-        --pages;
-        queryStart += page;
-    }
-
-    if (piece.unusedSharedCacheRegion()) {
-        // Unused areas are not queried: only their partial pages, shared
-        // with a neighbour, hold anything, and the neighbour's query
-        // measures them.
-        if (firstPageCached) {
-            piece.setDirtySize(dirty);
-            piece.setSwappedSize(swapped);
-        } else if (start % page != 0) {
-            HT_FATAL(kModule, "Unused shared cache region has no cache entry for non-page-aligned start address");
-        }
-        if (end % page != 0 && pages != 0) pendingUnusedSharedRegion_ = region;
-        return true;
-    }
-
-    const bool ok = _enumerateDispositionChunksWithStartAddr(
-        queryStart, pages, false, [&](const int32_t* dispositions, int32_t, uint64_t filled, uint64_t firstPage) {
-            for (uint64_t i = 0; i < filled; ++i) {
-                const uint64_t index = firstPage + i;
-                const int32_t disposition = dispositions[i];
-                const bool partialFirst = index == 0 && !firstPageCached && start % page != 0;
-                const bool partialLast = index == pages - 1 && end % page != 0;
-                uint64_t amount = page;
-                if (partialFirst) {
-                    amount = firstPageBytes;
-                } else if (partialLast) {
-                    amount = end - (alignedEnd - page);
-                    HT_ASSERT(kModule, amount <= size, "lastPageBytes <= memoryRegion.size");
-                }
-                count(disposition, amount);
-
-                if (partialFirst && pendingUnusedSharedRegion_) {
-                    // The unused piece before this one ends in this page.
-                    HTMemoryRegion& pending = *pendingUnusedSharedRegion_;
-                    HT_ASSERT(kModule, pending.end() == start, "pendingUnusedSharedRegion.end == memoryRegion.start");
-                    const uint64_t pendingBytes = pending.end() - roundUp(pending.end(), page) + page;
-                    HT_ASSERT(kModule, pendingBytes <= pending.size(),
-                              "pendingBytes <= pendingUnusedSharedRegion.size");
-                    if (countsAsDirty(disposition))
-                        pending.setDirtySize(pending.dirtySize() + pendingBytes);
-                    else if (disposition & VM_PAGE_QUERY_PAGE_PAGED_OUT)
-                        pending.setSwappedSize(pending.swappedSize() + pendingBytes);
-                    pendingUnusedSharedRegion_.reset();
-                }
-                if (partialLast) {
-                    // The next piece starts in this page.
-                    cachedDispositionAddress_ = alignedEnd - page;
-                    cachedDisposition_ = disposition;
-                }
-            }
-        });
-    piece.setSwappedSize(swapped);
-    piece.setDirtySize(dirty);
-    return ok;
+void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const HTPageRunWalker::PageTargets& targets,
+                                       int32_t purgeState)
+{
+    HT_ASSERT(kModule, task_ != nullptr, "task_ != nullptr");
+    _checkPageQuery(HTPageRunWalker(platform(), *task_, pageSize()).walkPages(region, targets, purgeState));
 }
 
 void HTUserProcess::_addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState)
 {
-    HT_ASSERT(kModule, !region.ownedExclusivelyByParentProcess(), "!memoryRegion.ownedExclusivelyByParentProcess");
-    _walkPagesOfRegion(region, PageTargets{&region, nullptr, false}, purgeState);
-}
-
-void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState)
-{
-    const uint64_t page = pageSize();
-    const uint64_t from = roundDown(region.start(), page);
-    const uint64_t pages = (roundUp(region.end(), page) - from) / page;
-    HTSharedPageList* list = targets.identify && targets.pages ? &targets.pages->makeSharedPageList() : nullptr;
-    HTSubrangeBuilder runs(list ? nullptr : targets.pages, page);
-    HTSubrangeBuilder fileRuns(targets.filePages, page);
-    const bool separateCopies = targets.filePages != nullptr || targets.copiesOnly;
-    uint64_t identities[kDispositionChunkPages];
-    // A run of pages of one disposition, which the kernel knows to hold no
-    // page another process maps privately.
-    auto addUniformRun = [&](uint64_t first, uint64_t count, int32_t disposition) {
-        const HTPageKind kind = pageKind(disposition, purgeState);
-        if (kind == HTPageKind::None) return;
-        if (separateCopies && (disposition & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
-            fileRuns.addRun(targets.filePages ? targets.filePages->offset() + first * page : 0, count * page, kind);
-        } else if (list) {
-            for (uint64_t index = first; index < first + count; ++index)
-                list->addPage(static_cast<uint32_t>(index), kind, 0);
-        } else {
-            runs.addRun(targets.pages->offset() + first * page, count * page, kind);
-        }
-    };
-
-    // A failed query is recorded on the process; the runs found so far stay.
-    _enumerateDispositionChunksWithStartAddr(
-        from, pages, true, [&](const int32_t* dispositions, int32_t uniform, uint64_t filled, uint64_t first) {
-            if (dispositions == nullptr) {
-                addUniformRun(first, filled, uniform);
-                return;
-            }
-            const bool named = list &&
-                platform().sharedPageIdentities(*task_, from + first * page, filled, identities) == KERN_SUCCESS;
-            for (uint64_t i = 0; i < filled; ++i) {
-                const HTPageKind kind = pageKind(dispositions[i], purgeState);
-                if (kind == HTPageKind::None) continue;
-                // In a private file mapping the file's own pages and the
-                // mapping's copies belong to different objects.
-                const uint64_t index = first + i;
-                if (separateCopies && (dispositions[i] & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
-                    fileRuns.add(targets.filePages ? targets.filePages->offset() + index * page : 0, kind);
-                } else if (list) {
-                    list->addPage(static_cast<uint32_t>(index), kind, named ? identities[i] : 0);
-                } else {
-                    runs.add(targets.pages->offset() + index * page, kind);
-                }
-            }
-        });
-}
-
-std::shared_ptr<HTMemoryRegion> HTUserProcess::_splitCopiedPages(HTMemoryRegion& region,
-                                                                 const vm_region_submap_info_64& info)
-{
-    const uint64_t copied = pageSize() * info.pages_shared_now_private;
-    const uint64_t swapped = region.swappedSize();
-    if (copied == 0 && swapped == 0) return nullptr;
-
-    auto copies = std::make_shared<HTMemoryRegion>();
-    copies->setStart(region.start());
-    copies->setSize(region.size());
-    copies->setUser_tag(region.user_tag());
-    copies->setShare_mode(region.share_mode());
-    copies->setWired(region.wired());
-    copies->setSegment(region.segment());
-    copies->setName(region.name());
-    copies->setDetailedName(region.detailedName());
-    // Copies are anonymous memory of this mapping in this process; pages
-    // still shared after a fork are told apart by their identities.
-    const uint64_t id = mixIdentity(mixIdentity(region.object_id(), region.start()), static_cast<uint32_t>(pid()));
-    copies->setObject_id((id & ~kIdentityNamespaceBits) | kAnonymousIdentityBit);
-
-    // Every page swapped out is a copy (file pages go back to their file);
-    // copies are dirty first, and at most what the mapping holds.
-    const uint64_t dirty = std::min(copied, region.dirtySize());
-    const uint64_t reclaimable = std::min(region.reclaimableSize(), copied - dirty);
-    const uint64_t clean = std::min(region.cleanNonSpecSize(), copied - dirty - reclaimable);
-    copies->setDirtySize(dirty);
-    copies->setReclaimableSize(reclaimable);
-    copies->setCleanNonSpecSize(clean);
-    copies->setSwappedSize(swapped);
-    region.setDirtySize(region.dirtySize() - dirty);
-    region.setReclaimableSize(region.reclaimableSize() - reclaimable);
-    region.setCleanNonSpecSize(region.cleanNonSpecSize() - clean);
-    region.setSwappedSize(0);
-    return copies;
+    HT_ASSERT(kModule, !region.ownedExclusivelyByParentProcess(), "!region.ownedExclusivelyByParentProcess()");
+    _walkPagesOfRegion(region, HTPageRunWalker::PageTargets{&region, nullptr, false}, purgeState);
 }
 
 void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies, const vm_region_submap_info_64& info,
@@ -865,7 +425,7 @@ void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies
         return;
     }
     HTMemoryRegion& pages = copies ? *copies : region;
-    PageTargets targets;
+    HTPageRunWalker::PageTargets targets;
     if (identify || (subranges && pages.eligibleForSubrangesUsingPageSize(page))) targets.pages = &pages;
     targets.identify = identify;
     targets.copiesOnly = copies != nullptr;
@@ -895,14 +455,19 @@ void HTUserProcess::_gatherMemoryData()
     const bool hidden = hiddenFromDisplay();
     const bool breakDown = breakDownPhysHeft();
     const bool linux = _platformCode() == HTPlatformLinux;
-    std::shared_ptr<HTMemoryRegion> fakeRegion;
-    uint64_t ownedTotal = 0;
+    HTOwnedMemory owned(std::move(ownedVmObjects_));
+    ownedVmObjects_.reset();
+    if (!sharedCache_) sharedCache_.emplace(page);
+    const HTSharedCacheSlicer::MeasureCallback measurePiece = [this](const std::shared_ptr<HTMemoryRegion>& piece,
+                                                                     const vm_region_submap_info_64& pieceInfo) {
+        return _populateMemoryRegionWithPageQueries(piece, pieceInfo);
+    };
 
     enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64& info, int32_t purgeState,
                          const std::optional<std::string>& path) -> bool {
         if (start >= sharedRegionBase_ && start - sharedRegionBase_ < sharedRegionSize_) {
             if (hidden) return false;
-            if (!_addRegionsToArray(regions, start, size, info, enumerator)) {
+            if (!sharedCache_->addRegions(regions, start, size, info, enumerator, measurePiece)) {
                 // The failed page query has told of a process that went
                 // away; one still there bails out as the walk does.
                 if (!errors().empty()) HTNoticeLog::standardError().add(kBailOutNotice, pid(), displayString());
@@ -946,8 +511,8 @@ void HTUserProcess::_gatherMemoryData()
             if (info.user_tag == HTFakeRegionTag) {
                 // The owned-object list accounts for unmapped owned memory
                 // itself when there is one.
-                if (ownedVmObjects_) return false;
-                fakeRegion = region;
+                if (owned.hasObjectList()) return false;
+                owned.setFakeRegion(region);
                 if (info.object_id_full == 0) region->setObject_id(info.object_id);
             }
             break;
@@ -965,31 +530,7 @@ void HTUserProcess::_gatherMemoryData()
             region->setDetailedName(path);
         } else {
             region->setName(HTMemoryRegion::categoryNameForTag(info.user_tag));
-            if (breakDown) {
-                bool owned = false;
-                uint64_t ownedDirty = 0;
-                uint64_t ownedSwapped = 0;
-                std::optional<HTOwnedVmObject> object;
-                if (ownedVmObjects_ && (object = ownedVmObjects_->take(info.object_id_full))) {
-                    owned = true;
-                    ownedDirty = object->ownedDirtySize();
-                    ownedSwapped = object->ownedSwappedSize();
-                    region->setReclaimableSize(object->reusable_size);
-                } else if (!ownedVmObjects_ && purgeState != VM_PURGABLE_DENY && info.user_tag != kIOKitTag &&
-                           info.pages_resident != 0) {
-                    // Without the owned-object list, purgeable memory is
-                    // taken to belong to the process that maps it.
-                    owned = true;
-                    ownedDirty = region->dirtySize() + region->cleanNonSpecSize();
-                }
-                if (owned) {
-                    region->setOwnedExclusivelyByParentProcess(true);
-                    ownedTotal += ownedDirty + ownedSwapped;
-                    region->setDirtySize(ownedDirty);
-                    region->setCleanNonSpecSize(0);
-                    region->setSwappedSize(ownedSwapped);
-                }
-            }
+            if (breakDown) owned.chargeAnonymousRegion(*region, info, purgeState);
         }
 
         std::shared_ptr<HTMemoryRegion> copies;
@@ -999,8 +540,8 @@ void HTUserProcess::_gatherMemoryData()
             // own, the same in every process that maps the image, so that
             // two segments of one file never pass for one.
             if (region->segment() == HTSegmentOther)
-                region->setObject_id(mixIdentity(region->object_id(), region->offset()) | kFileIdentityBit);
-            copies = _splitCopiedPages(*region, info);
+                region->setObject_id(HTPageRunWalker::fileSegmentIdentity(region->object_id(), region->offset()));
+            copies = HTPageRunWalker::splitCopiedPages(*region, info, page, pid());
             // The file's pages belong to the file, shared with every process
             // that maps it, dirty or not: only the copies are this
             // process's own.
@@ -1008,69 +549,13 @@ void HTUserProcess::_gatherMemoryData()
         }
         _measurePages(*region, copies.get(), info, purgeState);
 
-        if (region != fakeRegion) regions.push_back(region);
+        if (!owned.isFakeRegion(region)) regions.push_back(region);
         if (copies) regions.push_back(copies);
         return false;
     });
 
-    // Owned objects that no region maps.
-    if (ownedVmObjects_) {
-        ownedVmObjects_->forEach([&](const HTOwnedVmObject& object) {
-            auto region = std::make_shared<HTMemoryRegion>();
-            region->setObject_id(object.object_id);
-            region->setOwnedExclusivelyByParentProcess(true);
-            region->setUser_tag(HTFakeRegionTag);
-            region->setName(HTMemoryRegion::categoryNameForTag(HTFakeRegionTag));
-            region->setSize(object.virtual_size);
-            region->setReclaimableSize(object.reusable_size);
-            region->setStart(HTNoAddress);
-            region->setShare_mode(SM_SHARED);
-            region->setDirtySize(object.ownedDirtySize());
-            region->setSwappedSize(object.ownedSwappedSize());
-            region->setWired(object.wired_size != 0);
-            regions.push_back(region);
-        });
-        ownedVmObjects_.reset();
-    }
-
-    // The kernel's fake region counts all owned memory that is not mapped,
-    // including what the regions above already charged; take that out.
-    if (fakeRegion) {
-        uint64_t remaining = ownedTotal;
-        if (fakeRegion->dirtySize() < remaining) {
-            remaining -= fakeRegion->dirtySize();
-            fakeRegion->setDirtySize(0);
-            if (fakeRegion->swappedSize() >= remaining) {
-                fakeRegion->setSwappedSize(fakeRegion->swappedSize() - remaining);
-            } else {
-                remaining -= fakeRegion->swappedSize();
-                char message[1024];
-                std::snprintf(message, sizeof(message),
-                              "%s: Heft changed while analyzing \u2013 unmapped owned physical heft may be "
-                              "over-counted by %llu bytes",
-                              displayString().c_str(), static_cast<unsigned long long>(remaining));
-                warnings().push_back(message);
-                fakeRegion->setSwappedSize(0);
-            }
-        } else {
-            fakeRegion->setDirtySize(fakeRegion->dirtySize() - remaining);
-        }
-        if (fakeRegion->dirtySize() + fakeRegion->swappedSize() != 0) {
-            fakeRegion->setStart(HTNoAddress);
-            regions.push_back(fakeRegion);
-        }
-    }
-
-    if (breakDown && ledgers_[0] != 0) {
-        auto pageTables = std::make_shared<HTMemoryRegion>();
-        pageTables->setName("page table");
-        pageTables->setSize(ledgers_[0]);
-        pageTables->setDirtySize(ledgers_[0]);
-        pageTables->setStart(HTNoAddress);
-        pageTables->setObject_id(0xFFFFFFFFFFFFFFFF);
-        pageTables->setShare_mode(SM_PRIVATE);
-        regions.push_back(pageTables);
-    }
+    owned.addUnmappedMemory(regions, warnings(), displayString());
+    if (breakDown && ledgers_[0] != 0) HTOwnedMemory::addPageTables(regions, ledgers_[0]);
 
     setMemoryRegions(std::move(regions));
 }

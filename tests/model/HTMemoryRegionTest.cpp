@@ -37,10 +37,7 @@ std::pair<bool, bool> eligibility(const std::function<void(HTMemoryRegion&)>& ch
 TEST(HTMemoryRegion, EndAndOrder)
 {
     EXPECT_EQ(region(HTNoAddress, 5 * kPage)->end(), HTNoAddress);
-    auto r = region(0x1000, 0x1000);
-    r->setEnd(0x5000);
-    EXPECT_EQ(r->size(), 0x4000u);
-    EXPECT_DEATH(r->setEnd(0xFFF), "HTMemoryRegion.*end >= self.start");
+    EXPECT_EQ(region(0x1000, 0x4000)->end(), 0x5000u);
 
     std::vector<std::shared_ptr<HTMemoryRegion>> regions{region(0x1000, 0x1000), region(0x1000, 0x3000),
                                                          region(0x800, 0x100)};

@@ -5,6 +5,7 @@
 #include "model/HTAuxDataMap.h"
 
 #include <cstring>
+#include <tuple>
 
 namespace {
 
@@ -35,15 +36,11 @@ TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
     script.rusage = rusage_info_v4{40 * kPage, 90 * kPage};
     script.ledgerBalances = std::vector<int64_t>{7, 3 * static_cast<int64_t>(kPage), 9};
 
-    auto process = created();
-    EXPECT_EQ(process->phys_heft(), 40 * kPage);
-    EXPECT_EQ(process->phys_heft_peak(), 90 * kPage);
-    EXPECT_EQ(process->ledgers()[0], 3 * kPage);
+    auto process = gathered();
     EXPECT_EQ(process->idleExitStatus(), HTIdleExitStatusNotControlled);
-    // Linux maps no shared library cache.
-    EXPECT_EQ(process->sharedRegionBase(), 0u);
-    EXPECT_EQ(process->sharedRegionSize(), 0u);
-    EXPECT_EQ(process->sharedRegionAlignmentSize(), 4096u);
+    // The page-table ledger becomes a region of its own.
+    ASSERT_EQ(process->memoryRegions().size(), 1u);
+    EXPECT_EQ(process->memoryRegions()[0]->dirtySize(), 3 * kPage);
 
     auto data = process->auxData();
     ASSERT_NE(data, nullptr);
@@ -55,7 +52,8 @@ TEST_F(HTUserProcessTest, CreationReadsHeftLedgerAndIdleExitStatus)
     platform_->addProcess(kPid + 1, 1, "other").ledgerBalances = std::vector<int64_t>{0, -5, 0};
     auto other = std::make_shared<HTUserProcess>(platform_);
     ASSERT_TRUE(other->initWithBsdInfo(platform_->process(kPid + 1)->info));
-    EXPECT_EQ(other->ledgers()[0], 0u);
+    other->gatherData();
+    EXPECT_TRUE(other->memoryRegions().empty());
     EXPECT_EQ(platform_->ledgerTemplateReads, 1);
     // No physical heft, no auxiliary data.
     EXPECT_EQ(other->auxData(), nullptr);
@@ -143,23 +141,20 @@ TEST_F(HTUserProcessTest, RegionsAreNamedByImageFileOrTag)
     script.images = {{"/usr/bin/target", 0x400000, {{"__TEXT", 0x400000, 4 * kPage}}}};
     platform_->realpaths["/usr/bin/target"] = "/opt/target/bin/target";
 
+    // {start, name, detailed name, segment, wired, object id} of each region.
+    using Row = std::tuple<uint64_t, std::optional<std::string>, std::optional<std::string>, int, bool, uint64_t>;
+    std::vector<Row> rows;
     auto process = gathered();
-    ASSERT_EQ(process->memoryRegions().size(), 4u);
-    const HTMemoryRegion& image = regionAt(*process, 0x400000);
-    EXPECT_EQ(image.name(), "__TEXT");
-    EXPECT_EQ(image.detailedName(), "/opt/target/bin/target");
-    EXPECT_EQ(image.segment(), HTSegmentText);
-
-    EXPECT_EQ(regionAt(*process, 0x500000).name(), "mapped file");
-    EXPECT_EQ(regionAt(*process, 0x500000).detailedName(), "/var/data.db");
-    EXPECT_EQ(regionAt(*process, 0x600000).name(), "mapped file");
-    EXPECT_FALSE(regionAt(*process, 0x600000).detailedName().has_value());
-
-    const HTMemoryRegion& tagged = regionAt(*process, 0x700000);
-    EXPECT_EQ(tagged.name(), HTMemoryRegion::categoryNameForTag(30));
-    EXPECT_EQ(tagged.segment(), HTSegmentNoImage);
-    EXPECT_TRUE(tagged.wired());
-    EXPECT_EQ(tagged.object_id(), 0x1234u);
+    for (const auto& r : process->memoryRegions())
+        rows.emplace_back(r->start(), r->name(), r->detailedName(), r->segment(), r->wired(), r->object_id());
+    const uint64_t fileId = 0x4000000000000000;
+    EXPECT_EQ(rows,
+              (std::vector<Row>{
+                  {0x400000, "__TEXT", "/opt/target/bin/target", HTSegmentText, false, fileId | 0x400000},
+                  {0x500000, "mapped file", "/var/data.db", HTSegmentNoImage, false, fileId | 0x500000},
+                  {0x600000, "mapped file", std::nullopt, HTSegmentNoImage, false, fileId | 0x600000},
+                  {0x700000, HTMemoryRegion::categoryNameForTag(30), std::nullopt, HTSegmentNoImage, true, 0x1234},
+              }));
 }
 
 TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeRegions)
@@ -177,25 +172,22 @@ TEST_F(HTUserProcessTest, OwnedObjectsGiveMappedRegionsTheirSizesAndTheRestFakeR
         {0xAA, 4 * kPage, 4 * kPage, 0, 0, 4 * kPage, 1},                // not charged
     };
 
+    // The kernel's own fake region gives way to the owned-object list; the
+    // objects no region maps follow in the kernel's order, without address.
+    using Row = std::tuple<uint64_t, bool, uint64_t, uint64_t, bool, HTRegionFigures>;
+    std::vector<Row> rows;
     auto process = gathered();
-    const auto& regions = process->memoryRegions();
-    // The kernel's own fake region gives way to the owned-object list.
-    ASSERT_EQ(regions.size(), 4u);
-    EXPECT_TRUE(regions[0]->ownedExclusivelyByParentProcess());
-    EXPECT_EQ(figures(*regions[0]), (HTRegionFigures{4 * kPage, 2 * kPage, 0, kPage}));
-
-    // The others, in the kernel's order, as unmapped owned memory.
-    const HTMemoryRegion& unmapped = *regions[1];
-    EXPECT_EQ(unmapped.object_id(), 0x88u);
-    EXPECT_EQ(unmapped.name(), "Owned physical heft (unmapped)");
-    EXPECT_EQ(unmapped.start(), HTNoAddress);
-    EXPECT_EQ(unmapped.size(), 16 * kPage);
-    EXPECT_EQ(figures(unmapped), (HTRegionFigures{4 * kPage, 3 * kPage, 0, 2 * kPage}));
-    EXPECT_TRUE(unmapped.wired());
-    EXPECT_EQ(regions[2]->object_id(), 0x99u);
-    EXPECT_EQ(figures(*regions[2]), (HTRegionFigures{3 * kPage, 0, 0, 0}));
-    EXPECT_EQ(regions[3]->object_id(), 0xAAu);
-    EXPECT_EQ(regions[3]->dirtySize() + regions[3]->swappedSize(), 0u);
+    for (const auto& r : process->memoryRegions())
+        rows.emplace_back(r->object_id(), r->ownedExclusivelyByParentProcess(), r->start(), r->size(), r->wired(),
+                          figures(*r));
+    EXPECT_EQ(rows,
+              (std::vector<Row>{
+                  {0x77, true, 0x10000, 8 * kPage, false, {4 * kPage, 2 * kPage, 0, kPage}},
+                  {0x88, true, HTNoAddress, 16 * kPage, true, {4 * kPage, 3 * kPage, 0, 2 * kPage}},
+                  {0x99, true, HTNoAddress, 4 * kPage, true, {3 * kPage, 0, 0, 0}},
+                  {0xAA, true, HTNoAddress, 4 * kPage, false, {}},
+              }));
+    EXPECT_EQ(process->memoryRegions()[1]->name(), "Owned physical heft (unmapped)");
     EXPECT_TRUE(process->warnings().empty());
 }
 
@@ -316,49 +308,36 @@ TEST_F(HTUserProcessTest, WalkFailuresBecomeWarningsOnlyForGoneOrZombieProcesses
 
     // The process as the kernel describes it after the failure, the code the
     // walk met, and what the process and standard error then say.
+    // What the process and standard error say; a warning or an error is
+    // "target [500]: " and the text given, none when empty.
     struct Case {
-        uint32_t status;
-        uint32_t flags;
+        uint32_t status, flags;
         kern_return_t code;
-        std::vector<std::string> warnings, errors;
-        std::string notice;
+        std::string warning, error, notice;
     };
-    const std::string bailOut = "bailing out for process target [500]; data may be incomplete! ";
+    const std::string bailOut = "bailing out for process target [500]; data may be incomplete! (its memory map "
+                                "could not be read: ";
+    const std::string zombie =
+        "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report";
     const Case cases[] = {
-        {SZOMB,
-         0,
-         MACH_SEND_INVALID_DEST,
-         {"target [500]: process is gone (zombie)"},
-         {},
-         "target [500]: had exited and was not yet reaped (a zombie) when read; marked \"(zombie)\" in the report"},
+        {SZOMB, 0, MACH_SEND_INVALID_DEST, "process is gone (zombie)", "", zombie},
         // Killed, not yet a zombie: its memory is going already.
-        {SRUN,
-         PROC_FLAG_INEXIT,
-         MACH_SEND_INVALID_DEST,
-         {"target [500]: process is gone (process exited)"},
-         {},
+        {SRUN, PROC_FLAG_INEXIT, MACH_SEND_INVALID_DEST, "process is gone (process exited)", "",
          std::string("target [500]") + kExitedNotice},
         // A running process, or another code: an error.
-        {SRUN,
-         0,
-         MACH_SEND_INVALID_DEST,
-         {},
-         {"target [500]: process is gone"},
-         bailOut + "(its memory map could not be read: process is gone)"},
-        {SRUN,
-         PROC_FLAG_INEXIT,
-         KERN_FAILURE,
-         {},
-         {"target [500]: failure"},
-         bailOut + "(its memory map could not be read: failure)"},
+        {SRUN, 0, MACH_SEND_INVALID_DEST, "", "process is gone", bailOut + "process is gone)"},
+        {SRUN, PROC_FLAG_INEXIT, KERN_FAILURE, "", "failure", bailOut + "failure)"},
+    };
+    auto said = [](const std::string& text) {
+        return text.empty() ? std::vector<std::string>{} : std::vector<std::string>{"target [500]: " + text};
     };
     for (const Case& test : cases) {
         script.info.pbi_status = test.status;
         script.info.pbi_flags = PROC_FLAG_LP64 | test.flags;
         script.regionFailureCode = test.code;
         auto failed = gathered();
-        EXPECT_EQ(failed->warnings(), test.warnings) << test.notice;
-        EXPECT_EQ(failed->errors(), test.errors) << test.notice;
+        EXPECT_EQ(failed->warnings(), said(test.warning)) << test.notice;
+        EXPECT_EQ(failed->errors(), said(test.error)) << test.notice;
         EXPECT_EQ(takeNotices(), std::vector<std::string>{test.notice});
     }
 

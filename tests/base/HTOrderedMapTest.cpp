@@ -1,11 +1,22 @@
+#include "base/HTOrderedMap.h"
 #include "base/HTPidMap.h"
 
 #include <gtest/gtest.h>
 
 #include <string>
+#include <string_view>
 #include <vector>
 
-TEST(HTPidMap, KeepsInsertionOrderAndFindsKeysWhetherSmallOrLarge)
+namespace {
+
+struct ViewHash {
+    using is_transparent = void;
+    size_t operator()(std::string_view key) const { return std::hash<std::string_view>{}(key); }
+};
+
+}  // namespace
+
+TEST(HTOrderedMap, KeepsInsertionOrderAndFindsKeysWhetherSmallOrLarge)
 {
     // Grows past the size searched in place, then shrinks below it again.
     HTPidMap<std::string> map;
@@ -25,4 +36,15 @@ TEST(HTPidMap, KeepsInsertionOrderAndFindsKeysWhetherSmallOrLarge)
     EXPECT_EQ(*map.find(97), "97");
     EXPECT_TRUE(map.set(71, "back"));
     EXPECT_EQ(*map.find(71), "back");
+}
+
+TEST(HTOrderedMap, StringKeysAreFoundByViewOnEitherSideOfTheIndex)
+{
+    HTOrderedMap<std::string, int, ViewHash, std::equal_to<>> map;
+    for (int i = 0; i < 20; ++i) {
+        map.add("key" + std::to_string(i), i);
+        for (int j = 0; j <= i; ++j) ASSERT_EQ(*map.find(std::string_view("key" + std::to_string(j))), j) << i;
+        EXPECT_EQ(map.find(std::string_view("key")), nullptr);
+    }
+    EXPECT_EQ(map.begin()->first, "key0");
 }
