@@ -130,32 +130,6 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
               std::vector<int32_t>(kFreed, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE));
 }
 
-TEST_F(HTLinuxAddressSpace, ForkedChildSharesFilesButNotAnonymousObjects)
-{
-    // The same file names the same object in both; anonymous memory at the
-    // same address in parent and forked child does not, though the two share
-    // its pages until either writes (copy on write).
-    HTLayoutChild parent({"anon", std::to_string(kTouched * kPage), "file", filePath_, "0", "0", "fork", "1",
-                          std::to_string(kPage), "0"});
-    ASSERT_TRUE(parent.ready());
-    std::shared_ptr<HTTaskPort> mineTask, forked;
-    ASSERT_EQ(platform_.task_for_pid(parent.pid(), &mineTask), KERN_SUCCESS);
-    ASSERT_EQ(platform_.task_for_pid(static_cast<int32_t>(parent.value(2)), &forked), KERN_SUCCESS);
-    kern_return_t result;
-    std::vector<WalkedRegion> mine = walk(platform_, *mineTask, result), theirs = walk(platform_, *forked, result);
-    ASSERT_NE(regionAt(theirs, parent.value(1)), nullptr);
-    EXPECT_EQ(regionAt(theirs, parent.value(1))->info.object_id_full, regionAt(regions_, at(2))->info.object_id_full);
-    EXPECT_EQ(regionAt(mine, parent.value(0))->info.share_mode, SM_COW);
-    size_t anonymous = 0;
-    for (const WalkedRegion& region : theirs) {
-        const WalkedRegion* own = regionAt(mine, region.start);
-        if (own == nullptr || region.info.external_pager != 0 || (region.info.object_id_full >> 62) != 1) continue;
-        ++anonymous;
-        EXPECT_NE(own->info.object_id_full, region.info.object_id_full) << std::hex << region.start;
-    }
-    EXPECT_GT(anonymous, 3u);
-}
-
 TEST_F(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
 {
     // Parsed and with its pagemap open while the child lives.
