@@ -16,27 +16,16 @@ namespace {
 
 // The layout program copied under a name of its own, so that the processes
 // started from it are the only ones of that name. Removed with the object.
-class HTLayoutProgramCopy {
-public:
-    explicit HTLayoutProgramCopy(const std::string& stem) : name_(stem + "-" + std::to_string(::getpid()))
+struct HTLayoutProgramCopy {
+    explicit HTLayoutProgramCopy(const std::string& stem) : name(stem + "-" + std::to_string(::getpid()))
     {
-        char pattern[] = "/tmp/heft-test-XXXXXX";
-        if (::mkdtemp(pattern) == nullptr) return;
-        directory_ = pattern;
-        std::error_code error;
-        std::filesystem::copy_file(HEFT_LAYOUT_PROGRAM, path(), error);
+        std::filesystem::create_directories(directory);
+        std::filesystem::copy_file(HEFT_LAYOUT_PROGRAM, path(), std::filesystem::copy_options::overwrite_existing);
     }
-    ~HTLayoutProgramCopy()
-    {
-        std::error_code error;
-        if (!directory_.empty()) std::filesystem::remove_all(directory_, error);
-    }
+    ~HTLayoutProgramCopy() { std::filesystem::remove_all(directory); }
+    std::string path() const { return directory + "/" + name; }
 
-    const std::string& name() const { return name_; }
-    std::string path() const { return directory_ + "/" + name_; }
-
-private:
-    std::string name_, directory_;
+    const std::string name, directory = "/tmp/heft-test-" + name;
 };
 
 class HTProcessDiscoveryLinux : public testing::Test {
@@ -59,13 +48,13 @@ TEST_F(HTProcessDiscoveryLinux, NameSharedByThreeProcessesYieldsAllThree)
     const std::string gone = std::to_string(HTLayoutChild::reapedPid());
 
     std::vector<std::string> errors;
-    auto pids = discovery_.pidsForStringDescriptions({program.name(), gone}, &errors);
+    auto pids = discovery_.pidsForStringDescriptions({program.name, gone}, &errors);
     ASSERT_TRUE(pids);
     EXPECT_EQ(pids->size(), 3u);
     for (const HTLayoutChild* child : {&first, &second, &third}) {
         const std::optional<std::string>* description = pids->find(child->pid());
         ASSERT_NE(description, nullptr) << child->pid();
-        EXPECT_EQ(*description, program.name());
+        EXPECT_EQ(*description, program.name);
     }
     EXPECT_EQ(errors, std::vector<std::string>{"Unable to find pid for process matching '" + gone + "'"});
 
