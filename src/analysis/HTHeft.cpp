@@ -94,7 +94,7 @@ void HTHeft::reportUnidentifiedSharedPages() const
 
 void HTHeft::_addProcess(const std::shared_ptr<HTProcess>& processPointer)
 {
-    HT_ASSERT("HTHeft", memoryObjects_ != nullptr, "_memoryObjects");
+    HT_ASSERT("HTHeft", memoryObjects_ != nullptr, "memoryObjects_ != nullptr");
     HTProcess& process = *processPointer;
     const bool sharingDisabled = settings_.sharingAnalysisDisabled;
     const bool breakDown = settings_.breakDownPhysHeft;

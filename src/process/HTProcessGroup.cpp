@@ -20,7 +20,7 @@ bool HTProcessGroup::containsPid(int32_t pid) const
 
 void HTProcessGroup::addProcess(const std::shared_ptr<HTProcess>& process)
 {
-    HT_ASSERT("HTProcessGroup", !immutable_, "!_immutable");
+    HT_ASSERT("HTProcessGroup", !immutable_, "!immutable_");
     const int32_t pid = process->pid();
     if (containsPid(pid)) return;
 
