@@ -3,7 +3,6 @@
 #include "analysis/HTHeft.h"
 #include "analysis/HTHeftReport.h"
 #include "analysis/HTHeftSharingData.h"
-#include "analysis/HTMemoryObjectMap.h"
 #include "analysis/HTScriptedProcess.h"
 #include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
@@ -18,9 +17,6 @@ constexpr uint64_t kPage = 4096;
 // The driver with its internal steps opened up for tests.
 class HTHeftProbe : public HTHeft {
 public:
-    using HTHeft::_addProcess;
-    using HTHeft::_buildProcessToHeftMap;
-    using HTHeft::_calculateHeftForProcess;
     using HTHeft::_notHiddenProcesses;
     using HTHeft::_processesBySortingHeft;
     using HTHeft::_processesBySortingPidDesc;
@@ -30,32 +26,24 @@ public:
     {
         return HTSharingAnalysis::sharingDataForProcesses(processes());
     }
-    HTCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize)
+    // The totals of the summary, or of `objects` as `process` sees them.
+    HTMemoryTotals _total(const ObjectSet* objects = nullptr, HTProcess* process = nullptr)
     {
-        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
-            ._categoriesForAllProcesses(processes());
-    }
-    HTCategoryMap _categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
-                                        bool summarize)
-    {
-        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
-            ._categoriesForObjects(objects, process, hasProcessView);
-    }
-    static void _totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* total)
-    {
-        HTHeftReport::_totalForCategories(categories, total);
+        HTHeftReport report(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, true);
+        HTMemoryTotals total;
+        HTHeftReport::_totalForCategories(objects ? report._categoriesForObjects(*objects, *process, nullptr)
+                                                  : report._categoriesForAllProcesses(processes()),
+                                          &total);
+        return total;
     }
 };
 
 // Scripted processes on a fake platform. The global error list is
-// program-wide, so every test starts and ends with it empty.
+// program-wide, so every test ends with it empty.
 class HTAnalysisTest : public ::testing::Test {
 protected:
-    HTAnalysisTest() : platform_(std::make_shared<HTFakePlatform>()) { setBreakdown(false); }
+    HTAnalysisTest() : platform_(std::make_shared<HTFakePlatform>()) { settings_.breakDownPhysHeft = false; }
     ~HTAnalysisTest() override { HTProcess::_clearGlobalErrors(); }
-
-    // The settings of the processes and drivers made from here on.
-    void setBreakdown(bool on) { settings_.breakDownPhysHeft = on; }
 
     std::shared_ptr<HTScriptedProcess> process(int32_t pid, std::vector<HTScriptedRegion> script, bool is64bit = true)
     {
@@ -85,7 +73,7 @@ inline std::string pidsOf(const std::vector<std::shared_ptr<HTProcess>>& process
 }
 
 // `n` pages of object `id`, all dirty, mapped shared.
-inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n, const char* name = "region")
+inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n)
 {
-    return HTScriptedRegion{.objectId = id, .size = n * kPage, .dirty = n * kPage, .name = std::string(name)};
+    return HTScriptedRegion{.objectId = id, .size = n * kPage, .dirty = n * kPage};
 }

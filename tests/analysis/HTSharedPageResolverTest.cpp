@@ -3,9 +3,7 @@
 // summary, shows in the tables of exactly the processes that map it, and
 // counts in full in each of their hefts.
 
-#include "analysis/HTHeftSharingData.h"
 #include "analysis/HTHeftTestSupport.h"
-#include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
 #include "model/HTMemoryRegion.h"
 #include "process/HTProcessGroup.h"
@@ -16,13 +14,13 @@
 namespace {
 
 constexpr uint64_t kStart = 0x10000;
-constexpr int32_t kParent = 100;
-constexpr int32_t kFirstChild = 101;
-constexpr int32_t kSecondChild = 102;
+constexpr int32_t kParent = 100, kFirstChild = 101, kSecondChild = 102;
 constexpr int32_t kDirtyPage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
 
 class HTSharedPageResolverTest : public HTAnalysisTest {
 protected:
+    void SetUp() override { settings_.breakDownPhysHeft = true; }
+
     // Private anonymous mappings of `identities.size()` written pages from
     // kStart, `regionPages` pages a mapping (all in one when 0), with a page
     // of gap between them; a page's identity is 0 when only its process
@@ -39,14 +37,12 @@ protected:
             region.info.protection = VM_PROT_READ | VM_PROT_WRITE;
             region.info.share_mode = SM_COW;
             region.info.ref_count = 2;
-            region.info.pages_resident = static_cast<uint32_t>(pages);
-            region.info.pages_dirtied = static_cast<uint32_t>(pages);
+            region.info.pages_resident = region.info.pages_dirtied = static_cast<uint32_t>(pages);
             region.info.object_id_full = 0x4000000000000000 | static_cast<uint64_t>(pid) << 8 | first;
             process.regions.push_back(region);
             for (size_t i = 0; i < pages; ++i) {
                 process.dispositions[region.start + i * kPage] = kDirtyPage;
-                if (identities[first + i] != 0)
-                    process.pageIdentities[region.start + i * kPage] = identities[first + i];
+                if (identities[first + i]) process.pageIdentities[region.start + i * kPage] = identities[first + i];
             }
         }
     }
@@ -63,13 +59,6 @@ protected:
         return processes;
     }
 
-    static uint64_t summaryDirty(HTHeftProbe& heft)
-    {
-        HTMemoryTotals total;
-        HTHeftProbe::_totalForCategories(heft._categoriesForAllProcessesShouldSummarize(true), &total);
-        return total.dirty;
-    }
-
     // Each group of the process, as its pids, with the dirty bytes the
     // process sees in it.
     static std::map<std::set<int32_t>, uint64_t> tablesOf(HTHeftProbe& heft, HTProcess& process)
@@ -79,11 +68,7 @@ protected:
         for (const auto& group : *sharing->processToProcessGroups().find(process.pid())) {
             std::set<int32_t> pids;
             for (const auto& member : group->processes()) pids.insert(member->pid());
-            HTMemoryTotals total;
-            HTHeftProbe::_totalForCategories(
-                heft._categoriesForObjects(*sharing->processGroupToObjects().find(*group), process, nullptr, true),
-                &total);
-            tables[pids] = total.dirty;
+            tables[pids] = heft._total(sharing->processGroupToObjects().find(*group), &process).dirty;
         }
         return tables;
     }
@@ -91,7 +76,6 @@ protected:
 
 TEST_F(HTSharedPageResolverTest, PagesCountOnceAndShowWithExactlyTheirMappers)
 {
-    setBreakdown(true);
     // Pages 1 to 3 are shared by all three; page 4 by the parent and the
     // first child (the second wrote its own copy); the parent's fifth page
     // is shared with a process outside the analysis, so it is its own.
@@ -103,9 +87,8 @@ TEST_F(HTSharedPageResolverTest, PagesCountOnceAndShowWithExactlyTheirMappers)
 
     // Three pages shared by all, one by two, and 2 + 2 + 3 pages of each
     // process's own.
-    EXPECT_EQ(summaryDirty(*heft), 11 * kPage);
+    EXPECT_EQ(heft->_total().dirty, 11 * kPage);
     for (const auto& process : processes) EXPECT_EQ(*heft->pidToHeft().find(process->pid()), 6 * kPage);
-
     using Tables = std::map<std::set<int32_t>, uint64_t>;
     EXPECT_EQ(tablesOf(*heft, *processes[0]),
               (Tables{{{kParent}, 2 * kPage},
@@ -128,27 +111,25 @@ TEST_F(HTSharedPageResolverTest, PagesCountOnceAndShowWithExactlyTheirMappers)
 
 TEST_F(HTSharedPageResolverTest, PagesMappedInAnotherOrderCountOnce)
 {
-    setBreakdown(true);
     // The child maps the parent's shared pages in another order, and runs
     // of them across the parent's two mappings: 2 and 4 lie apart in the
     // parent, 3 and 6 at the end of one of its mappings and the start of
     // the next. The parent's 1 and 5 are its own.
     addForkedProcess(kParent, {1, 2, 5, 3, 6, 4}, 4);
     addForkedProcess(kFirstChild, {2, 4, 3, 6});
-    HTHeft::ProcessList processes = created({kParent, kFirstChild});
-    auto heft = gathered(processes);
-    EXPECT_EQ(summaryDirty(*heft), 6 * kPage);
+    auto heft = gathered(created({kParent, kFirstChild}));
+    EXPECT_EQ(heft->_total().dirty, 6 * kPage);
     EXPECT_EQ(*heft->pidToHeft().find(kFirstChild), 4 * kPage);
 }
 
 TEST_F(HTSharedPageResolverTest, WithoutIdentitiesEachProcessKeepsItsOwnCopy)
 {
+    settings_.breakDownPhysHeft = false;
     platform_->sharedPagesIdentifiable = false;
     addForkedProcess(kParent, {1, 2});
     addForkedProcess(kFirstChild, {1, 2});
     HTHeft::ProcessList processes = created({kParent, kFirstChild});
-    auto heft = gathered(processes);
-    EXPECT_EQ(summaryDirty(*heft), 4 * kPage);
+    EXPECT_EQ(gathered(processes)->_total().dirty, 4 * kPage);
     EXPECT_TRUE(static_cast<HTUserProcess&>(*processes[0]).sharedPagesUnidentified());
 
     // Sharing analysis off: nothing is named, nothing is noticed.
@@ -161,7 +142,6 @@ TEST_F(HTSharedPageResolverTest, WithoutIdentitiesEachProcessKeepsItsOwnCopy)
 
 TEST_F(HTSharedPageResolverTest, PrivateFileMappingKeepsTheFilesPagesApartFromItsCopies)
 {
-    setBreakdown(true);
     constexpr int32_t kCopied = kDirtyPage | VM_PAGE_QUERY_PAGE_COPIED;
     constexpr int32_t kFilePage = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
     for (int32_t pid : {kParent, kFirstChild}) {
@@ -174,8 +154,7 @@ TEST_F(HTSharedPageResolverTest, PrivateFileMappingKeepsTheFilesPagesApartFromIt
         region.info.share_mode = SM_COW;
         region.info.external_pager = 1;
         region.info.pages_resident = 4;
-        region.info.pages_dirtied = 2;
-        region.info.pages_shared_now_private = 2;
+        region.info.pages_dirtied = region.info.pages_shared_now_private = 2;
         region.info.object_id_full = 0x8000000000000077;
         region.path = "/data/table";
         process.regions.push_back(region);
@@ -187,11 +166,10 @@ TEST_F(HTSharedPageResolverTest, PrivateFileMappingKeepsTheFilesPagesApartFromIt
     HTHeft::ProcessList processes = created({kParent, kFirstChild});
     auto heft = gathered(processes);
 
-    // Each process's two copies are its own; the file's two pages count once.
-    HTMemoryTotals total;
-    HTHeftProbe::_totalForCategories(heft->_categoriesForAllProcessesShouldSummarize(true), &total);
-    EXPECT_EQ(total.dirty, 4 * kPage);
-    EXPECT_EQ(total.clean, 2 * kPage);
+    // Each process's two copies are its own; the file's two pages count
+    // once, clean.
+    EXPECT_EQ(heft->_total().dirty, 4 * kPage);
+    EXPECT_EQ(heft->_total().clean, 2 * kPage);
     const auto& regions = processes[0]->memoryRegions();
     ASSERT_EQ(regions.size(), 2u);
     EXPECT_EQ(regions[0]->object_id(), processes[1]->memoryRegions()[0]->object_id());
