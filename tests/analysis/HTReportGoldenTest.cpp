@@ -1,9 +1,19 @@
-// Whole reports, text and JSON, driven through the analysis from scripted
-// processes and compared character for character with the expected reports
-// under tests/data/reports/. This is the one place that asserts the text of
-// whole reports. When a change to the output is meant, run the tests with
+// Whole reports, text and JSON, compared character for character with the
+// expected reports under tests/data/reports/. This is the one place that
+// asserts the text of whole reports. Each NAME.scenario there scripts the
+// processes of one run, which are gathered and reported into NAME.txt and
+// NAME.json. When a change to the output is meant, run the tests with
 // HEFT_UPDATE_REPORTS=1: the reports are written back from what heft prints
 // now, and the diff of tests/data/ shows what changed.
+//
+// A scenario is lines of a keyword and then pairs of a key and a value;
+// values may be quoted, %XX stands for a byte, # starts a comment line.
+//   set format F options O sort S verbose 1 summarize 1 breakdown 1
+//   process PID bits 32 hidden 1 name N warning W error E  (warnings repeat)
+//   region id I name N path P dirty D clean C swapped S pages P extra B
+//          start A offset P owned 1 unmapped 1   (sizes in pages, extra in bytes)
+//   aux [KEY VALUE]   (VALUE "map" opens a map for the aux lines after it)
+//   global-error E
 
 #include "analysis/HTHeftTestSupport.h"
 #include "model/HTAuxData.h"
@@ -14,45 +24,16 @@
 #include <gtest/gtest.h>
 
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
-#include <functional>
+#include <iomanip>
+#include <map>
 #include <sstream>
 #include <string>
 
 namespace {
 
-HTScriptedRegion region(uint64_t id, const std::string& name, uint64_t dirtyPages, uint64_t cleanPages = 0,
-                        uint64_t swappedPages = 0, const char* path = nullptr, uint64_t start = 0)
-{
-    HTScriptedRegion made{.objectId = id,
-                          .size = (dirtyPages + cleanPages + swappedPages) * kPage,
-                          .dirty = dirtyPages * kPage,
-                          .swapped = swappedPages * kPage,
-                          .clean = cleanPages * kPage,
-                          .name = name,
-                          .start = start};
-    if (path) made.detailedName = std::string(path);
-    return made;
-}
-
-HTScriptedRegion owned(HTScriptedRegion region, bool unmapped = false)
-{
-    region.owned = true;
-    region.fake = unmapped;
-    return region;
-}
-
-// A map of the keys and values; a value of -1 opens a map of the keys that follow.
-std::shared_ptr<HTAuxDataMap> aux(std::vector<std::pair<std::string, int64_t>> entries)
-{
-    auto data = std::make_shared<HTAuxDataMap>(), into = data;
-    for (const auto& [key, value] : entries) {
-        auto inner = std::make_shared<HTAuxDataMap>();
-        into->set(key, value < 0 ? HTAuxDataMap::Value(inner) : std::make_shared<HTAuxData>(value, true));
-        if (value < 0) into = inner;
-    }
-    return data;
-}
+const std::string kReports = std::string(HEFT_TEST_DATA_DIR) + "/reports/";
 
 std::string contents(const std::string& path)
 {
@@ -61,209 +42,139 @@ std::string contents(const std::string& path)
     return text.str();
 }
 
-void expectReport(const std::string& name, const std::string& actual)
+std::string decoded(const std::string& text)
 {
-    const std::string path = std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name;
-    const char* update = std::getenv("HEFT_UPDATE_REPORTS");
-    if (update && *update && std::string(update) != "0") {
-        std::ofstream(path, std::ios::binary) << actual;
-        return;
+    std::string bytes;
+    for (size_t i = 0; i < text.size(); ++i) {
+        if (text[i] != '%')
+            bytes += text[i];
+        else
+            bytes += static_cast<char>(std::stoi(text.substr(i + 1, 2), nullptr, 16)), i += 2;
     }
-    EXPECT_EQ(actual, contents(path)) << "differs from " << path << "; HEFT_UPDATE_REPORTS=1 rewrites it";
+    return bytes;
 }
 
 class HTReportGoldenTest : public HTAnalysisTest {
 protected:
-    struct Scenario {
-        const char* name;
-        std::function<HTHeft::ProcessList()> processes;
-        std::function<void(HTSettings&)> settings = [](HTSettings&) {};
+    struct Script {
+        int32_t pid;
+        std::map<std::string, std::string> fields;
+        std::vector<std::string> warnings;
+        std::vector<HTScriptedRegion> regions;
+        std::shared_ptr<HTAuxDataMap> aux, auxInto;
     };
 
-    // Reports the scenario's processes as text and as JSON, after its
-    // settings, and compares both with NAME.txt and NAME.json. The kernel's
-    // page size differs from the processes' so that the JSON shows which
-    // one it took.
-    void expectReports(const Scenario& scenario)
+    // The processes of the scenario, after its settings.
+    HTHeft::ProcessList readScenario(const std::string& path)
     {
-        SCOPED_TRACE(scenario.name);
-        const HTSettings defaults = settings_;
-        scenario.settings(settings_);
+        settings_.summarize = false;
+        std::vector<Script> scripts;
+        std::istringstream lines(contents(path));
+        for (std::string line, kind; std::getline(lines, line);) {
+            std::istringstream in(line);
+            if (!(in >> kind) || kind[0] == '#') continue;
+            Script read{};
+            if (kind == "process") in >> read.pid;
+            std::string key, value;
+            if (kind == "aux") in >> std::quoted(key) >> std::quoted(value);
+            if (kind == "global-error") in >> std::quoted(value);
+            while (in >> std::quoted(key) >> std::quoted(value)) {
+                if (key == "warning")
+                    read.warnings.push_back(decoded(value));
+                else
+                    read.fields[key] = decoded(value);
+            }
+            auto number = [&](const char* name) {
+                return read.fields.count(name) ? std::stoull(read.fields[name], nullptr, 0) : 0;
+            };
+            if (kind == "set") {
+                if (read.fields.count("format")) settings_.summaryFormat = static_cast<int64_t>(number("format"));
+                settings_.textOptions = static_cast<int64_t>(number("options"));
+                if (read.fields.count("sort")) settings_.textSort = read.fields["sort"];
+                settings_.verbose = number("verbose");
+                settings_.summarize = number("summarize");
+                settings_.breakDownPhysHeft = number("breakdown");
+            } else if (kind == "process") {
+                scripts.push_back(read);
+            } else if (kind == "region") {
+                const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
+                HTScriptedRegion region{.objectId = number("id"),
+                                        .offset = number("offset") * kPage,
+                                        .size = (number("pages") ?: dirty + clean + swapped) * kPage + number("extra"),
+                                        .dirty = dirty * kPage,
+                                        .swapped = swapped * kPage,
+                                        .clean = clean * kPage,
+                                        .name = std::nullopt,
+                                        .start = number("start"),
+                                        .owned = number("owned") != 0,
+                                        .fake = number("unmapped") != 0};
+                if (read.fields.count("name")) region.name = read.fields["name"];
+                if (read.fields.count("path")) region.detailedName = read.fields["path"];
+                scripts.back().regions.push_back(region);
+            } else if (kind == "aux") {
+                Script& script = scripts.back();
+                if (!script.aux) script.aux = script.auxInto = std::make_shared<HTAuxDataMap>();
+                auto inner = std::make_shared<HTAuxDataMap>();
+                if (!key.empty() && value == "map")
+                    script.auxInto->set(key, inner), script.auxInto = inner;
+                else if (!key.empty())
+                    script.auxInto->set(key, std::make_shared<HTAuxData>(std::stoll(value), true));
+            } else if (kind == "global-error") {
+                HTProcess::_addGlobalError(decoded(value));
+            }
+        }
+        HTHeft::ProcessList processes;
+        for (Script& script : scripts) {
+            auto made = process(script.pid, script.regions, script.fields["bits"] != "32");
+            if (script.fields.count("name")) made->setName(script.fields["name"]);
+            if (script.fields.count("name"))
+                made->setDisplayString(made->name() + " [" + std::to_string(script.pid) + "]");
+            made->setHiddenFromDisplay(script.fields["hidden"] == "1");
+            made->warnings() = script.warnings;
+            if (script.fields.count("error")) made->scriptError(script.fields["error"]);
+            made->setAuxData(script.aux);
+            processes.push_back(made);
+        }
+        return processes;
+    }
+
+    // The kernel's page size differs from the processes' so that the JSON
+    // shows which one it took.
+    void expectReports(const std::string& name)
+    {
+        SCOPED_TRACE(name);
         const std::string path = testing::TempDir() + "heft-golden-report";
         {
+            HTHeft::ProcessList processes = readScenario(kReports + name + ".scenario");
             FILE* text = std::fopen((path + ".txt").c_str(), "w");
-            auto heft = gathered(scenario.processes());
+            auto heft = gathered(processes);
             heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, text));
             heft->addOutputFormatter(
                 HTOutputFormatterJSON::initWithPath(path + ".json", settings_.breakDownPhysHeft, 4 * kPage, nullptr));
             heft->printOutputVerbose(settings_.verbose, settings_.summarize);
             std::fclose(text);
         }
+        const char* update = std::getenv("HEFT_UPDATE_REPORTS");
         for (const char* extension : {".txt", ".json"}) {
-            expectReport(scenario.name + std::string(extension), contents(path + extension));
+            const std::string actual = contents(path + extension), expected = kReports + name + extension;
+            if (update && *update && std::string(update) != "0")
+                std::ofstream(expected, std::ios::binary) << actual;
+            else
+                EXPECT_EQ(actual, contents(expected)) << "differs from " << expected;
             std::remove((path + extension).c_str());
         }
-        settings_ = defaults;
+        settings_ = HTSettings{.breakDownPhysHeft = false};
         HTProcess::_clearGlobalErrors();
     }
 };
 
 TEST_F(HTReportGoldenTest, Reports)
 {
-    settings_.summarize = false;
-    auto with = [](std::shared_ptr<HTScriptedProcess> process, std::function<void(HTScriptedProcess&)> change) {
-        change(*process);
-        return process;
-    };
-    const Scenario scenarios[] = {
-        // Sizes below 10000 bytes fit the 7-character field unscaled. One
-        // process: the summary is only the counting-mode line, and the
-        // auxiliary data, nested, is not repeated.
-        {"one-process",
-         [&] {
-             return HTHeft::ProcessList{
-                 with(process(10, {region(1, "untagged", 2), region(2, "mapped file", 1, 3, 0, "/usr/lib/libfoo.so")}),
-                      [](auto& p) {
-                          p.setAuxData(aux({{"reserved", 8192}, {"ledger", -1}, {"page_table", 4096}}));
-                      })};
-         }},
-        // An empty map still gets its heading.
-        {"one-process-empty-aux",
-         [&] {
-             return HTHeft::ProcessList{
-                 with(process(10, {region(1, "untagged", 1)}), [](auto& p) { p.setAuxData(aux({})); })};
-         }},
-        // Two processes share an object, counted once in the summary, in
-        // bytes and by short names.
-        {"two-sharing-bytes",
-         [&] {
-             return HTHeft::ProcessList{process(20, {region(1, "shared memory", 1), region(3, "untagged", 1)}),
-                                        process(10, {region(1, "shared memory", 1), region(2, "untagged", 2)})};
-         },
-         [](HTSettings& s) {
-             s.summaryFormat = HTTextFormatBytes;
-             s.summarize = true;
-         }},
-        // In pages, wide: swapped and wired columns, full paths, the listing
-        // too; an empty table. Equal dirty figures: the one with more clean
-        // memory first. Auxiliary data in pages, rounded up.
-        {"two-sharing-wide-pages",
-         [&] {
-             return HTHeft::ProcessList{
-                 process(20, {region(1, "shared memory", 1), region(3, "mapped file", 1, 1, 0, "/usr/lib/libbar.so")}),
-                 with(process(10, {region(1, "shared memory", 1), region(2, "untagged", 1, 0, 1)}),
-                      [](auto& p) {
-                          p.setAuxData(aux({{"phys_heft", 4097}}));
-                      }),
-                 process(5, {})};
-         },
-         [](HTSettings& s) {
-             s.summaryFormat = HTTextFormatPages;
-             s.textOptions = HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide;
-             s.verbose = true;
-         }},
-        // The stack is mapped but never touched: last by dirty size, third
-        // by name. Only the low 40 bits of the object id are listed; an
-        // unmapped region has no addresses, a size not a page multiple
-        // counts the page begun.
-        {"verbose-by-category",
-         [&] {
-             HTScriptedRegion stack = region(5, "stack", 0, 0, 0, nullptr, 0x30000);
-             stack.size = kPage;
-             HTScriptedRegion odd = region(6, "heap", 1, 0, 1, nullptr, 0x50000);
-             odd.size += 1;
-             return HTHeft::ProcessList{process(10,
-                                                {region(4, "IOKit", 2, 0, 0, nullptr, 0x10000),
-                                                 region(3, "mapped file", 1, 1, 0, "/lib/x.so", 0x20000), stack,
-                                                 region(0x12300000002, "untagged", 3, 0, 0, nullptr, 0x40000), odd,
-                                                 owned(region(7, "owned", 1), true)})};
-         },
-         [](HTSettings& s) {
-             s.textSort = "Category";
-             s.textOptions = HTTextOptionWired | HTTextOptionSwapped;
-             s.verbose = true;
-         }},
-        // A process with errors has no heft and no tables, and its
-        // auxiliary data stays out of the merged data; a 32-bit process
-        // with warnings; a global error.
-        {"errors-and-warnings",
-         [&] {
-             auto failed = with(process(10, {region(2, "heap", 2)}), [](auto& p) {
-                 p.setAuxData(aux({{"x", 5}}));
-                 p.scriptError("cannot read");
-             });
-             auto warned = with(process(20, {region(1, "untagged", 1)}, false), [](auto& p) {
-                 p.setAuxData(aux({{"x", 7}}));
-                 p.warnings() = {"exited", "second warning"};
-             });
-             HTProcess::_addGlobalError("task port");
-             return HTHeft::ProcessList{warned, failed};
-         }},
-        // p30 maps both pages of the object, the others one each: every
-        // member sees its own figures. Warnings alone do not put the
-        // summary in doubt.
-        {"process-views",
-         [&] {
-             HTScriptedRegion secondPage = region(7, "shm", 1);
-             secondPage.offset = kPage;
-             return HTHeft::ProcessList{
-                 with(process(10, {region(7, "shm", 1)}), [](auto& p) { p.warnings() = {"exited"}; }),
-                 process(20, {region(7, "shm", 1)}), process(30, {region(7, "shm", 1), secondPage})};
-         }},
-        // Memory p10 owns is clean to p20; the summary counts it once, dirty.
-        // Memory without a name is still shown, under "unknown".
-        {"owned-memory",
-         [&] {
-             HTScriptedRegion unnamed{.objectId = 10, .dirty = kPage, .name = std::nullopt};
-             return HTHeft::ProcessList{process(10, {owned(region(8, "shm", 1))}),
-                                        process(20, {region(8, "shm", 1), region(9, "heap", 2), unnamed})};
-         },
-         [](HTSettings& s) { s.breakDownPhysHeft = true; }},
-        // The hidden process maps memory p10 owns and has a fake region
-        // for, so it joins that memory's group; its other memory stays out.
-        {"hidden-process",
-         [&] {
-             auto hidden = with(process(30, {region(1, "shm", 1), region(3, "other", 4)}),
-                                [](auto& p) { p.setHiddenFromDisplay(true); });
-             return HTHeft::ProcessList{
-                 process(10, {owned(region(1, "shm", 1)), owned(region(1, "shm", 1), true), region(2, "heap", 2)}),
-                 hidden};
-         },
-         [](HTSettings& s) { s.breakDownPhysHeft = true; }},
-        // Nothing visible: the formatters still get the closing stages, and
-        // a run's error alone.
-        {"only-hidden",
-         [&] {
-             HTProcess::_addGlobalError("interrupted");
-             return HTHeft::ProcessList{
-                 with(process(30, {region(3, "other", 4)}), [](auto& p) { p.setHiddenFromDisplay(true); })};
-         },
-         [](HTSettings& s) { s.verbose = true; }},
-        // Groups of up to twenty name the others; larger ones count them.
-        // A figure wider than its column pushes the row along.
-        {"crowd",
-         [&] {
-             HTHeft::ProcessList crowd;
-             for (int32_t pid = 1; pid <= 21; ++pid)
-                 crowd.push_back(process(pid,
-                                         pid < 21 ? std::vector{region(1, "shm", 244141), region(2, "shm", 1)}
-                                                  : std::vector{region(1, "shm", 244141)}));
-             return crowd;
-         },
-         [](HTSettings& s) { s.summaryFormat = HTTextFormatBytes; }},
-        // Names, errors, categories and keys that are neither printable nor
-        // UTF-8 are escaped in the text and mended in the JSON.
-        {"awkward-names",
-         [&] {
-             const std::string awkward = std::string("a\"b\\c\x01\td\n") + '\0' + "e\xff" + "f\xc3\xbc";
-             auto named = with(process(7, {region(1, awkward, 1)}), [&](auto& p) {
-                 p.setName(awkward);
-                 p.setDisplayString(awkward + " [7]");
-             });
-             return HTHeft::ProcessList{named, with(process(8, {}), [&](auto& p) { p.scriptError(awkward); })};
-         }},
-    };
-    for (const Scenario& scenario : scenarios) expectReports(scenario);
+    std::vector<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(kReports))
+        if (entry.path().extension() == ".scenario") names.push_back(entry.path().stem());
+    EXPECT_GE(names.size(), 12u);
+    for (const std::string& name : names) expectReports(name);
 }
 
 }  // namespace
