@@ -1,19 +1,6 @@
 // Whole reports, text and JSON, compared character for character with the
-// expected reports under tests/data/reports/. This is the one place that
-// asserts the text of whole reports. Each NAME.scenario there scripts the
-// processes of one run, which are gathered and reported into NAME.txt and
-// NAME.json. When a change to the output is meant, run the tests with
-// HEFT_UPDATE_REPORTS=1: the reports are written back from what heft prints
-// now, and the diff of tests/data/ shows what changed.
-//
-// A scenario is lines of a keyword and then pairs of a key and a value;
-// values may be quoted, %XX stands for a byte, # starts a comment line.
-//   set format F options O sort S verbose 1 summarize 1 breakdown 1
-//   process PID bits 32 hidden 1 name N warning W error E  (warnings repeat)
-//   region id I name N path P dirty D clean C swapped S pages P extra B
-//          start A offset P owned 1 unmapped 1   (sizes in pages, extra in bytes)
-//   aux [KEY VALUE]   (VALUE "map" opens a map for the aux lines after it)
-//   global-error E
+// expected reports: the one place that asserts the text of whole reports.
+// tests/data/reports/README.md says how scenarios are written.
 
 #include "analysis/HTHeftTestSupport.h"
 #include "model/HTAuxData.h"
@@ -56,84 +43,66 @@ std::string decoded(const std::string& text)
 
 class HTReportGoldenTest : public HTAnalysisTest {
 protected:
-    struct Script {
-        int32_t pid;
-        std::map<std::string, std::string> fields;
-        std::vector<std::string> warnings;
-        std::vector<HTScriptedRegion> regions;
-        std::shared_ptr<HTAuxDataMap> aux, auxInto;
-    };
-
     // The processes of the scenario, after its settings.
     HTHeft::ProcessList readScenario(const std::string& path)
     {
-        settings_.summarize = false;
-        std::vector<Script> scripts;
+        settings_ = HTSettings{.breakDownPhysHeft = false, .summarize = false};
+        HTHeft::ProcessList processes;
+        std::shared_ptr<HTScriptedProcess> last;
+        std::shared_ptr<HTAuxDataMap> auxInto;
         std::istringstream lines(contents(path));
-        for (std::string line, kind; std::getline(lines, line);) {
+        for (std::string line, kind, key, value; std::getline(lines, line);) {
             std::istringstream in(line);
             if (!(in >> kind) || kind[0] == '#') continue;
-            Script read{};
-            if (kind == "process") in >> read.pid;
-            std::string key, value;
-            if (kind == "aux") in >> std::quoted(key) >> std::quoted(value);
-            if (kind == "global-error") in >> std::quoted(value);
-            while (in >> std::quoted(key) >> std::quoted(value)) {
-                if (key == "warning")
-                    read.warnings.push_back(decoded(value));
-                else
-                    read.fields[key] = decoded(value);
+            if (kind == "global-error" && in >> std::quoted(value)) HTProcess::_addGlobalError(decoded(value));
+            if (kind == "aux") {
+                if (!last->auxData()) last->setAuxData(auxInto = std::make_shared<HTAuxDataMap>());
+                if (!(in >> std::quoted(key) >> std::quoted(value))) continue;
+                auto inner = std::make_shared<HTAuxDataMap>();
+                auxInto->set(key,
+                             value == "map" ? HTAuxDataMap::Value(inner)
+                                            : std::make_shared<HTAuxData>(std::stoll(value), true));
+                if (value == "map") auxInto = inner;
             }
-            auto number = [&](const char* name) {
-                return read.fields.count(name) ? std::stoull(read.fields[name], nullptr, 0) : 0;
+            std::multimap<std::string, std::string> fields;
+            if (kind == "process" && in >> value) fields.emplace("pid", value);
+            while (in >> std::quoted(key) >> std::quoted(value)) fields.emplace(key, decoded(value));
+            auto text = [&](const char* name) {
+                auto found = fields.find(name);
+                return found == fields.end() ? std::nullopt : std::optional<std::string>(found->second);
+            };
+            auto number = [&](const char* name, uint64_t fallback = 0) {
+                return text(name) ? std::stoull(*text(name), nullptr, 0) : fallback;
             };
             if (kind == "set") {
-                if (read.fields.count("format")) settings_.summaryFormat = static_cast<int64_t>(number("format"));
+                settings_.summaryFormat = static_cast<int64_t>(number("format", HTTextFormatFormatted));
                 settings_.textOptions = static_cast<int64_t>(number("options"));
-                if (read.fields.count("sort")) settings_.textSort = read.fields["sort"];
+                settings_.textSort = text("sort").value_or("Dirty");
                 settings_.verbose = number("verbose");
                 settings_.summarize = number("summarize");
                 settings_.breakDownPhysHeft = number("breakdown");
             } else if (kind == "process") {
-                scripts.push_back(read);
+                processes.push_back(last = process(static_cast<int32_t>(number("pid")), {}, text("bits") != "32"));
+                if (auto name = text("name"))
+                    last->setName(*name), last->setDisplayString(*name + " [" + *text("pid") + "]");
+                last->setHiddenFromDisplay(text("hidden").has_value());
+                for (auto [at, end] = fields.equal_range("warning"); at != end; ++at)
+                    last->warnings().push_back(at->second);
+                if (auto error = text("error")) last->scriptError(*error);
             } else if (kind == "region") {
                 const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
-                HTScriptedRegion region{.objectId = number("id"),
-                                        .offset = number("offset") * kPage,
-                                        .size = (number("pages") ?: dirty + clean + swapped) * kPage + number("extra"),
-                                        .dirty = dirty * kPage,
-                                        .swapped = swapped * kPage,
-                                        .clean = clean * kPage,
-                                        .name = std::nullopt,
-                                        .start = number("start"),
-                                        .owned = number("owned") != 0,
-                                        .fake = number("unmapped") != 0};
-                if (read.fields.count("name")) region.name = read.fields["name"];
-                if (read.fields.count("path")) region.detailedName = read.fields["path"];
-                scripts.back().regions.push_back(region);
-            } else if (kind == "aux") {
-                Script& script = scripts.back();
-                if (!script.aux) script.aux = script.auxInto = std::make_shared<HTAuxDataMap>();
-                auto inner = std::make_shared<HTAuxDataMap>();
-                if (!key.empty() && value == "map")
-                    script.auxInto->set(key, inner), script.auxInto = inner;
-                else if (!key.empty())
-                    script.auxInto->set(key, std::make_shared<HTAuxData>(std::stoll(value), true));
-            } else if (kind == "global-error") {
-                HTProcess::_addGlobalError(decoded(value));
+                last->script().push_back({.objectId = number("id"),
+                                          .offset = number("offset") * kPage,
+                                          .size = number("pages", dirty + clean + swapped) * kPage + number("extra"),
+                                          .dirty = dirty * kPage,
+                                          .swapped = swapped * kPage,
+                                          .clean = clean * kPage,
+                                          .name = text("name"),
+                                          .detailedName = text("path"),
+                                          .start = number("start"),
+                                          .owned = text("owned").has_value(),
+                                          .fake = text("unmapped").has_value()});
             }
-        }
-        HTHeft::ProcessList processes;
-        for (Script& script : scripts) {
-            auto made = process(script.pid, script.regions, script.fields["bits"] != "32");
-            if (script.fields.count("name")) made->setName(script.fields["name"]);
-            if (script.fields.count("name"))
-                made->setDisplayString(made->name() + " [" + std::to_string(script.pid) + "]");
-            made->setHiddenFromDisplay(script.fields["hidden"] == "1");
-            made->warnings() = script.warnings;
-            if (script.fields.count("error")) made->scriptError(script.fields["error"]);
-            made->setAuxData(script.aux);
-            processes.push_back(made);
         }
         return processes;
     }
@@ -163,7 +132,6 @@ protected:
                 EXPECT_EQ(actual, contents(expected)) << "differs from " << expected;
             std::remove((path + extension).c_str());
         }
-        settings_ = HTSettings{.breakDownPhysHeft = false};
         HTProcess::_clearGlobalErrors();
     }
 };

@@ -71,6 +71,7 @@ public:
         gatherCount_.fetch_add(1, std::memory_order_relaxed);
     }
 
+    std::vector<HTScriptedRegion>& script() { return script_; }
     int gatherCount() const { return gatherCount_.load(std::memory_order_relaxed); }
     std::shared_ptr<HTAuxDataMap> auxData() override { return auxData_; }
     void setAuxData(std::shared_ptr<HTAuxDataMap> data) { auxData_ = std::move(data); }

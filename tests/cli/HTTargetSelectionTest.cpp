@@ -3,6 +3,7 @@
 
 #include <gtest/gtest.h>
 
+#include <iterator>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -11,13 +12,10 @@ namespace {
 
 constexpr int32_t kOwnPid = 500;
 
-// The words of `text`, split at blanks.
 std::vector<std::string> words(const std::string& text)
 {
     std::istringstream in(text);
-    std::vector<std::string> result;
-    for (std::string word; in >> word;) result.push_back(word);
-    return result;
+    return {std::istream_iterator<std::string>(in), std::istream_iterator<std::string>()};
 }
 
 // A small system: the kernel, init, two shells with a tree of workers below
@@ -26,8 +24,6 @@ class HTTargetSelectionTest : public testing::Test {
 protected:
     void SetUp() override
     {
-        HTProcess::_clearGlobalErrors();
-        platform_ = std::make_shared<HTFakePlatform>();
         platform_->ownPid = kOwnPid;
         platform_->addProcess(0, 0, "kernel_task", std::nullopt, PROC_FLAG_SYSTEM | PROC_FLAG_LP64);
         platform_->addProcess(1, 0, "init", "/sbin/init");
@@ -61,7 +57,7 @@ protected:
         return text;
     }
 
-    std::shared_ptr<HTFakePlatform> platform_;
+    std::shared_ptr<HTFakePlatform> platform_ = std::make_shared<HTFakePlatform>();
     HTSettings settings_;
     std::string standardError_;
 };
