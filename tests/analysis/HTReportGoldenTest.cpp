@@ -89,6 +89,7 @@ protected:
                 for (auto [at, end] = fields.equal_range("warning"); at != end; ++at)
                     last->warnings().push_back(at->second);
                 if (auto error = text("error")) last->scriptError(*error);
+                last->setPageSize(number("pagesize", kPage));
             } else if (kind == "region") {
                 const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
                 last->script().push_back({.objectId = number("id"),
@@ -101,7 +102,9 @@ protected:
                                           .detailedName = text("path"),
                                           .start = number("start"),
                                           .owned = text("owned").has_value(),
-                                          .fake = text("unmapped").has_value()});
+                                          .fake = text("unmapped").has_value(),
+                                          .wired = text("wired").has_value(),
+                                          .reclaimable = number("reclaimable") * kPage});
             }
         }
         return processes;

@@ -31,6 +31,8 @@ struct HTScriptedRegion {
     uint64_t start = 0;
     bool owned = false;  // ownedExclusivelyByParentProcess
     bool fake = false;   // owned memory that is not mapped
+    bool wired = false;
+    uint64_t reclaimable = 0;
 };
 
 class HTScriptedProcess : public HTProcess {
@@ -64,6 +66,8 @@ public:
             region->setDetailedName(line.detailedName);
             region->setInSharedCache(line.inSharedCache);
             region->setOwnedExclusivelyByParentProcess(line.owned);
+            region->setWired(line.wired);
+            region->setReclaimableSize(line.reclaimable);
             if (line.fake) region->setUser_tag(HTFakeRegionTag);
             regions.push_back(region);
         }

@@ -61,7 +61,7 @@ TEST_F(HTHeftMainTest, OnlyTheBreakdownModeAsksWhichObjectsAProcessOwns)
     EXPECT_GT(platform_->ownedVmObjectQueries, 0);
 }
 
-TEST_F(HTHeftMainTest, RunningOutOfMemorySaysWhereAndLeavesNoFile)
+TEST_F(HTHeftMainTest, TheJSONFileIsOpenedFirstAndGoneWhenTheRunFails)
 {
     char directory[] = "/tmp/heft-main-XXXXXX";
     ASSERT_NE(mkdtemp(directory), nullptr);
@@ -70,6 +70,11 @@ TEST_F(HTHeftMainTest, RunningOutOfMemorySaysWhereAndLeavesNoFile)
               std::make_tuple(1, "", "heft: out of memory while gathering the processes' memory\n"));
     // The JSON file begun before the gathering is gone with its directory entry.
     EXPECT_EQ(rmdir(directory), 0) << std::strerror(errno);
+    platform_->outOfMemoryInWalk = false;
+    auto [status, out, error] = run({"-j", std::string(directory) + "/out.json", "42"});
+    EXPECT_EQ(status, 1);
+    EXPECT_EQ(error,
+              "Unable to open JSON output file '" + std::string(directory) + "/out.json': No such file or directory\n");
 }
 
 TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRootNamingProcessesDoesNot)
