@@ -14,96 +14,18 @@ HTMemoryObject* objectOf(const HTProcess& process, size_t region)
     return process.memoryRegions().at(region)->memoryObject().get();
 }
 
-HTScriptedRegion with(HTScriptedRegion region, uint8_t segment, uint8_t shareMode = SM_SHARED, uint64_t offset = 0)
-{
-    region.segment = segment;
-    region.shareMode = shareMode;
-    region.offset = offset;
-    return region;
-}
-
-TEST_F(HTHeftTest, ObjectIdsAreSharedWithinOneMapOnly)
-{
-    // __TEXT and __LINKEDIT have maps of their own; other segments do not.
-    auto p10 = process(10,
-                       {dirtyPages(0x100, 1), with(dirtyPages(0x100, 1), HTSegmentText),
-                        with(dirtyPages(0x200, 1), HTSegmentLinkEdit)});
-    auto p20 = process(
-        20,
-        {dirtyPages(0x100, 1), with(dirtyPages(0x100, 1), HTSegmentText), with(dirtyPages(0x200, 1), HTSegmentOther)});
-    auto heft = gathered({p10, p20});
-    EXPECT_EQ(objectOf(*p10, 0), objectOf(*p20, 0));
-    EXPECT_EQ(objectOf(*p10, 1), objectOf(*p20, 1));
-    EXPECT_NE(objectOf(*p10, 0), objectOf(*p10, 1));
-    EXPECT_NE(objectOf(*p10, 2), objectOf(*p20, 2));
-    ASSERT_EQ(heft->memoryObjects()->size(), 2u);
-    EXPECT_EQ(heft->memoryObjects()->begin()->first, 0x100u);  // in the order first met
-    EXPECT_EQ(heft->textMemoryObjects()->size(), 1u);
-    EXPECT_EQ(heft->linkeditMemoryObjects()->size(), 1u);
-    EXPECT_EQ(heft->memoryObjects()->find(0x200), objectOf(*p20, 2));
-    EXPECT_TRUE(objectOf(*p20, 2)->accurateSizes());
-}
-
-TEST_F(HTHeftTest, TouchedCopyOnWriteMemoryBelongsToItsProcess)
-{
-    auto cow = [](uint64_t dirty, uint64_t swapped) {
-        return HTScriptedRegion{.objectId = 0x300,
-                                .dirty = dirty,
-                                .swapped = swapped,
-                                .clean = kPage - dirty - swapped,
-                                .shareMode = SM_COW};
-    };
-    auto p10 = process(10, {cow(kPage, 0)}), p20 = process(20, {cow(0, 0)}), p30 = process(30, {cow(0, 0)}),
-         p40 = process(40, {cow(0, kPage)});
-    auto heft = gathered({p10, p20, p30, p40});
-    EXPECT_EQ(objectOf(*p20, 0), objectOf(*p30, 0));
-    EXPECT_NE(objectOf(*p40, 0), objectOf(*p20, 0));
-    EXPECT_EQ(heft->memoryObjects()->size(), 3u);
-    EXPECT_EQ(heft->memoryObjects()->find(0x300 ^ (uint64_t{10} << 32)), objectOf(*p10, 0));
-    EXPECT_EQ(objectOf(*p10, 0)->totalDirtySize(), kPage);
-}
-
-TEST_F(HTHeftTest, KeysZeroAndAllOnesAreNeverMergedSharedCacheIsKeyedByAddress)
-{
-    HTScriptedRegion noId{.objectId = 0}, onesId{.objectId = UINT64_MAX},
-        cacheAtZero{.objectId = 5, .inSharedCache = true, .start = 0},
-        cache{.objectId = 5, .inSharedCache = true, .start = 0x70000000},
-        otherPiece{.objectId = 5, .inSharedCache = true, .start = 0x70004000},
-        touchedAllOnes{.objectId = UINT64_MAX, .dirty = kPage, .shareMode = SM_COW},
-        // A copy-on-write key that the pid mixes down to 0.
-        mixesToZero{.objectId = uint64_t{10} << 32, .dirty = kPage, .shareMode = SM_COW};
-    auto p10 = process(10, {noId, noId, onesId, onesId, cacheAtZero, cacheAtZero, touchedAllOnes, mixesToZero});
-    auto p20 = process(20, {noId, onesId, cacheAtZero});
-    auto heft = gathered({p10, p20});
-    EXPECT_EQ(heft->uniqueMemoryObjects().size(), 11u);
-    EXPECT_TRUE(heft->memoryObjects()->empty());
-    EXPECT_TRUE(heft->sharedCache64MemoryObjects()->empty());
-
-    // The shared cache is keyed by address, per word size.
-    p10 = process(10, {cache, otherPiece});
-    p20 = process(20, {cache}, /*is64bit=*/false);
-    auto p30 = process(30, {cache});
-    heft = gathered({p10, p20, p30});
-    EXPECT_EQ(objectOf(*p10, 0), objectOf(*p30, 0));
-    EXPECT_NE(objectOf(*p10, 0), objectOf(*p10, 1));
-    EXPECT_NE(objectOf(*p10, 0), objectOf(*p20, 0));
-    EXPECT_EQ(heft->sharedCache64MemoryObjects()->size(), 2u);
-    EXPECT_EQ(heft->sharedCache32MemoryObjects()->size(), 1u);
-    EXPECT_TRUE(heft->memoryObjects()->empty());
-}
-
 TEST_F(HTHeftTest, SwitchesDecideOwnersAndProcessViews)
 {
     // p20 maps the object through two regions, which would give it a view of
     // its own; p10 owns it.
-    HTScriptedRegion owned = dirtyPages(0x500, 1);
+    HTScriptedRegion owned = dirtyPages(0x500, 1), secondPage = dirtyPages(0x500, 1);
     owned.owned = true;
+    secondPage.offset = kPage;
     auto run = [&](bool breakdown, bool sharingDisabled) {
         settings_.breakDownPhysHeft = breakdown;
         settings_.sharingAnalysisDisabled = sharingDisabled;
         auto p10 = process(10, {owned});
-        auto heft = gathered(
-            {p10, process(20, {dirtyPages(0x500, 1), with(dirtyPages(0x500, 1), HTSegmentNoImage, SM_SHARED, kPage)})});
+        auto heft = gathered({p10, process(20, {dirtyPages(0x500, 1), secondPage})});
         return std::make_pair(objectOf(*p10, 0)->ownerPid(), objectOf(*p10, 0)->processMemoryRegions().has_value());
     };
     EXPECT_EQ(run(true, false), std::make_pair(10, true));

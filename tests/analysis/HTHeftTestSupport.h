@@ -6,6 +6,7 @@
 #include "analysis/HTScriptedProcess.h"
 #include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
+#include "process/HTUserProcess.h"
 
 #include <gtest/gtest.h>
 
@@ -76,4 +77,36 @@ inline std::string pidsOf(const std::vector<std::shared_ptr<HTProcess>>& process
 inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n)
 {
     return HTScriptedRegion{.objectId = id, .size = n * kPage, .dirty = n * kPage};
+}
+
+// A child of pid 100 with private anonymous mappings of `identities.size()`
+// written pages from 0x10000, `regionPages` pages a mapping (all in one when
+// 0), with a page of gap between them; a page's identity is 0 when only its
+// process maps it. Returns the process, read in with `settings`.
+inline std::shared_ptr<HTUserProcess> forkedProcess(const std::shared_ptr<HTFakePlatform>& platform, int32_t pid,
+                                                    const std::vector<uint64_t>& identities, size_t regionPages,
+                                                    const HTSettings& settings)
+{
+    HTFakePlatform::Process& process = platform->addProcess(pid, 100, "worker");
+    if (regionPages == 0) regionPages = identities.size();
+    for (size_t first = 0; first < identities.size(); first += regionPages) {
+        const size_t pages = std::min(regionPages, identities.size() - first);
+        HTFakePlatform::Region region;
+        region.start = 0x10000 + first / regionPages * (regionPages + 1) * kPage;
+        region.size = pages * kPage;
+        region.info.protection = VM_PROT_READ | VM_PROT_WRITE;
+        region.info.share_mode = SM_COW;
+        region.info.ref_count = 2;
+        region.info.pages_resident = region.info.pages_dirtied = static_cast<uint32_t>(pages);
+        region.info.object_id_full = 0x4000000000000000 | static_cast<uint64_t>(pid) << 8 | first;
+        process.regions.push_back(region);
+        for (size_t i = 0; i < pages; ++i) {
+            process.dispositions[region.start + i * kPage] = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
+            if (identities[first + i]) process.pageIdentities[region.start + i * kPage] = identities[first + i];
+        }
+    }
+    auto made = std::make_shared<HTUserProcess>(platform);
+    made->setSettings(settings);
+    EXPECT_TRUE(made->initWithBsdInfo(process.info));
+    return made;
 }

@@ -65,7 +65,7 @@ protected:
                 if (value == "map") auxInto = inner;
             }
             std::multimap<std::string, std::string> fields;
-            if (kind == "process" && in >> value) fields.emplace("pid", value);
+            if ((kind == "process" || kind == "forked") && in >> value) fields.emplace("pid", value);
             while (in >> std::quoted(key) >> std::quoted(value)) fields.emplace(key, decoded(value));
             auto text = [&](const char* name) {
                 auto found = fields.find(name);
@@ -90,6 +90,12 @@ protected:
                     last->warnings().push_back(at->second);
                 if (auto error = text("error")) last->scriptError(*error);
                 last->setPageSize(number("pagesize", kPage));
+            } else if (kind == "forked") {
+                std::vector<uint64_t> identities;
+                std::istringstream list(text("pages").value_or(""));
+                for (std::string id; std::getline(list, id, ',');) identities.push_back(std::stoull(id));
+                processes.push_back(forkedProcess(platform_, static_cast<int32_t>(number("pid")), identities,
+                                                  number("per"), settings_));
             } else if (kind == "region") {
                 const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
                 last->script().push_back({.objectId = number("id"),
@@ -98,8 +104,11 @@ protected:
                                           .dirty = dirty * kPage,
                                           .swapped = swapped * kPage,
                                           .clean = clean * kPage,
+                                          .shareMode = text("cow") ? SM_COW : SM_SHARED,
+                                          .segment = static_cast<uint8_t>(number("segment", HTSegmentNoImage)),
                                           .name = text("name"),
                                           .detailedName = text("path"),
+                                          .inSharedCache = text("cache").has_value(),
                                           .start = number("start"),
                                           .owned = text("owned").has_value(),
                                           .fake = text("unmapped").has_value(),
