@@ -1,7 +1,6 @@
 #include "analysis/HTHeftTestSupport.h"
 #include "analysis/HTMemoryObjectMap.h"
 #include "model/HTMemoryObject.h"
-#include "process/HTProcessGroup.h"
 
 #include <gtest/gtest.h>
 
@@ -52,52 +51,6 @@ TEST_F(HTHeftTest, HeftFollowsTheBreakdownSwitch)
         EXPECT_EQ(pidsOf(heft->_processesBySortingHeft(heft->_notHiddenProcesses())), "{10,25,20}");
         EXPECT_EQ(pidsOf(HTHeftProbe::_processesBySortingPidDesc(heft->processes())), "{30,25,20,10}");
     }
-}
-
-TEST_F(HTHeftTest, GroupsAreUnifiedAndPrivateGroupsComeFirst)
-{
-    auto p10 = process(10, {dirtyPages(1, 1), dirtyPages(2, 1), dirtyPages(5, 1), dirtyPages(6, 1)});
-    auto p20 = process(20, {dirtyPages(1, 1), dirtyPages(6, 1), dirtyPages(5, 1)});
-    auto p30 = process(30, {dirtyPages(5, 1), dirtyPages(6, 1), dirtyPages(5, 1)});
-    auto heft = gathered({p10, p20, p30});
-    auto sharing = heft->_sharingData();
-    auto groupsOf = [&](int32_t pid) {
-        std::string text;
-        for (const auto& group : *sharing->processToProcessGroups().find(pid)) text += pidsOf(group->processes());
-        return text;
-    };
-    // The shared group {10,20} was met before p10's private one.
-    EXPECT_EQ(groupsOf(10), "{10}{10,20}{10,20,30}");
-    EXPECT_EQ(groupsOf(20), "{10,20}{10,20,30}");
-    // Objects with the same set of processes share one group instance.
-    const auto& all = *sharing->processToProcessGroups().find(30);
-    EXPECT_EQ(sharing->processToProcessGroups().find(10)->operator[](2), all[0]);
-    const auto* objects = sharing->processGroupToObjects().find(*all[0]);
-    ASSERT_NE(objects, nullptr);
-    EXPECT_EQ(objects->size(), 2u);
-    EXPECT_TRUE(objects->contains(objectOf(*p10, 2)) && objects->contains(objectOf(*p10, 3)));
-    EXPECT_EQ(sharing->processGroupToObjects().size(), 3u);
-}
-
-TEST_F(HTHeftTest, HiddenProcessesJoinOnlyThroughOwnedMemoryWithAFakeRegion)
-{
-    HTScriptedRegion owned = dirtyPages(1, 1), ownedMappedOnly = dirtyPages(2, 1);
-    owned.owned = ownedMappedOnly.owned = true;
-    HTScriptedRegion ownedUnmapped = owned;
-    ownedUnmapped.fake = true;
-    auto groupsFor = [&](bool breakdown) {
-        settings_.breakDownPhysHeft = breakdown;
-        auto hidden = process(40, {dirtyPages(1, 1), dirtyPages(2, 1), dirtyPages(3, 1)});
-        hidden->setHiddenFromDisplay(true);
-        auto sharing = gathered({process(10, {owned, ownedUnmapped, ownedMappedOnly}), hidden})->_sharingData();
-        std::string text;
-        for (const auto& [group, objects] : sharing->processGroupToObjects())
-            text += pidsOf(group->processes()) + std::to_string(objects.size());
-        return text + (sharing->processToProcessGroups().contains(40) ? " 40 grouped" : "");
-    };
-    EXPECT_EQ(groupsFor(true), "{10,40}1{10}1 40 grouped");
-    // Owners are known only in the breakdown mode.
-    EXPECT_EQ(groupsFor(false), "{10}2");
 }
 
 TEST(HTMemoryObjectMapTest, FindsEveryKeyAndKeepsInsertionOrder)

@@ -2,9 +2,7 @@
 
 #include "analysis/HTHeft.h"
 #include "analysis/HTHeftReport.h"
-#include "analysis/HTHeftSharingData.h"
 #include "analysis/HTScriptedProcess.h"
-#include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTUserProcess.h"
 
@@ -23,10 +21,6 @@ public:
     using HTHeft::_processesBySortingPidDesc;
     using HTHeft::HTHeft;
 
-    std::unique_ptr<HTHeftSharingData> _sharingData()
-    {
-        return HTSharingAnalysis::sharingDataForProcesses(processes());
-    }
     // The totals of the summary, or of `objects` as `process` sees them.
     HTMemoryTotals _total(const ObjectSet* objects = nullptr, HTProcess* process = nullptr)
     {
