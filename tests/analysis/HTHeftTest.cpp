@@ -32,27 +32,6 @@ TEST_F(HTHeftTest, SwitchesDecideOwnersAndProcessViews)
     EXPECT_EQ(run(true, true), std::make_pair(10, false));
 }
 
-TEST_F(HTHeftTest, HeftFollowsTheBreakdownSwitch)
-{
-    // p10 maps the same two dirty pages twice, and a swapped page; p20 maps
-    // the first of the two pages. Without the breakdown every object counts
-    // once and whole in each heft; with it each region counts as reported.
-    for (bool breakdown : {false, true}) {
-        settings_.breakDownPhysHeft = breakdown;
-        auto hidden = process(30, {dirtyPages(1, 2)});
-        hidden->setHiddenFromDisplay(true);
-        auto heft = gathered({process(10, {dirtyPages(1, 2), dirtyPages(1, 2), {.objectId = 2, .swapped = kPage}}),
-                              process(20, {dirtyPages(1, 1)}), process(25, {dirtyPages(1, 2)}), hidden});
-        EXPECT_EQ(*heft->pidToHeft().find(10), (breakdown ? 5 : 3) * kPage);
-        EXPECT_EQ(*heft->pidToHeft().find(20), (breakdown ? 1 : 2) * kPage);
-        EXPECT_FALSE(heft->pidToHeft().contains(30));
-        if (breakdown) continue;
-        // Equal hefts: larger pid first.
-        EXPECT_EQ(pidsOf(heft->_processesBySortingHeft(heft->_notHiddenProcesses())), "{10,25,20}");
-        EXPECT_EQ(pidsOf(HTHeftProbe::_processesBySortingPidDesc(heft->processes())), "{30,25,20,10}");
-    }
-}
-
 TEST(HTMemoryObjectMapTest, FindsEveryKeyAndKeepsInsertionOrder)
 {
     // Small keys all share one hash; large ones spread. The hint is too

@@ -16,9 +16,6 @@ constexpr uint64_t kPage = 4096;
 // The driver with its internal steps opened up for tests.
 class HTHeftProbe : public HTHeft {
 public:
-    using HTHeft::_notHiddenProcesses;
-    using HTHeft::_processesBySortingHeft;
-    using HTHeft::_processesBySortingPidDesc;
     using HTHeft::HTHeft;
 
     // The totals of the summary, or of `objects` as `process` sees them.
@@ -58,14 +55,6 @@ protected:
     std::shared_ptr<HTFakePlatform> platform_;
     HTSettings settings_;
 };
-
-// The pids of the processes, as "{10,20}".
-inline std::string pidsOf(const std::vector<std::shared_ptr<HTProcess>>& processes)
-{
-    std::string text = "{";
-    for (const auto& process : processes) text += (text.size() > 1 ? "," : "") + std::to_string(process->pid());
-    return text + "}";
-}
 
 // `n` pages of object `id`, all dirty, mapped shared.
 inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n)
