@@ -117,7 +117,9 @@ class HTGatedProcess : public HTScriptedProcess {
 public:
     HTGatedProcess(std::shared_ptr<HTPlatform> platform, int32_t pid, std::shared_future<void> gate,
                    std::once_flag* signalled)
-        : HTScriptedProcess(std::move(platform), pid, {dirtyPages(pid, 1)}), gate_(gate), signalled_(signalled)
+        : HTScriptedProcess(std::move(platform), pid, {{.objectId = static_cast<uint64_t>(pid), .dirty = kPage}}),
+          gate_(gate),
+          signalled_(signalled)
     {
     }
     void gatherData() override

@@ -56,12 +56,6 @@ protected:
     HTSettings settings_;
 };
 
-// `n` pages of object `id`, all dirty, mapped shared.
-inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n)
-{
-    return HTScriptedRegion{.objectId = id, .size = n * kPage, .dirty = n * kPage};
-}
-
 // A child of pid 100 with private anonymous mappings of `identities.size()`
 // written pages from 0x10000, `regionPages` pages a mapping (all in one when
 // 0), with a page of gap between them; a page's identity is 0 when only its

@@ -81,6 +81,7 @@ protected:
                 settings_.verbose = number("verbose");
                 settings_.summarize = number("summarize");
                 settings_.breakDownPhysHeft = number("breakdown");
+                settings_.sharingAnalysisDisabled = number("nosharing");
             } else if (kind == "process") {
                 processes.push_back(last = process(static_cast<int32_t>(number("pid")), {}, text("bits") != "32"));
                 if (auto name = text("name"))
