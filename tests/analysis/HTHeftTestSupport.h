@@ -18,14 +18,12 @@ class HTHeftProbe : public HTHeft {
 public:
     using HTHeft::HTHeft;
 
-    // The totals of the summary, or of `objects` as `process` sees them.
-    HTMemoryTotals _total(const ObjectSet* objects = nullptr, HTProcess* process = nullptr)
+    // The totals of the summary.
+    HTMemoryTotals _total()
     {
-        HTHeftReport report(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, true);
         HTMemoryTotals total;
-        HTHeftReport::_totalForCategories(objects ? report._categoriesForObjects(*objects, *process, nullptr)
-                                                  : report._categoriesForAllProcesses(processes()),
-                                          &total);
+        HTHeftReport report(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, true);
+        HTHeftReport::_totalForCategories(report._categoriesForAllProcesses(processes()), &total);
         return total;
     }
 };

@@ -29,16 +29,12 @@ std::string contents(const std::string& path)
     return text.str();
 }
 
-std::string decoded(const std::string& text)
+// `text` with each %XX replaced by the byte XX.
+std::string decoded(std::string text)
 {
-    std::string bytes;
-    for (size_t i = 0; i < text.size(); ++i) {
-        if (text[i] != '%')
-            bytes += text[i];
-        else
-            bytes += static_cast<char>(std::stoi(text.substr(i + 1, 2), nullptr, 16)), i += 2;
-    }
-    return bytes;
+    for (size_t at = 0; (at = text.find('%', at)) != std::string::npos; ++at)
+        text.replace(at, 3, 1, static_cast<char>(std::stoi(text.substr(at + 1, 2), nullptr, 16)));
+    return text;
 }
 
 class HTReportGoldenTest : public HTAnalysisTest {
@@ -84,8 +80,8 @@ protected:
                 settings_.sharingAnalysisDisabled = number("nosharing");
             } else if (kind == "process") {
                 processes.push_back(last = process(static_cast<int32_t>(number("pid")), {}, text("bits") != "32"));
-                if (auto name = text("name"))
-                    last->setName(*name), last->setDisplayString(*name + " [" + *text("pid") + "]");
+                if (text("name")) last->setName(*text("name"));
+                last->setDisplayString(last->name() + " [" + *text("pid") + "]");
                 last->setHiddenFromDisplay(text("hidden").has_value());
                 for (auto [at, end] = fields.equal_range("warning"); at != end; ++at)
                     last->warnings().push_back(at->second);
