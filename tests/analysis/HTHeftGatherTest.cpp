@@ -112,26 +112,17 @@ TEST(HTHeftGatherSignalSourceTest, DeliversSigintToAThreadAndRestoresItOnCancel)
     EXPECT_EQ(sigintState(), std::make_pair(false, true));
 }
 
-// Sends SIGINT as it begins, once for all of them, then waits at the gate.
-class HTGatedProcess : public HTScriptedProcess {
-public:
-    HTGatedProcess(std::shared_ptr<HTPlatform> platform, int32_t pid, std::shared_future<void> gate,
-                   std::once_flag* signalled)
-        : HTScriptedProcess(std::move(platform), pid, {{.objectId = static_cast<uint64_t>(pid), .dirty = kPage}}),
-          gate_(gate),
-          signalled_(signalled)
-    {
-    }
+// Sends SIGINT as the first of them begins, then waits at the gate.
+struct HTGatedProcess : HTScriptedProcess {
+    using HTScriptedProcess::HTScriptedProcess;
     void gatherData() override
     {
-        std::call_once(*signalled_, [] { kill(getpid(), SIGINT); });
-        gate_.wait();
+        std::call_once(*signalled, [] { kill(getpid(), SIGINT); });
+        gate.wait();
         HTScriptedProcess::gatherData();
     }
-
-private:
-    std::shared_future<void> gate_;
-    std::once_flag* signalled_;
+    std::shared_future<void> gate;
+    std::once_flag* signalled = nullptr;
 };
 
 TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
@@ -143,10 +134,13 @@ TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
     std::promise<void> gate;
     const std::shared_future<void> opened = gate.get_future().share();
     std::once_flag signalled;
-    std::vector<std::shared_ptr<HTScriptedProcess>> scripted;
-    for (size_t i = 0; i < count; ++i)
-        scripted.push_back(
-            std::make_shared<HTGatedProcess>(platform_, static_cast<int32_t>(100 + i), opened, &signalled));
+    std::vector<std::shared_ptr<HTGatedProcess>> scripted;
+    for (int32_t pid = 100; scripted.size() < count; ++pid) {
+        scripted.push_back(std::make_shared<HTGatedProcess>(
+            platform_, pid, std::vector<HTScriptedRegion>{{.objectId = static_cast<uint64_t>(pid), .dirty = kPage}}));
+        scripted.back()->gate = opened;
+        scripted.back()->signalled = &signalled;
+    }
 
     // On a terminal Ctrl-C keeps its default action.
     platform_->terminals = {1};
