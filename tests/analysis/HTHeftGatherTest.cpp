@@ -84,7 +84,7 @@ TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
 
 TEST(HTHeftGatherSignalSourceTest, DeliversSigintToAThreadAndRestoresItOnCancel)
 {
-    ASSERT_EQ(sigintState(), std::make_pair(false, true));
+    ASSERT_FALSE(sigintState().first);
     std::promise<void> handled;
     std::atomic<int> calls{0};
     std::thread::id handlerThread;
