@@ -5,12 +5,12 @@
 #include "analysis/HTHeftTestSupport.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
+#include "output/HTExpectedReport.h"
 #include "output/HTOutputFormatterJSON.h"
 #include "output/HTOutputFormatterText.h"
 
 #include <gtest/gtest.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 #include <iomanip>
@@ -132,13 +132,8 @@ protected:
             heft->printOutputVerbose(settings_.verbose, settings_.summarize);
             std::fclose(text);
         }
-        const char* update = std::getenv("HEFT_UPDATE_REPORTS");
         for (const char* extension : {".txt", ".json"}) {
-            const std::string actual = contents(path + extension), expected = kReports + name + extension;
-            if (update && *update && std::string(update) != "0")
-                std::ofstream(expected, std::ios::binary) << actual;
-            else
-                EXPECT_EQ(actual, contents(expected)) << "differs from " << expected;
+            expectReport(name + extension, contents(path + extension));
             std::remove((path + extension).c_str());
         }
         HTProcess::_clearGlobalErrors();
