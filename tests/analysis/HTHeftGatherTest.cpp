@@ -4,7 +4,6 @@
 #include "analysis/HTHeftTestSupport.h"
 #include "base/HTNoticeLog.h"
 #include "cli/HTCancelHandler.h"
-#include "output/HTOutputCapture.h"
 #include "output/HTOutputFormatterText.h"
 #include "platform/HTSignalSource.h"
 #include "platform/HTWorkQueue.h"
@@ -17,6 +16,7 @@
 #include <chrono>
 #include <csignal>
 #include <cstring>
+#include <future>
 #include <mutex>
 #include <pthread.h>
 #include <set>
@@ -32,18 +32,14 @@ using HTHeftGatherTest = HTAnalysisTest;
 
 int currentThreadNice() { return getpriority(PRIO_PROCESS, static_cast<id_t>(syscall(SYS_gettid))); }
 
-bool sigintBlockedHere()
+// Whether SIGINT is blocked on this thread, and whether it has its default action.
+std::pair<bool, bool> sigintState()
 {
     sigset_t mask;
     pthread_sigmask(SIG_BLOCK, nullptr, &mask);
-    return sigismember(&mask, SIGINT) == 1;
-}
-
-bool sigintHasDefaultAction()
-{
     struct sigaction action {};
     sigaction(SIGINT, nullptr, &action);
-    return action.sa_handler == SIG_DFL;
+    return {sigismember(&mask, SIGINT) == 1, action.sa_handler == SIG_DFL};
 }
 
 TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
@@ -52,25 +48,24 @@ TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
     EXPECT_EQ(queue.threadCount(), 3u);
     const int callerNice = currentThreadNice();
     const auto caller = std::this_thread::get_id();
-
     // Two loops on one pool: workers join each loop afresh.
     for (size_t count : {size_t{1000}, size_t{7}}) {
         std::vector<std::atomic<int>> runs(count);
         std::mutex mutex;
-        std::set<std::string> workerNames;
-        std::set<int> workerNices;
+        std::set<std::pair<std::string, int>> workers;
         queue.parallelFor(count, [&](size_t i) {
             runs[i].fetch_add(1);
             if (std::this_thread::get_id() == caller) return;
             char name[16] = {};
             pthread_getname_np(pthread_self(), name, sizeof(name));
             std::lock_guard<std::mutex> lock(mutex);
-            workerNames.insert(name);
-            workerNices.insert(currentThreadNice());
+            workers.emplace(name, currentThreadNice());
         });
         for (size_t i = 0; i < count; ++i) EXPECT_EQ(runs[i].load(), 1) << "index " << i;
-        for (const auto& name : workerNames) EXPECT_EQ(name, "heft.gatherdata");
-        for (int nice : workerNices) EXPECT_EQ(nice, std::min(callerNice + HTWorkQueue::kNiceIncrement, 19));
+        for (const auto& worker : workers)
+            EXPECT_EQ(
+                worker,
+                std::make_pair(std::string("heft.gatherdata"), std::min(callerNice + HTWorkQueue::kNiceIncrement, 19)));
     }
     queue.parallelFor(0, [](size_t) { ADD_FAILURE() << "no iteration expected"; });
     EXPECT_EQ(currentThreadNice(), callerNice);
@@ -89,54 +84,62 @@ TEST(HTHeftGatherWorkQueueTest, RunsEveryIndexOnceOnLowPriorityNamedWorkers)
 
 TEST(HTHeftGatherSignalSourceTest, DeliversSigintToAThreadAndRestoresItOnCancel)
 {
-    ASSERT_FALSE(sigintBlockedHere());
-    HTGate handled;
+    ASSERT_FALSE(sigintState().first);
+    std::promise<void> handled;
     std::atomic<int> calls{0};
     std::thread::id handlerThread;
     auto source = HTSignalSource::create(SIGINT, [&] {
         handlerThread = std::this_thread::get_id();
-        if (calls.fetch_add(1) == 1) handled.open();
+        if (calls.fetch_add(1) == 1) handled.set_value();
     });
     ASSERT_NE(source, nullptr);
-    EXPECT_TRUE(sigintBlockedHere());
-    EXPECT_FALSE(sigintHasDefaultAction());
+    EXPECT_EQ(sigintState(), std::make_pair(true, false));
 
     // A process-directed signal, as Ctrl-C sends, twice.
     kill(getpid(), SIGINT);
     while (calls.load() == 0) std::this_thread::sleep_for(1ms);
     kill(getpid(), SIGINT);
-    ASSERT_TRUE(handled.waitFor(10s));
+    ASSERT_EQ(handled.get_future().wait_for(10s), std::future_status::ready);
     EXPECT_NE(handlerThread, std::this_thread::get_id());
 
     source->cancel();
     EXPECT_EQ(calls.load(), 2);
-    EXPECT_FALSE(sigintBlockedHere());
-    EXPECT_TRUE(sigintHasDefaultAction());
+    EXPECT_EQ(sigintState(), std::make_pair(false, true));
     source->cancel();  // a second cancel changes nothing
 
     // Without any signal, cancelling (here by destruction) stops it as well.
     HTSignalSource::create(SIGINT, [] { ADD_FAILURE() << "no signal was sent"; }).reset();
-    EXPECT_FALSE(sigintBlockedHere());
+    EXPECT_EQ(sigintState(), std::make_pair(false, true));
 }
+
+// Sends SIGINT as the first of them begins, then waits at the gate.
+struct HTGatedProcess : HTScriptedProcess {
+    using HTScriptedProcess::HTScriptedProcess;
+    void gatherData() override
+    {
+        std::call_once(*signalled, [] { kill(getpid(), SIGINT); });
+        gate.wait();
+        HTScriptedProcess::gatherData();
+    }
+    std::shared_future<void> gate;
+    std::once_flag* signalled = nullptr;
+};
 
 TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
 {
     // Every process waits at a gate until the SIGINT handler has cancelled
-    // the run, so at most one process per thread has begun by then; the
-    // first one started sends the signal.
+    // the run, so at most one process per thread has begun by then.
     const size_t threads = HTWorkQueue::defaultThreadCount() + 1;  // the workers and the caller
     const size_t count = threads + 3;
-    auto gate = std::make_shared<HTGate>();
+    std::promise<void> gate;
+    const std::shared_future<void> opened = gate.get_future().share();
     std::once_flag signalled;
-    auto sendSigint = [&] { std::call_once(signalled, [] { kill(getpid(), SIGINT); }); };
-
-    std::vector<std::shared_ptr<HTScriptedProcess>> scripted;
-    HTHeft::ProcessList processes;
-    for (size_t i = 0; i < count; ++i) {
-        const auto pid = static_cast<int32_t>(100 + i);
-        scripted.push_back(
-            std::make_shared<HTGatedProcess>(platform_, pid, std::vector{dirtyPages(pid, 1)}, gate, sendSigint));
-        processes.push_back(scripted.back());
+    std::vector<std::shared_ptr<HTGatedProcess>> scripted;
+    for (int32_t pid = 100; scripted.size() < count; ++pid) {
+        scripted.push_back(std::make_shared<HTGatedProcess>(
+            platform_, pid, std::vector<HTScriptedRegion>{{.objectId = static_cast<uint64_t>(pid), .dirty = kPage}}));
+        scripted.back()->gate = opened;
+        scripted.back()->signalled = &signalled;
     }
 
     // On a terminal Ctrl-C keeps its default action.
@@ -144,29 +147,34 @@ TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
     EXPECT_EQ(installCancelHandler(*platform_, [] {}), nullptr);
     platform_->terminals.clear();
 
-    HTHeftProbe heft(processes, settings_);
+    HTHeftProbe heft(HTHeft::ProcessList(scripted.begin(), scripted.end()), settings_);
     std::unique_ptr<HTSignalSource> source = installCancelHandler(*platform_, [&] {
         heft.cancel();
-        gate->open();
+        gate.set_value();
     });
     ASSERT_NE(source, nullptr);
     heft.gatherData();
     source->cancel();
-    EXPECT_TRUE(sigintHasDefaultAction());
+    EXPECT_TRUE(sigintState().second);
 
     EXPECT_TRUE(heft.earlyExit());
     size_t gatheredCount = 0;
     for (const auto& p : scripted) gatheredCount += p->gatherCount();
     EXPECT_GE(gatheredCount, 1u);
-    EXPECT_LE(gatheredCount, threads);
+    // Largest pid first: only the last `threads` of them may have begun.
+    for (size_t i = 0; i + threads < count; ++i) EXPECT_EQ(scripted[i]->gatherCount(), 0) << "pid " << 100 + i;
     EXPECT_THAT(HTProcess::globalErrors(), ::testing::ElementsAre(HTHeft::kEarlyExitError));
 
     // Every process still has its block, and the report ends with the
     // error in the diagnostics.
-    HTOutputCapture out;
-    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, out.file()));
+    char* data = nullptr;
+    size_t size = 0;
+    FILE* out = open_memstream(&data, &size);
+    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, out));
     heft.printOutputVerbose(false, false);
-    const std::string report = out.take();
+    std::fclose(out);
+    const std::string report(data, size);
+    std::free(data);
     size_t headers = 0;
     for (size_t at = 0; (at = report.find("\tHeft: ", at)) != std::string::npos; ++at) ++headers;
     EXPECT_EQ(headers, count);
@@ -192,7 +200,6 @@ TEST_F(HTHeftGatherTest, ProcessesReadSideBySideShareOneLineOnStandardError)
     locked.taskResult = HT_KERN_ERRNO_BASE | EPERM;
     EXPECT_FALSE(HTUserProcess(platform_).initWithBsdInfo(locked.info));
     gathered(processes);
-
     EXPECT_EQ(HTNoticeLog::standardError().take(),
               (std::vector<std::string>{std::string("locked [600]: could not be opened: ") + std::strerror(EPERM),
                                         "worker [501], worker [502], worker [503], worker [504], worker [505] and 2 "

@@ -2,11 +2,9 @@
 
 #include "analysis/HTHeft.h"
 #include "analysis/HTHeftReport.h"
-#include "analysis/HTHeftSharingData.h"
-#include "analysis/HTMemoryObjectMap.h"
 #include "analysis/HTScriptedProcess.h"
-#include "analysis/HTSharingAnalysis.h"
 #include "platform/fake/HTFakePlatform.h"
+#include "process/HTUserProcess.h"
 
 #include <gtest/gtest.h>
 
@@ -18,44 +16,24 @@ constexpr uint64_t kPage = 4096;
 // The driver with its internal steps opened up for tests.
 class HTHeftProbe : public HTHeft {
 public:
-    using HTHeft::_addProcess;
-    using HTHeft::_buildProcessToHeftMap;
-    using HTHeft::_calculateHeftForProcess;
-    using HTHeft::_notHiddenProcesses;
-    using HTHeft::_processesBySortingHeft;
-    using HTHeft::_processesBySortingPidDesc;
     using HTHeft::HTHeft;
 
-    std::unique_ptr<HTHeftSharingData> _sharingData()
+    // The totals of the summary.
+    HTMemoryTotals _total()
     {
-        return HTSharingAnalysis::sharingDataForProcesses(processes());
-    }
-    HTCategoryMap _categoriesForAllProcessesShouldSummarize(bool summarize)
-    {
-        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
-            ._categoriesForAllProcesses(processes());
-    }
-    HTCategoryMap _categoriesForObjects(const ObjectSet& objects, HTProcess& process, bool* hasProcessView,
-                                        bool summarize)
-    {
-        return HTHeftReport(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, summarize)
-            ._categoriesForObjects(objects, process, hasProcessView);
-    }
-    static void _totalForCategories(const HTCategoryMap& categories, HTMemoryTotals* total)
-    {
-        HTHeftReport::_totalForCategories(categories, total);
+        HTMemoryTotals total;
+        HTHeftReport report(outputFormatters(), pidToHeft(), settings().breakDownPhysHeft, true);
+        HTHeftReport::_totalForCategories(report._categoriesForAllProcesses(processes()), &total);
+        return total;
     }
 };
 
 // Scripted processes on a fake platform. The global error list is
-// program-wide, so every test starts and ends with it empty.
+// program-wide, so every test ends with it empty.
 class HTAnalysisTest : public ::testing::Test {
 protected:
-    HTAnalysisTest() : platform_(std::make_shared<HTFakePlatform>()) { setBreakdown(false); }
+    HTAnalysisTest() : platform_(std::make_shared<HTFakePlatform>()) { settings_.breakDownPhysHeft = false; }
     ~HTAnalysisTest() override { HTProcess::_clearGlobalErrors(); }
-
-    // The settings of the processes and drivers made from here on.
-    void setBreakdown(bool on) { settings_.breakDownPhysHeft = on; }
 
     std::shared_ptr<HTScriptedProcess> process(int32_t pid, std::vector<HTScriptedRegion> script, bool is64bit = true)
     {
@@ -76,16 +54,34 @@ protected:
     HTSettings settings_;
 };
 
-// The pids of the processes, as "{10,20}".
-inline std::string pidsOf(const std::vector<std::shared_ptr<HTProcess>>& processes)
+// A child of pid 100 with private anonymous mappings of `identities.size()`
+// written pages from 0x10000, `regionPages` pages a mapping (all in one when
+// 0), with a page of gap between them; a page's identity is 0 when only its
+// process maps it. Returns the process, read in with `settings`.
+inline std::shared_ptr<HTUserProcess> forkedProcess(const std::shared_ptr<HTFakePlatform>& platform, int32_t pid,
+                                                    const std::vector<uint64_t>& identities, size_t regionPages,
+                                                    const HTSettings& settings)
 {
-    std::string text = "{";
-    for (const auto& process : processes) text += (text.size() > 1 ? "," : "") + std::to_string(process->pid());
-    return text + "}";
-}
-
-// `n` pages of object `id`, all dirty, mapped shared.
-inline HTScriptedRegion dirtyPages(uint64_t id, uint64_t n, const char* name = "region")
-{
-    return HTScriptedRegion{.objectId = id, .size = n * kPage, .dirty = n * kPage, .name = std::string(name)};
+    HTFakePlatform::Process& process = platform->addProcess(pid, 100, "worker");
+    if (regionPages == 0) regionPages = identities.size();
+    for (size_t first = 0; first < identities.size(); first += regionPages) {
+        const size_t pages = std::min(regionPages, identities.size() - first);
+        HTFakePlatform::Region region;
+        region.start = 0x10000 + first / regionPages * (regionPages + 1) * kPage;
+        region.size = pages * kPage;
+        region.info.protection = VM_PROT_READ | VM_PROT_WRITE;
+        region.info.share_mode = SM_COW;
+        region.info.ref_count = 2;
+        region.info.pages_resident = region.info.pages_dirtied = static_cast<uint32_t>(pages);
+        region.info.object_id_full = 0x4000000000000000 | static_cast<uint64_t>(pid) << 8 | first;
+        process.regions.push_back(region);
+        for (size_t i = 0; i < pages; ++i) {
+            process.dispositions[region.start + i * kPage] = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY;
+            if (identities[first + i]) process.pageIdentities[region.start + i * kPage] = identities[first + i];
+        }
+    }
+    auto made = std::make_shared<HTUserProcess>(platform);
+    made->setSettings(settings);
+    EXPECT_TRUE(made->initWithBsdInfo(process.info));
+    return made;
 }

@@ -1,206 +1,152 @@
-// Whole reports, text and JSON, driven through the analysis from scripted
-// processes and compared character for character with the expected reports
-// under tests/data/reports/ (see output/HTExpectedReport.h). This is the one
-// place that asserts the text of whole reports.
+// Whole reports, text and JSON, compared character for character with the
+// expected reports: the one place that asserts the text of whole reports.
+// tests/data/reports/README.md says how scenarios are written.
 
 #include "analysis/HTHeftTestSupport.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "output/HTExpectedReport.h"
-#include "output/HTOutputCapture.h"
 #include "output/HTOutputFormatterJSON.h"
 #include "output/HTOutputFormatterText.h"
 
 #include <gtest/gtest.h>
 
-#include <cstdio>
-#include <functional>
+#include <filesystem>
+#include <fstream>
+#include <iomanip>
+#include <map>
+#include <sstream>
 #include <string>
-#include <unistd.h>
 
 namespace {
 
-HTScriptedRegion region(uint64_t id, const char* name, uint64_t dirtyPages, uint64_t cleanPages = 0,
-                        uint64_t swappedPages = 0, const char* path = nullptr, uint64_t start = 0)
-{
-    HTScriptedRegion made{.objectId = id,
-                          .size = (dirtyPages + cleanPages + swappedPages) * kPage,
-                          .dirty = dirtyPages * kPage,
-                          .swapped = swappedPages * kPage,
-                          .clean = cleanPages * kPage,
-                          .name = std::string(name),
-                          .start = start};
-    if (path) made.detailedName = std::string(path);
-    return made;
-}
-
-HTScriptedRegion owned(HTScriptedRegion region, bool unmapped = false)
-{
-    region.owned = true;
-    region.fake = unmapped;
-    return region;
-}
-
-std::shared_ptr<HTAuxDataMap> aux(const char* key, int64_t value)
-{
-    auto data = std::make_shared<HTAuxDataMap>();
-    if (key) data->set(key, std::make_shared<HTAuxData>(value, true));
-    return data;
-}
+const std::string kReports = std::string(HEFT_TEST_DATA_DIR) + "/reports/";
 
 std::string contents(const std::string& path)
 {
-    std::string written;
-    if (FILE* in = std::fopen(path.c_str(), "rb")) {
-        for (int c; (c = std::fgetc(in)) != EOF;) written += static_cast<char>(c);
-        std::fclose(in);
-    }
-    return written;
+    std::stringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
+// `text` with each %XX replaced by the byte XX.
+std::string decoded(std::string text)
+{
+    for (size_t at = 0; (at = text.find('%', at)) != std::string::npos; ++at)
+        text.replace(at, 3, 1, static_cast<char>(std::stoi(text.substr(at + 1, 2), nullptr, 16)));
+    return text;
 }
 
 class HTReportGoldenTest : public HTAnalysisTest {
 protected:
-    struct Scenario {
-        const char* name;
-        std::function<HTHeft::ProcessList()> processes;
-        std::function<void(HTSettings&)> settings = [](HTSettings&) {};
-    };
-
-    // Reports the scenario's processes as text and as JSON, after its
-    // settings, and compares both with NAME.txt and NAME.json.
-    void expectReports(const Scenario& scenario)
+    // The processes of the scenario, after its settings.
+    HTHeft::ProcessList readScenario(const std::string& path)
     {
-        SCOPED_TRACE(scenario.name);
-        const HTSettings defaults = settings_;
-        scenario.settings(settings_);
-        char dir[] = "/tmp/htgoldenXXXXXX";
-        ASSERT_NE(mkdtemp(dir), nullptr);
-        const std::string path = std::string(dir) + "/report.json";
-        HTOutputCapture out;
-        {
-            auto heft = gathered(scenario.processes());
-            heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, out.file()));
-            heft->addOutputFormatter(
-                HTOutputFormatterJSON::initWithPath(path, settings_.breakDownPhysHeft, kPage, nullptr));
-            heft->printOutputVerbose(settings_.verbose, settings_.summarize);
+        settings_ = HTSettings{.breakDownPhysHeft = false, .summarize = false};
+        HTHeft::ProcessList processes;
+        std::shared_ptr<HTScriptedProcess> last;
+        std::shared_ptr<HTAuxDataMap> auxInto;
+        std::istringstream lines(contents(path));
+        for (std::string line, kind, key, value; std::getline(lines, line);) {
+            std::istringstream in(line);
+            if (!(in >> kind) || kind[0] == '#') continue;
+            if (kind == "global-error" && in >> std::quoted(value)) HTProcess::_addGlobalError(decoded(value));
+            if (kind == "aux") {
+                if (!last->auxData()) last->setAuxData(auxInto = std::make_shared<HTAuxDataMap>());
+                if (!(in >> std::quoted(key) >> std::quoted(value))) continue;
+                auto inner = std::make_shared<HTAuxDataMap>();
+                auxInto->set(key,
+                             value == "map" ? HTAuxDataMap::Value(inner)
+                                            : std::make_shared<HTAuxData>(std::stoll(value), true));
+                if (value == "map") auxInto = inner;
+            }
+            std::multimap<std::string, std::string> fields;
+            if ((kind == "process" || kind == "forked") && in >> value) fields.emplace("pid", value);
+            while (in >> std::quoted(key) >> std::quoted(value)) fields.emplace(key, decoded(value));
+            auto text = [&](const char* name) {
+                auto found = fields.find(name);
+                return found == fields.end() ? std::nullopt : std::optional<std::string>(found->second);
+            };
+            auto number = [&](const char* name, uint64_t fallback = 0) {
+                return text(name) ? std::stoull(*text(name), nullptr, 0) : fallback;
+            };
+            if (kind == "set") {
+                settings_.summaryFormat = static_cast<int64_t>(number("format", HTTextFormatFormatted));
+                settings_.textOptions = static_cast<int64_t>(number("options"));
+                settings_.textSort = text("sort").value_or("Dirty");
+                settings_.verbose = number("verbose");
+                settings_.summarize = number("summarize");
+                settings_.breakDownPhysHeft = number("breakdown");
+                settings_.sharingAnalysisDisabled = number("nosharing");
+            } else if (kind == "process") {
+                processes.push_back(last = process(static_cast<int32_t>(number("pid")), {}, text("bits") != "32"));
+                if (text("name")) last->setName(*text("name"));
+                last->setDisplayString(last->name() + " [" + *text("pid") + "]");
+                last->setHiddenFromDisplay(text("hidden").has_value());
+                for (auto [at, end] = fields.equal_range("warning"); at != end; ++at)
+                    last->warnings().push_back(at->second);
+                if (auto error = text("error")) last->scriptError(*error);
+                last->setPageSize(number("pagesize", kPage));
+            } else if (kind == "forked") {
+                std::vector<uint64_t> identities;
+                std::istringstream list(text("pages").value_or(""));
+                for (std::string id; std::getline(list, id, ',');) identities.push_back(std::stoull(id));
+                processes.push_back(forkedProcess(platform_, static_cast<int32_t>(number("pid")), identities,
+                                                  number("per"), settings_));
+            } else if (kind == "region") {
+                const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
+                last->script().push_back({.objectId = number("id"),
+                                          .offset = number("offset") * kPage,
+                                          .size = number("pages", dirty + clean + swapped) * kPage + number("extra"),
+                                          .dirty = dirty * kPage,
+                                          .swapped = swapped * kPage,
+                                          .clean = clean * kPage,
+                                          .shareMode = text("cow") ? SM_COW : SM_SHARED,
+                                          .segment = static_cast<uint8_t>(number("segment", HTSegmentNoImage)),
+                                          .name = text("name"),
+                                          .detailedName = text("path"),
+                                          .inSharedCache = text("cache").has_value(),
+                                          .start = number("start"),
+                                          .owned = text("owned").has_value(),
+                                          .fake = text("unmapped").has_value(),
+                                          .wired = text("wired").has_value(),
+                                          .reclaimable = number("reclaimable") * kPage});
+            }
         }
-        expectReport(std::string(scenario.name) + ".txt", out.take());
-        expectReport(std::string(scenario.name) + ".json", contents(path));
-        std::remove(path.c_str());
-        rmdir(dir);
-        settings_ = defaults;
+        return processes;
+    }
+
+    // The kernel's page size differs from the processes' so that the JSON
+    // shows which one it took.
+    void expectReports(const std::string& name)
+    {
+        SCOPED_TRACE(name);
+        const std::string path = testing::TempDir() + "heft-golden-report";
+        {
+            HTHeft::ProcessList processes = readScenario(kReports + name + ".scenario");
+            FILE* text = std::fopen((path + ".txt").c_str(), "w");
+            auto heft = gathered(processes);
+            heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, text));
+            heft->addOutputFormatter(
+                HTOutputFormatterJSON::initWithPath(path + ".json", settings_.breakDownPhysHeft, 4 * kPage, nullptr));
+            heft->printOutputVerbose(settings_.verbose, settings_.summarize);
+            std::fclose(text);
+        }
+        for (const char* extension : {".txt", ".json"}) {
+            expectReport(name + extension, contents(path + extension));
+            std::remove((path + extension).c_str());
+        }
         HTProcess::_clearGlobalErrors();
     }
 };
 
 TEST_F(HTReportGoldenTest, Reports)
 {
-    settings_.summarize = false;
-    auto withAux = [](std::shared_ptr<HTScriptedProcess> process, std::shared_ptr<HTAuxDataMap> data) {
-        process->setAuxData(std::move(data));
-        return process;
-    };
-    const Scenario scenarios[] = {
-        // Sizes below 10000 bytes fit the 7-character field unscaled. One
-        // process: the summary is only the counting-mode line, and the
-        // auxiliary data is not repeated.
-        {"one-process",
-         [&] {
-             return HTHeft::ProcessList{withAux(
-                 process(10, {region(1, "untagged", 2), region(2, "mapped file", 1, 3, 0, "/usr/lib/libfoo.so")}),
-                 aux("reserved", 8192))};
-         }},
-        // An empty map still gets its heading.
-        {"one-process-empty-aux",
-         [&] { return HTHeft::ProcessList{withAux(process(10, {region(1, "untagged", 1)}), aux(nullptr, 0))}; }},
-        // Two processes share an object, counted once in the summary, in
-        // bytes and by short names.
-        {"two-sharing-bytes",
-         [&] {
-             return HTHeft::ProcessList{process(20, {region(1, "shared memory", 1), region(3, "untagged", 1)}),
-                                        process(10, {region(1, "shared memory", 1), region(2, "untagged", 2)})};
-         },
-         [](HTSettings& s) {
-             s.summaryFormat = HTTextFormatBytes;
-             s.summarize = true;
-         }},
-        // In pages, wide: swapped and wired columns and full paths. Equal
-        // dirty figures: the one with more clean memory first.
-        {"two-sharing-wide-pages",
-         [&] {
-             return HTHeft::ProcessList{
-                 process(20, {region(1, "shared memory", 1), region(3, "mapped file", 1, 1, 0, "/usr/lib/libbar.so")}),
-                 process(10, {region(1, "shared memory", 1), region(2, "untagged", 1, 0, 1)})};
-         },
-         [](HTSettings& s) {
-             s.summaryFormat = HTTextFormatPages;
-             s.textOptions = HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide;
-         }},
-        // The stack is mapped but never touched: last by dirty size, third
-        // by name. Only the low 40 bits of the object id are listed.
-        {"verbose-by-category",
-         [&] {
-             HTScriptedRegion stack = region(5, "stack", 0, 0, 0, nullptr, 0x30000);
-             stack.size = kPage;
-             return HTHeft::ProcessList{process(10,
-                                                {region(4, "IOKit", 2, 0, 0, nullptr, 0x10000),
-                                                 region(3, "mapped file", 1, 1, 0, "/lib/x.so", 0x20000), stack,
-                                                 region(0x12300000002, "untagged", 3, 0, 0, nullptr, 0x40000)})};
-         },
-         [](HTSettings& s) {
-             s.textSort = "Category";
-             s.verbose = true;
-         }},
-        // A process with errors has no heft and no tables, and its
-        // auxiliary data stays out of the merged data; a global error.
-        {"errors-and-warnings",
-         [&] {
-             auto failed = withAux(process(10, {region(2, "heap", 2)}), aux("x", 5));
-             failed->scriptError("cannot read");
-             auto warned = withAux(process(20, {region(1, "untagged", 1)}), aux("x", 7));
-             warned->scriptWarning("exited");
-             HTProcess::_addGlobalError("task port");
-             return HTHeft::ProcessList{warned, failed};
-         }},
-        // p30 maps both pages of the object, the others one each: every
-        // member sees its own figures.
-        {"process-views",
-         [&] {
-             HTScriptedRegion secondPage = region(7, "shm", 1);
-             secondPage.offset = kPage;
-             return HTHeft::ProcessList{process(10, {region(7, "shm", 1)}), process(20, {region(7, "shm", 1)}),
-                                        process(30, {region(7, "shm", 1), secondPage})};
-         }},
-        // Memory p10 owns is clean to p20; the summary counts it once, dirty.
-        // Memory without a name is still shown, under "unknown".
-        {"owned-memory",
-         [&] {
-             HTScriptedRegion unnamed{.objectId = 10, .dirty = kPage, .name = std::nullopt};
-             return HTHeft::ProcessList{process(10, {owned(region(8, "shm", 1))}),
-                                        process(20, {region(8, "shm", 1), region(9, "heap", 2), unnamed})};
-         },
-         [](HTSettings& s) { s.breakDownPhysHeft = true; }},
-        // The hidden process maps memory p10 owns and has a fake region
-        // for, so it joins that memory's group; its other memory stays out.
-        {"hidden-process",
-         [&] {
-             auto hidden = process(30, {region(1, "shm", 1), region(3, "other", 4)});
-             hidden->setHiddenFromDisplay(true);
-             return HTHeft::ProcessList{
-                 process(10, {owned(region(1, "shm", 1)), owned(region(1, "shm", 1), true), region(2, "heap", 2)}),
-                 hidden};
-         },
-         [](HTSettings& s) { s.breakDownPhysHeft = true; }},
-        // Nothing visible: the formatters still get the closing stages.
-        {"only-hidden",
-         [&] {
-             auto hidden = process(30, {region(3, "other", 4)});
-             hidden->setHiddenFromDisplay(true);
-             return HTHeft::ProcessList{hidden};
-         },
-         [](HTSettings& s) { s.verbose = true; }},
-    };
-    for (const Scenario& scenario : scenarios) expectReports(scenario);
+    std::vector<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(kReports))
+        if (entry.path().extension() == ".scenario") names.push_back(entry.path().stem());
+    EXPECT_GE(names.size(), 12u);
+    for (const std::string& name : names) expectReports(name);
 }
 
 }  // namespace

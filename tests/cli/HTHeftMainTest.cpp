@@ -7,7 +7,6 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
-#include <cstdlib>
 #include <cstring>
 #include <string>
 #include <unistd.h>
@@ -22,91 +21,70 @@ class HTHeftMainTest : public testing::Test {
 protected:
     void SetUp() override
     {
-        HTProcess::_clearGlobalErrors();
         HTNoticeLog::standardError().take();
-        platform_ = std::make_shared<HTFakePlatform>();
         platform_->ownPid = 500;
         platform_->addProcess(1, 0, "init", "/sbin/init");
         platform_->addProcess(42, 1, "worker", "/usr/bin/worker");
     }
-
     void TearDown() override { HTProcess::_clearGlobalErrors(); }
 
-    struct Run {
-        int status = -1;
-        std::string standardOutput;
-        std::string standardError;
-    };
-
-    Run run(std::vector<std::string> arguments)
+    // The exit status, then what the run wrote to standard output and error.
+    std::tuple<int, std::string, std::string> run(std::vector<std::string> arguments)
     {
         arguments.insert(arguments.begin(), "heft");
         std::vector<char*> argv;
         for (auto& argument : arguments) argv.push_back(argument.data());
         argv.push_back(nullptr);
-
-        Run result;
         testing::internal::CaptureStdout();
         testing::internal::CaptureStderr();
-        result.status = heftMain(static_cast<int>(arguments.size()), argv.data(), platform_);
-        result.standardError = testing::internal::GetCapturedStderr();
-        result.standardOutput = testing::internal::GetCapturedStdout();
-        return result;
+        const int status = heftMain(static_cast<int>(arguments.size()), argv.data(), platform_);
+        std::string standardError = testing::internal::GetCapturedStderr();
+        return {status, testing::internal::GetCapturedStdout(), standardError};
     }
 
-    std::shared_ptr<HTFakePlatform> platform_;
+    std::shared_ptr<HTFakePlatform> platform_ = std::make_shared<HTFakePlatform>();
 };
 
-TEST_F(HTHeftMainTest, TheBreakdownModeIsOnUnlessVmObjectDirty)
+TEST_F(HTHeftMainTest, OnlyTheBreakdownModeAsksWhichObjectsAProcessOwns)
 {
-    // Only the breakdown mode asks the kernel which objects a process owns.
     const char* kDirtyAnalysis = "VM Object Dirty Analysis: Enabled\n";
-    Run result = run({"--vmObjectDirty", "42"});
-    EXPECT_EQ(result.status, 0);
-    EXPECT_NE(result.standardOutput.find(kDirtyAnalysis), std::string::npos) << result.standardOutput;
+    auto [status, out, error] = run({"--vmObjectDirty", "42"});
+    EXPECT_EQ(status, 0);
+    EXPECT_NE(out.find(kDirtyAnalysis), std::string::npos) << out;
     EXPECT_EQ(platform_->ownedVmObjectQueries, 0);
 
-    result = run({"42"});
-    EXPECT_EQ(result.status, 0);
-    // The selected process is analysed and reported.
-    EXPECT_NE(result.standardOutput.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << result.standardOutput;
-    EXPECT_EQ(result.standardOutput.find(kDirtyAnalysis), std::string::npos);
-    EXPECT_EQ(result.standardError, "");
+    std::tie(status, out, error) = run({"42"});
+    EXPECT_EQ(std::make_tuple(status, out.find(kDirtyAnalysis), error), std::make_tuple(0, std::string::npos, ""));
+    EXPECT_NE(out.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << out;
     EXPECT_GT(platform_->ownedVmObjectQueries, 0);
 }
 
-TEST_F(HTHeftMainTest, RunningOutOfMemorySaysWhereAndLeavesNoFile)
+TEST_F(HTHeftMainTest, TheJSONFileIsOpenedFirstAndGoneWhenTheRunFails)
 {
     char directory[] = "/tmp/heft-main-XXXXXX";
     ASSERT_NE(mkdtemp(directory), nullptr);
-    const std::string json = std::string(directory) + "/out.json";
     platform_->outOfMemoryInWalk = true;
-    Run result = run({"-j", json, "42"});
-    EXPECT_EQ(result.status, 1);
-    EXPECT_EQ(result.standardError, "heft: out of memory while gathering the processes' memory\n");
+    EXPECT_EQ(run({"-j", std::string(directory) + "/out.json", "42"}),
+              std::make_tuple(1, "", "heft: out of memory while gathering the processes' memory\n"));
     // The JSON file begun before the gathering is gone with its directory entry.
     EXPECT_EQ(rmdir(directory), 0) << std::strerror(errno);
+    platform_->outOfMemoryInWalk = false;
+    auto [status, out, error] = run({"-j", std::string(directory) + "/out.json", "42"});
+    EXPECT_EQ(status, 1);
+    EXPECT_EQ(error,
+              "Unable to open JSON output file '" + std::string(directory) + "/out.json': No such file or directory\n");
 }
 
-TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRoot)
+TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRootNamingProcessesDoesNot)
 {
     platform_->euid = 1000;
-    for (std::vector<std::string> arguments : {std::vector<std::string>{"-a"}, {"--unmapped", "42"}}) {
-        Run result = run(arguments);
-        EXPECT_EQ(result.status, 1) << arguments[0];
-        EXPECT_EQ(result.standardError, "Must run as root.\n");
-        EXPECT_EQ(result.standardOutput, "");
-    }
-
-    // Naming processes needs no privilege of its own.
-    Run result = run({"worker"});
-    EXPECT_EQ(result.status, 0);
-    EXPECT_EQ(result.standardError, "");
-
+    EXPECT_EQ(run({"-a"}), std::make_tuple(1, "", "Must run as root.\n"));
+    EXPECT_EQ(run({"--unmapped", "42"}), std::make_tuple(1, "", "Must run as root.\n"));
+    EXPECT_EQ(std::get<0>(run({"worker"})), 0);
     // A command-line error is reported before privileges are looked at.
-    result = run({"-a", "-f", "bad"});
-    EXPECT_EQ(result.status, 1);
-    EXPECT_EQ(result.standardError.rfind("Unrecognized argument to -f", 0), 0u) << result.standardError;
+    auto [status, out, error] = run({"-a", "-f", "bad"});
+    EXPECT_EQ(status, 1);
+    EXPECT_EQ(error.rfind("Unrecognized argument to -f", 0), 0u) << error;
 }
 
 TEST_F(HTHeftMainTest, WhatBefellTheProcessesFollowsTheGatheringEscaped)
@@ -115,9 +93,9 @@ TEST_F(HTHeftMainTest, WhatBefellTheProcessesFollowsTheGatheringEscaped)
     HTFakePlatform::Process& zombie = platform_->addProcess(43, 1, "evil\n\x1B[7m");
     zombie.info.pbi_status = SZOMB;
     zombie.regionFailureIndex = 0;
-    Run result = run({"43"});
-    EXPECT_EQ(result.status, 0);
-    EXPECT_EQ(result.standardError,
+    auto [status, out, error] = run({"43"});
+    EXPECT_EQ(status, 0);
+    EXPECT_EQ(error,
               "evil\\n\\x1B[7m [43]: had exited and was not yet reaped (a zombie) when read; "
               "marked \"(zombie)\" in the report\n");
 }

@@ -3,21 +3,20 @@
 
 #include <gtest/gtest.h>
 
+#include <iterator>
 #include <sstream>
 #include <string>
+#include <tuple>
 #include <vector>
 
 namespace {
 
 constexpr int32_t kOwnPid = 500;
 
-// The words of `text`, split at blanks.
 std::vector<std::string> words(const std::string& text)
 {
     std::istringstream in(text);
-    std::vector<std::string> result;
-    for (std::string word; in >> word;) result.push_back(word);
-    return result;
+    return {std::istream_iterator<std::string>(in), std::istream_iterator<std::string>()};
 }
 
 // A small system: the kernel, init, two shells with a tree of workers below
@@ -26,8 +25,6 @@ class HTTargetSelectionTest : public testing::Test {
 protected:
     void SetUp() override
     {
-        HTProcess::_clearGlobalErrors();
-        platform_ = std::make_shared<HTFakePlatform>();
         platform_->ownPid = kOwnPid;
         platform_->addProcess(0, 0, "kernel_task", std::nullopt, PROC_FLAG_SYSTEM | PROC_FLAG_LP64);
         platform_->addProcess(1, 0, "init", "/sbin/init");
@@ -61,57 +58,51 @@ protected:
         return text;
     }
 
-    std::shared_ptr<HTFakePlatform> platform_;
+    std::shared_ptr<HTFakePlatform> platform_ = std::make_shared<HTFakePlatform>();
     HTSettings settings_;
     std::string standardError_;
 };
 
 TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
 {
-    enum Option { kNone = 0, kAll = 1, kChildren = 2, kUnmapped = 4, kSkipClean = 8 };
     // 100 and 201 may exit when idle and are clean; 203 may too but is dirty.
     for (int32_t pid : {100, 201, 203}) {
         platform_->process(pid)->dirtyErrno = 0;
         platform_->process(pid)->dirtyFlags =
             PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT | (pid == 203 ? PROC_DIRTY_IS_DIRTY : 0);
     }
-    // Operands, pids and exclusions are lists of words.
-    struct Row {
-        const char* operands;
-        std::vector<int32_t> pids;
-        const char* excluded;
-        int options;
-        const char* selected;
-    } rows[] = {
+    // Operands, pids, exclusions, options (-a, -t, --unmapped, -s) and the
+    // selection.
+    const std::tuple<const char*, const char*, const char*, std::string, const char*> rows[] = {
         // A name selects every process of that name; 100 is named twice.
-        {"worker 100 init", {}, "", kNone, "100 201 203 1"},
+        {"worker 100 init", "", "", "", "100 201 203 1"},
         // heft leaves itself out; exclusions that match nothing stay silent.
-        {"heft worker", {kOwnPid}, "201 helper nosuchthing", kNone, "501 100 203"},
-        {"", {kOwnPid}, "", kNone, ""},
+        {"heft worker", "500", "201 helper nosuchthing", "", "501 100 203"},
+        {"", "500", "", "", ""},
         // Descendants come after the exclusions, heft's own pid among them;
         // an excluded target has none to add.
-        {"shell", {}, "202", kChildren, "200 201 202 500 501 203"},
-        {"", {202}, "helper", kChildren, ""},
+        {"shell", "", "202", "t", "200 201 202 500 501 203"},
+        {"", "202", "helper", "t", ""},
         // All but heft and the excluded; operands are not looked at.
-        {"nosuchthing", {1}, "worker", kAll, "0 1 200 202 501"},
-        {"", {}, "", kAll, "0 1 100 200 201 202 203 501"},
+        {"nosuchthing", "1", "worker", "a", "0 1 200 202 501"},
+        {"", "", "", "a", "0 1 100 200 201 202 203 501"},
         // The unmapped search adds, hidden, every other process but the
         // kernel and the excluded.
-        {"", {201}, "init", kUnmapped, "100! 200! 202! 203! 501! 201"},
-        {"worker shell", {}, "", kSkipClean, "203 200"},
-        {"", {100, 201}, "", kSkipClean, ""},
-        {"", {}, "", kNone, "error 8: Must specify at least one process or snapfile"},
+        {"", "201", "init", "u", "100! 200! 202! 203! 501! 201"},
+        {"worker shell", "", "", "s", "203 200"},
+        {"", "100 201", "", "s", ""},
+        {"", "", "", "", "error 8: Must specify at least one process or snapfile"},
     };
-    for (const Row& row : rows) {
+    for (const auto& [operands, pids, excluded, options, selected] : rows) {
         HTTargetSelection::Request request;
-        request.potentialTargetProcesses = words(row.operands);
-        for (int32_t pid : row.pids) request.targetPids.set(pid, std::nullopt);
-        request.excludedPidsOrProcesses = words(row.excluded);
-        request.targetAll = row.options & kAll;
-        request.targetChildren = row.options & kChildren;
-        request.searchForUnmapped = row.options & kUnmapped;
-        request.skipIdleExitClean = row.options & kSkipClean;
-        EXPECT_EQ(select(request), row.selected) << row.operands << " / " << row.excluded << " / " << row.options;
+        request.potentialTargetProcesses = words(operands);
+        for (const std::string& pid : words(pids)) request.targetPids.set(std::stoi(pid), std::nullopt);
+        request.excludedPidsOrProcesses = words(excluded);
+        request.targetAll = options == "a";
+        request.targetChildren = options == "t";
+        request.searchForUnmapped = options == "u";
+        request.skipIdleExitClean = options == "s";
+        EXPECT_EQ(select(request), selected) << operands << " / " << pids << " / " << excluded << " / " << options;
         EXPECT_EQ(standardError_, "");
     }
 
