@@ -29,15 +29,10 @@ public:
     const RegionSet& memoryRegions() const;
 
     uint64_t totalDirtySize() const { return totalDirtySize_; }
-    void setTotalDirtySize(uint64_t value) { totalDirtySize_ = value; }
     uint64_t totalSwappedSize() const { return totalSwappedSize_; }
-    void setTotalSwappedSize(uint64_t value) { totalSwappedSize_ = value; }
     uint64_t totalCleanSize() const { return totalCleanSize_; }
-    void setTotalCleanSize(uint64_t value) { totalCleanSize_ = value; }
     uint64_t totalReclaimableSize() const { return totalReclaimableSize_; }
-    void setTotalReclaimableSize(uint64_t value) { totalReclaimableSize_ = value; }
     uint64_t totalWiredSize() const { return totalWiredSize_; }
-    void setTotalWiredSize(uint64_t value) { totalWiredSize_ = value; }
     // Regions shared by several members count once.
     int32_t totalRegions() const { return static_cast<int32_t>(regionCount_); }
 
