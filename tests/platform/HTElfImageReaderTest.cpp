@@ -3,6 +3,8 @@
 
 #include <gtest/gtest.h>
 
+#include <cstddef>
+
 #include <cstring>
 #include <dlfcn.h>
 #include <elf.h>
@@ -155,6 +157,7 @@ TEST(HTElfImageReader, CraftedFilesAreImagesWithSegmentsNamedByRoleOrAreNot)
         {"other byte order", poked(so64, EI_DATA, ELFDATA2MSB), nullptr, 0},
         {"no class", poked(so64, EI_CLASS, ELFCLASSNONE), nullptr, 0},
         {"no magic", poked(so64, 1, 'e'), nullptr, 0},
+        {"program header entries too small", poked(so64, offsetof(Elf64_Ehdr, e_phentsize), 8), nullptr, 0},
     };
     for (const Row& row : rows) {
         SCOPED_TRACE(row.what);
