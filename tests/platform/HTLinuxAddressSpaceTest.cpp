@@ -121,6 +121,13 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     EXPECT_EQ(platform_.realpath("/tmp/.." + filePath_), std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
 
+    // Page identities are asked for page-aligned ranges inside the address space only.
+    uint64_t identities[2] = {7, 7};
+    EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0) + 1, 1, identities), KERN_INVALID_ARGUMENT);
+    EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), UINT64_MAX / 2, identities), KERN_INVALID_ARGUMENT);
+    EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, nullptr), KERN_INVALID_ARGUMENT);
+    EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, identities), KERN_SUCCESS);
+
     // Lazily freed pages, still resident, are reusable page by page too.
     if (!pageFlagsReadable()) GTEST_SKIP() << "reusable pages show in page queries only with /proc/kpageflags (root)";
     const WalkedRegion* freed = regionAt(regions_, at(1));
