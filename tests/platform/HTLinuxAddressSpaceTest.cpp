@@ -1,7 +1,10 @@
 #include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTPageQueryChunk.h"
 #include "support/HTLayoutChild.h"
 
 #include <gtest/gtest.h>
+
+#include <algorithm>
 
 #include <chrono>
 #include <optional>
@@ -112,6 +115,16 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     std::vector<int32_t> expected(kTouched + 2, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY);
     expected.front() = expected.back() = 0;
     EXPECT_EQ(pages, expected);
+    // A query longer than one chunk of pagemap answers the same, and writes
+    // nothing past the pages asked for.
+    const uint64_t longQuery = HTPageQueryChunk::kPages + kTouched + 2;
+    std::vector<int32_t> answer(longQuery + HTPageQueryChunk::kPages, -1);
+    uint64_t count = longQuery;
+    ASSERT_EQ(platform_.mach_vm_page_range_query(*task_, at(0) - kPage, longQuery * kPage, answer.data(), &count),
+              KERN_SUCCESS);
+    EXPECT_EQ(count, longQuery);
+    EXPECT_TRUE(std::equal(expected.begin(), expected.end(), answer.begin()));
+    EXPECT_EQ(std::count(answer.begin() + longQuery, answer.end(), -1), HTPageQueryChunk::kPages);
     pages = dispositions(platform_, *task_, at(2), kFilePages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     const int32_t external = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
