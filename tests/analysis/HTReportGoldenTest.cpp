@@ -22,21 +22,6 @@ namespace {
 
 const std::string kReports = std::string(HEFT_TEST_DATA_DIR) + "/reports/";
 
-std::string contents(const std::string& path)
-{
-    std::stringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
-}
-
-// `text` with each %XX replaced by the byte XX.
-std::string decoded(std::string text)
-{
-    for (size_t at = 0; (at = text.find('%', at)) != std::string::npos; ++at)
-        text.replace(at, 3, 1, static_cast<char>(std::stoi(text.substr(at + 1, 2), nullptr, 16)));
-    return text;
-}
-
 class HTReportGoldenTest : public HTAnalysisTest {
 protected:
     // The processes of the scenario, after its settings.
@@ -46,30 +31,23 @@ protected:
         HTHeft::ProcessList processes;
         std::shared_ptr<HTScriptedProcess> last;
         std::shared_ptr<HTAuxDataMap> auxInto;
-        std::istringstream lines(contents(path));
-        for (std::string line, kind, key, value; std::getline(lines, line);) {
-            std::istringstream in(line);
-            if (!(in >> kind) || kind[0] == '#') continue;
-            if (kind == "global-error" && in >> std::quoted(value)) HTProcess::_addGlobalError(decoded(value));
+        std::istringstream lines(contentsOf(path));
+        for (std::string raw; std::getline(lines, raw);) {
+            const HTScenarioLine line(raw);
+            const std::string& kind = line.kind;
+            auto text = [&](const char* key) { return line.text(key); };
+            auto number = [&](const char* key, uint64_t fallback = 0) { return line.number(key, fallback); };
+            if (kind == "global-error") HTProcess::_addGlobalError(line.argument);
             if (kind == "aux") {
                 if (!last->auxData()) last->setAuxData(auxInto = std::make_shared<HTAuxDataMap>());
-                if (!(in >> std::quoted(key) >> std::quoted(value))) continue;
+                if (line.fields.empty()) continue;
+                const auto& [key, value] = *line.fields.begin();
                 auto inner = std::make_shared<HTAuxDataMap>();
                 auxInto->set(key,
                              value == "map" ? HTAuxDataMap::Value(inner)
                                             : std::make_shared<HTAuxData>(std::stoll(value), true));
                 if (value == "map") auxInto = inner;
             }
-            std::multimap<std::string, std::string> fields;
-            if ((kind == "process" || kind == "forked") && in >> value) fields.emplace("pid", value);
-            while (in >> std::quoted(key) >> std::quoted(value)) fields.emplace(key, decoded(value));
-            auto text = [&](const char* name) {
-                auto found = fields.find(name);
-                return found == fields.end() ? std::nullopt : std::optional<std::string>(found->second);
-            };
-            auto number = [&](const char* name, uint64_t fallback = 0) {
-                return text(name) ? std::stoull(*text(name), nullptr, 0) : fallback;
-            };
             if (kind == "set") {
                 settings_.summaryFormat = static_cast<int64_t>(number("format", HTTextFormatFormatted));
                 settings_.textOptions = static_cast<int64_t>(number("options"));
@@ -79,11 +57,11 @@ protected:
                 settings_.breakDownPhysHeft = number("breakdown");
                 settings_.sharingAnalysisDisabled = number("nosharing");
             } else if (kind == "process") {
-                processes.push_back(last = process(static_cast<int32_t>(number("pid")), {}, text("bits") != "32"));
+                processes.push_back(last = process(std::stoi(line.argument), {}, text("bits") != "32"));
                 if (text("name")) last->setName(*text("name"));
-                last->setDisplayString(last->name() + " [" + *text("pid") + "]");
+                last->setDisplayString(last->name() + " [" + line.argument + "]");
                 last->setHiddenFromDisplay(text("hidden").has_value());
-                for (auto [at, end] = fields.equal_range("warning"); at != end; ++at)
+                for (auto [at, end] = line.fields.equal_range("warning"); at != end; ++at)
                     last->warnings().push_back(at->second);
                 if (auto error = text("error")) last->scriptError(*error);
                 last->setPageSize(number("pagesize", kPage));
@@ -91,8 +69,8 @@ protected:
                 std::vector<uint64_t> identities;
                 std::istringstream list(text("pages").value_or(""));
                 for (std::string id; std::getline(list, id, ',');) identities.push_back(std::stoull(id));
-                processes.push_back(forkedProcess(platform_, static_cast<int32_t>(number("pid")), identities,
-                                                  number("per"), settings_));
+                processes.push_back(
+                    forkedProcess(platform_, std::stoi(line.argument), identities, number("per"), settings_));
             } else if (kind == "region") {
                 const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
                 last->script().push_back({.objectId = number("id"),
@@ -133,7 +111,7 @@ protected:
             std::fclose(text);
         }
         for (const char* extension : {".txt", ".json"}) {
-            expectReport(name + extension, contents(path + extension));
+            expectReport(name + extension, contentsOf(path + extension));
             std::remove((path + extension).c_str());
         }
         HTProcess::_clearGlobalErrors();

@@ -1,0 +1,324 @@
+// Processes read from a scripted kernel: each scenario under
+// tests/data/reports/processes/ scripts the kernel's answers and the reads,
+// and everything each read gave (regions, sub-ranges, figures, warnings,
+// errors, what standard error was told, which calls were made) is compared
+// with the expected file of the same name. The README there says how
+// scenarios are written.
+
+#include "base/HTNoticeLog.h"
+#include "model/HTAuxData.h"
+#include "model/HTAuxDataMap.h"
+#include "model/HTMemoryRegion.h"
+#include "output/HTExpectedReport.h"
+#include "platform/fake/HTFakePlatform.h"
+#include "process/HTUserProcess.h"
+
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <map>
+#include <sstream>
+#include <string>
+#include <vector>
+
+namespace {
+
+const std::string kScenarios = std::string(HEFT_TEST_DATA_DIR) + "/reports/processes/";
+
+// A process that may map the shared library cache of a 64-bit ARM system:
+// the one way to drive the shared-cache code with live-process answers.
+class HTScenarioProcess : public HTUserProcess {
+public:
+    HTScenarioProcess(std::shared_ptr<HTPlatform> platform, bool sharedCache)
+        : HTUserProcess(std::move(platform)), sharedCache_(sharedCache)
+    {
+    }
+    // What one run remembers: the ledger template, and whether running out
+    // of descriptors was said.
+    static void forgetRun()
+    {
+        _forgetLedgerTemplate();
+        _forgetOutOfDescriptors();
+    }
+
+protected:
+    int _platformCode() override { return sharedCache_ ? 3 : HTUserProcess::_platformCode(); }
+
+private:
+    bool sharedCache_;
+};
+
+const std::map<std::string, int64_t> kNames = {
+    {"private", SM_PRIVATE},
+    {"cow", SM_COW},
+    {"shared", SM_SHARED},
+    {"volatile", VM_PURGABLE_VOLATILE},
+    {"nonvolatile", VM_PURGABLE_NONVOLATILE},
+    {"empty", VM_PURGABLE_EMPTY},
+    {"run", SRUN},
+    {"zombie", SZOMB},
+    {"lp64", PROC_FLAG_LP64},
+    {"inexit", PROC_FLAG_LP64 | PROC_FLAG_INEXIT},
+    {"gone", MACH_SEND_INVALID_DEST},
+    {"failure", KERN_FAILURE},
+    {"emfile", HT_KERN_ERRNO_BASE | EMFILE},
+    {"enfile", HT_KERN_ERRNO_BASE | ENFILE},
+    {"eperm", EPERM},
+    {"fake", HTFakeRegionTag},
+};
+
+// A number, or one of the names above.
+int64_t valueOf(const std::string& text)
+{
+    auto named = kNames.find(text);
+    return named != kNames.end() ? named->second : std::stoll(text, nullptr, 0);
+}
+
+// "a,b,c" as numbers.
+std::vector<int64_t> listOf(const std::string& text)
+{
+    std::vector<int64_t> values;
+    std::istringstream list(text);
+    for (std::string item; std::getline(list, item, ',');) values.push_back(valueOf(item));
+    return values;
+}
+
+// A page's disposition: p present, d dirty, o paged out, r reusable,
+// e external, - none.
+int32_t disposition(const std::string& letters)
+{
+    int32_t kind = 0;
+    for (char letter : letters)
+        kind |= letter == 'p' ? VM_PAGE_QUERY_PAGE_PRESENT
+            : letter == 'd'   ? VM_PAGE_QUERY_PAGE_DIRTY
+            : letter == 'o'   ? VM_PAGE_QUERY_PAGE_PAGED_OUT
+            : letter == 'r'   ? VM_PAGE_QUERY_PAGE_REUSABLE
+            : letter == 'e'   ? VM_PAGE_QUERY_PAGE_EXTERNAL
+                              : 0;
+    return kind;
+}
+
+std::string hex(uint64_t value)
+{
+    std::ostringstream out;
+    out << "0x" << std::hex << value;
+    return out.str();
+}
+
+class HTUserProcessScenarioTest : public ::testing::Test {
+protected:
+    ~HTUserProcessScenarioTest() override { forgetRun(); }
+
+    static void forgetRun()
+    {
+        HTScenarioProcess::forgetRun();
+        HTProcess::_clearGlobalErrors();
+        HTNoticeLog::standardError().take();
+    }
+
+    // Runs the scenario; returns what its reads gave.
+    std::string run(const std::string& path)
+    {
+        forgetRun();
+        platform_ = std::make_shared<HTFakePlatform>();
+        settings_ = HTSettings{.breakDownPhysHeft = false};
+        sharedCache_ = false;
+        std::ostringstream out;
+        std::istringstream lines(contentsOf(path));
+        for (std::string raw; std::getline(lines, raw);) {
+            const HTScenarioLine line(raw);
+            if (line.kind == "set") set(line);
+            if (line.kind == "template") {
+                HTScenarioProcess::forgetRun();
+                platform_->ledgerTemplate.reset();
+                if (line.argument != "none") {
+                    std::istringstream names(line.argument);
+                    platform_->ledgerTemplate.emplace();
+                    for (std::string name; std::getline(names, name, ',');) platform_->ledgerTemplate->push_back(name);
+                }
+            }
+            if (line.kind == "realpath") platform_->realpaths[line.argument] = *line.text("to");
+            if (line.kind == "process") scriptProcess(line);
+            if (line.kind == "region") target_->regions.push_back(region(line));
+            if (line.kind == "pages") scriptPages(line);
+            if (line.kind == "owned-object") {
+                if (!target_->ownedVmObjects) target_->ownedVmObjects.emplace();
+                auto size = [&](const char* key) { return line.number(key) * platform_->pageSize; };
+                target_->ownedVmObjects->push_back({line.number("id"), size("virtual"), size("resident"), size("wired"),
+                                                    size("reusable"), size("compressed"), line.number("flags")});
+            }
+            if (line.kind == "image") {
+                HTPlatformImage image{line.argument, 0, {}};
+                for (auto [at, end] = line.fields.equal_range("segment"); at != end; ++at) {
+                    std::istringstream parts(at->second);
+                    std::string name, start, size;
+                    std::getline(std::getline(std::getline(parts, name, ':'), start, ':'), size);
+                    image.segments.push_back({name, std::stoull(start, nullptr, 0), std::stoull(size, nullptr, 0)});
+                }
+                image.baseAddress = image.segments.front().start;
+                target_->images.push_back(image);
+            }
+            if (line.kind == "gather") gather(line, out);
+        }
+        return out.str();
+    }
+
+    void set(const HTScenarioLine& line)
+    {
+        settings_.breakDownPhysHeft = line.number("breakdown", settings_.breakDownPhysHeft);
+        settings_.sharingAnalysisDisabled = line.number("nosharing", settings_.sharingAnalysisDisabled);
+        sharedCache_ = line.number("sharedcache", sharedCache_);
+        platform_->pageSize = line.number("pagesize", platform_->pageSize);
+        platform_->uniformRuns = line.number("uniform", platform_->uniformRuns);
+    }
+
+    // Adds the process, or changes it when it is there already.
+    void scriptProcess(const HTScenarioLine& line)
+    {
+        const int32_t pid = std::stoi(line.argument);
+        target_ = platform_->process(pid);
+        if (!target_) target_ = &platform_->addProcess(pid, 1, line.text("name").value_or("target"));
+        HTFakePlatform::Process& p = *target_;
+        for (const auto& [key, value] : line.fields) {
+            if (key == "status") p.info.pbi_status = static_cast<uint32_t>(valueOf(value));
+            if (key == "flags") p.info.pbi_flags = static_cast<uint32_t>(valueOf(value));
+            if (key == "task") p.taskResult = static_cast<kern_return_t>(valueOf(value));
+            if (key == "rusage")
+                p.rusage =
+                    rusage_info_v4{listOf(value)[0] * platform_->pageSize, listOf(value)[1] * platform_->pageSize};
+            if (key == "ledger") p.ledgerBalances = listOf(value);
+            if (key == "ledger-errno") p.ledgerErrno = static_cast<int>(valueOf(value));
+            if (key == "owned") p.ownedVmObjects.emplace();
+            if (key == "owned-errno") p.ownedVmObjectsErrno = static_cast<int>(valueOf(value));
+            if (key == "owned-hint") p.ownedVmObjectsLengthHint = valueOf(value);
+            if (key == "fail-region") p.regionFailureIndex = valueOf(value);
+            if (key == "fail-code") p.regionFailureCode = static_cast<kern_return_t>(valueOf(value));
+            if (key == "fail-page") p.pageQueryFailureAddress = valueOf(value);
+            if (key == "exited") p.exited = valueOf(value);
+        }
+    }
+
+    // Private anonymous read-write memory unless the line says otherwise;
+    // sizes in pages.
+    HTFakePlatform::Region region(const HTScenarioLine& line) const
+    {
+        HTFakePlatform::Region r;
+        vm_region_submap_info_64& info = r.info;
+        r.start = line.number("start");
+        r.size = line.number("pages") * platform_->pageSize;
+        info.protection = static_cast<int32_t>(line.number("prot", VM_PROT_READ | VM_PROT_WRITE));
+        info.max_protection = static_cast<int32_t>(line.number("max", VM_PROT_READ | VM_PROT_WRITE | VM_PROT_EXECUTE));
+        info.share_mode = static_cast<uint8_t>(valueOf(line.text("share").value_or("private")));
+        info.object_id_full = line.number("object", 0x4000000000000000 | r.start);
+        info.object_id = static_cast<uint32_t>(line.number("object32", info.object_id_full));
+        info.offset = line.number("offset");
+        info.user_tag = static_cast<uint32_t>(valueOf(line.text("tag").value_or("0")));
+        info.user_wired_count = static_cast<uint16_t>(line.number("wired"));
+        info.external_pager = static_cast<uint8_t>(line.number("pager"));
+        info.pages_resident = static_cast<uint32_t>(line.number("resident"));
+        info.pages_dirtied = static_cast<uint32_t>(line.number("dirtied"));
+        info.pages_swapped_out = static_cast<uint32_t>(line.number("swapped"));
+        info.pages_reusable = static_cast<uint32_t>(line.number("reusable"));
+        r.infoCount = static_cast<uint32_t>(line.number("words", VM_REGION_SUBMAP_INFO_COUNT_64));
+        r.path = line.text("path");
+        if (auto purge = line.text("purge")) r.purgeState = static_cast<int32_t>(valueOf(*purge));
+        return r;
+    }
+
+    // `pages A K,K*N,...`: the dispositions of the pages from A on.
+    void scriptPages(const HTScenarioLine& line)
+    {
+        uint64_t address = std::stoull(line.argument, nullptr, 0);
+        std::istringstream list(*line.text("kinds"));
+        for (std::string item; std::getline(list, item, ',');) {
+            const size_t star = item.find('*');
+            const uint64_t count = star == std::string::npos ? 1 : std::stoull(item.substr(star + 1));
+            for (uint64_t i = 0; i < count; ++i, address += platform_->pageSize)
+                if (disposition(item.substr(0, star)))
+                    target_->dispositions[address] = disposition(item.substr(0, star));
+        }
+    }
+
+    // Reads the process and writes down everything the read gave.
+    void gather(const HTScenarioLine& line, std::ostringstream& out)
+    {
+        HTFakePlatform::Process& script = *platform_->process(static_cast<int32_t>(line.number("pid", 500)));
+        platform_->pageQueries.clear();
+        platform_->regionLookups = platform_->basicRegionLookups = 0;
+        auto process = std::make_shared<HTScenarioProcess>(platform_, sharedCache_);
+        process->setSettings(settings_);
+        testing::internal::CaptureStderr();
+        const bool created = process->initWithBsdInfo(script.info);
+        if (created) {
+            process->setHiddenFromDisplay(line.number("hidden"));
+            const bool exited = script.exited;
+            script.exited = exited || line.number("exit");
+            process->gatherData();
+            script.exited = exited;
+        }
+        const std::string told = testing::internal::GetCapturedStderr();
+        out << "gather " << process->displayString() << (created ? "" : ": not created") << "\n";
+        if (created) describe(*process, out);
+        for (const std::string& text : HTNoticeLog::standardError().take()) out << "notice " << text << "\n";
+        for (const std::string& text : HTProcess::globalErrors()) out << "global-error " << text << "\n";
+        HTProcess::_clearGlobalErrors();
+        std::istringstream toldLines(told);
+        for (std::string text; std::getline(toldLines, text);) out << "stderr " << text << "\n";
+        out << "calls: " << platform_->regionLookups << " region, " << platform_->basicRegionLookups << " basic, "
+            << platform_->ledgerTemplateReads << " template; queries";
+        for (const auto& [address, size] : platform_->pageQueries) out << " " << hex(address) << "+" << hex(size);
+        out << "\n\n";
+    }
+
+    static void describe(HTUserProcess& process, std::ostringstream& out)
+    {
+        out << "idle-exit " << process.idleExitStatus() << "\n";
+        if (auto data = process.auxData())
+            for (const auto& [key, value] : *data) {
+                auto datum = std::dynamic_pointer_cast<HTAuxData>(value);
+                out << "aux " << key << " " << datum->value() << (datum->shouldAggregate() ? "" : " alone") << "\n";
+            }
+        if (!process.hasMemoryRegions()) out << "no regions read\n";
+        for (const auto& r : process.memoryRegions()) {
+            out << "region " << (r->start() == HTNoAddress ? "none" : hex(r->start())) << " size " << hex(r->size())
+                << " object " << hex(r->object_id()) << " offset " << hex(r->offset()) << " share "
+                << int(r->share_mode()) << " segment " << int(r->segment()) << " "
+                << std::quoted(r->name().value_or(""));
+            if (r->detailedName()) out << " " << std::quoted(*r->detailedName());
+            for (auto [flag, word] : {std::pair{r->wired(), " wired"},
+                                      {r->ownedExclusivelyByParentProcess(), " owned"},
+                                      {r->isFake(), " unmapped"},
+                                      {r->inSharedCache(), " cache"},
+                                      {r->unusedSharedCacheRegion(), " unused"}})
+                if (flag) out << word;
+            out << "\n  dirty " << r->dirtySize() << " swapped " << r->swappedSize() << " clean "
+                << r->cleanNonSpecSize() << " reclaimable " << r->reclaimableSize() << "\n";
+            if (r->subrangeList())
+                for (const HTRangeListNode* n = r->subrangeList()->head(); n; n = n->next)
+                    out << "  run " << hex(n->start) << "+" << hex(n->size) << " dirty " << n->dirty << " swapped "
+                        << n->swapped << " clean " << n->clean << " reclaimable " << n->reclaimable << " wired "
+                        << n->wired << "\n";
+        }
+        for (const std::string& text : process.warnings()) out << "warning " << text << "\n";
+        for (const std::string& text : process.errors()) out << "error " << text << "\n";
+    }
+
+    std::shared_ptr<HTFakePlatform> platform_;
+    HTFakePlatform::Process* target_ = nullptr;
+    HTSettings settings_;
+    bool sharedCache_ = false;
+};
+
+TEST_F(HTUserProcessScenarioTest, Scenarios)
+{
+    std::vector<std::string> names;
+    for (const auto& entry : std::filesystem::directory_iterator(kScenarios))
+        if (entry.path().extension() == ".scenario") names.push_back(entry.path().stem());
+    EXPECT_GE(names.size(), 10u);
+    for (const std::string& name : names) {
+        SCOPED_TRACE(name);
+        expectReport("processes/" + name + ".txt", run(kScenarios + name + ".scenario"));
+    }
+}
+
+}  // namespace
