@@ -147,7 +147,7 @@ TEST_F(HTHeftGatherTest, SigintSkipsProcessesNotYetBegunAndTheReportFollows)
     EXPECT_EQ(installCancelHandler(*platform_, [] {}), nullptr);
     platform_->terminals.clear();
 
-    HTHeftProbe heft(HTHeft::ProcessList(scripted.begin(), scripted.end()), settings_);
+    HTHeft heft(HTHeft::ProcessList(scripted.begin(), scripted.end()), settings_);
     std::unique_ptr<HTSignalSource> source = installCancelHandler(*platform_, [&] {
         heft.cancel();
         gate.set_value();

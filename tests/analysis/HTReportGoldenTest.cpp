@@ -56,6 +56,7 @@ protected:
                 settings_.summarize = number("summarize");
                 settings_.breakDownPhysHeft = number("breakdown");
                 settings_.sharingAnalysisDisabled = number("nosharing");
+                platform_->sharedPagesIdentifiable = !number("noidentities");
             } else if (kind == "process") {
                 processes.push_back(last = process(std::stoi(line.argument), {}, text("bits") != "32"));
                 if (text("name")) last->setName(*text("name"));
@@ -66,11 +67,11 @@ protected:
                 if (auto error = text("error")) last->scriptError(*error);
                 last->setPageSize(number("pagesize", kPage));
             } else if (kind == "forked") {
-                std::vector<uint64_t> identities;
+                std::vector<std::string> pages;
                 std::istringstream list(text("pages").value_or(""));
-                for (std::string id; std::getline(list, id, ',');) identities.push_back(std::stoull(id));
+                for (std::string page; std::getline(list, page, ',');) pages.push_back(page);
                 processes.push_back(
-                    forkedProcess(platform_, std::stoi(line.argument), identities, number("per"), settings_));
+                    forkedProcess(platform_, std::stoi(line.argument), pages, number("per"), settings_, text("file")));
             } else if (kind == "region") {
                 const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
                 last->script().push_back({.objectId = number("id"),
@@ -103,11 +104,14 @@ protected:
         {
             HTHeft::ProcessList processes = readScenario(kReports + name + ".scenario");
             FILE* text = std::fopen((path + ".txt").c_str(), "w");
+            testing::internal::CaptureStderr();
             auto heft = gathered(processes);
+            const std::string told = testing::internal::GetCapturedStderr();
             heft->addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings_, text));
             heft->addOutputFormatter(
                 HTOutputFormatterJSON::initWithPath(path + ".json", settings_.breakDownPhysHeft, 4 * kPage, nullptr));
             heft->printOutputVerbose(settings_.verbose, settings_.summarize);
+            std::fprintf(text, "%s", told.c_str());
             std::fclose(text);
         }
         for (const char* extension : {".txt", ".json"}) {
