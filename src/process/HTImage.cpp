@@ -89,8 +89,12 @@ std::vector<std::shared_ptr<HTImage>> HTImage::gatherImages(HTPlatform& platform
             std::optional<std::string> resolved = platform.realpath(image.path);
             ownerPath = std::make_shared<const std::string>(resolved ? *std::move(resolved) : image.path);
         }
-        // The image's segments share one owner-path string.
+        // The image's segments share one owner-path string. An empty
+        // segment holds no memory; kept, it would lie inside every region
+        // that reaches its address, and the look-up would answer it for
+        // each of them instead of the segment after it.
         for (const HTPlatformImageSegment& segment : image.segments) {
+            if (segment.size == 0) continue;
             auto record = std::make_shared<HTImage>();
             record->setStart(segment.start);
             record->setSize(segment.size);

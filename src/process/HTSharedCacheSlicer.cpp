@@ -64,14 +64,10 @@ bool HTSharedCacheSlicer::addRegions(std::vector<std::shared_ptr<HTMemoryRegion>
 
         const uint64_t pieceStart = std::max(cursor, image->start());
         uint64_t pieceEnd = std::min(image->end(), end);
+        // Images are never empty (empty segments are not listed), so every
+        // piece moves the cursor on.
+        HT_ASSERT(kModule, pieceEnd > pieceStart, "pieceEnd > pieceStart");
         std::shared_ptr<HTImage> next = enumerator.nextImageForStart(pieceEnd, end);
-        if (pieceEnd <= pieceStart) {
-            // An empty segment holds nothing; one the enumerator keeps
-            // answering would hold the walk here for good.
-            if (next == image) return true;
-            image = next;
-            continue;
-        }
         const uint64_t nextStart = next ? next->start() : 0;
         // Segments laid out on alignment boundaries own the padding up to
         // the next boundary.
