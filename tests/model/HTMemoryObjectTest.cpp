@@ -1,7 +1,6 @@
 #include "model/HTMemoryObject.h"
+#include "model/HTMemoryCategory.h"
 #include "model/HTMemoryRegion.h"
-#include "platform/fake/HTFakePlatform.h"
-#include "process/HTProcess.h"
 
 #include <gtest/gtest.h>
 
@@ -35,54 +34,43 @@ Totals totals(const HTMemoryObject& o)
     return {o.totalDirtySize(), o.totalSwappedSize(), o.totalCleanSize(), o.totalReclaimableSize()};
 }
 
-// Processes made in one counting mode: per-region heft or not.
-class Processes {
-public:
-    explicit Processes(bool regionHeft) : platform_(std::make_shared<HTFakePlatform>())
-    {
-        settings_.breakDownPhysHeft = regionHeft;
-    }
-    std::shared_ptr<HTProcess> operator()(int32_t pid)
-    {
-        auto made = std::make_shared<HTProcess>(platform_);
-        made->setSettings(settings_);
-        made->setPid(pid);
-        made->setPageSize(kPage);
-        return made;
-    }
-
-private:
-    std::shared_ptr<HTFakePlatform> platform_;
-    HTSettings settings_;
-};
-
 // p1 maps two pages twice and its regions report them twice; p2 maps the
 // page after them. Counted by pages: three dirty pages, one swapped.
-std::shared_ptr<HTMemoryObject> mappedTwiceByOne(HTProcess& p1, HTProcess& p2)
+std::shared_ptr<HTMemoryObject> mappedTwiceByOne(int32_t p1 = 1, int32_t p2 = 2)
 {
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 2, 2), p1.pageSize(), p1.pid());
-    object->addRegion(region(5, 0, 2, 2, 1), p1.pageSize(), p1.pid());
-    object->addRegion(region(5, 2, 1, 1), p2.pageSize(), p2.pid());
+    object->addRegion(region(5, 0, 2, 2), kPage, p1);
+    object->addRegion(region(5, 0, 2, 2, 1), kPage, p1);
+    object->addRegion(region(5, 2, 1, 1), kPage, p2);
     return object;
+}
+
+// A finalised object of one "__TEXT" region with one dirty page.
+std::shared_ptr<HTMemoryObject> textObject(uint64_t objectId, const char* path = "/usr/lib/libz.so")
+{
+    auto text = region(objectId, 0, 1, 1);
+    text->setName("__TEXT");
+    text->setDetailedName(path);
+    auto made = std::make_shared<HTMemoryObject>();
+    made->addRegion(text, kPage);
+    made->finalize(false);
+    return made;
 }
 
 }  // namespace
 
 TEST(HTMemoryObject, TotalsCountEachPageOnce)
 {
-    Processes process(false);
-    auto p1 = process(1);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 4, 4), p1->pageSize(), p1->pid());
-    object->addRegion(region(5, 2, 4, 4), p1->pageSize(), p1->pid());
+    object->addRegion(region(5, 0, 4, 4), kPage, 1);
+    object->addRegion(region(5, 2, 4, 4), kPage, 1);
     // Only a region's sub-ranges count once it has some.
     auto pieces = region(5, 16, 4, 4);
     pieces->addSubrange(16 * kPage, kPage, HTMemoryTotals{0, 0, kPage, 0, 0, 0}, kPage);
-    object->addRegion(pieces, p1->pageSize(), p1->pid());
+    object->addRegion(pieces, kPage, 1);
     EXPECT_EQ(pieces->subrangeList(), nullptr);
     // Without an object id a region names the object but counts nothing.
-    object->addRegion(region(0, 0, 8, 8), p1->pageSize(), p1->pid());
+    object->addRegion(region(0, 0, 8, 8), kPage, 1);
 
     object->finalize(false);
     EXPECT_EQ(totals(*object), (Totals{6 * kPage, 0, kPage, 0}));
@@ -90,20 +78,17 @@ TEST(HTMemoryObject, TotalsCountEachPageOnce)
     EXPECT_EQ(object->rangeList(), nullptr);
     // A single process sees the object whole.
     EXPECT_FALSE(object->processMemoryRegions());
-    EXPECT_EQ(object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), false), object);
+    EXPECT_EQ(object->viewForProcess(1, kPage, false, false), object);
 }
 
 TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
 {
-    Processes process(false);
-    auto p1 = process(1);
-    auto p2 = process(2);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 1, 1, 0, SM_PRIVATE), p1->pageSize(), p1->pid());
+    object->addRegion(region(5, 0, 1, 1, 0, SM_PRIVATE), kPage, 1);
     EXPECT_FALSE(object->processMemoryRegions()) << "a private region starts no map";
-    object->addRegion(region(5, 0, 1, 1), p2->pageSize(), p2->pid());
+    object->addRegion(region(5, 0, 1, 1), kPage, 2);
     // Once the map exists every region is recorded, eligible or not.
-    object->addRegion(region(5, 1, 1, 1, 0, SM_PRIVATE), p1->pageSize(), p1->pid());
+    object->addRegion(region(5, 1, 1, 1, 0, SM_PRIVATE), kPage, 1);
     object->addRegion(region(5, 0, 1, 1), kPage);
     ASSERT_TRUE(object->processMemoryRegions());
     ASSERT_EQ(object->processMemoryRegions()->keys(), (std::vector<int32_t>{2, 1}));
@@ -113,8 +98,8 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
     // kept when one differs.
     for (uint64_t secondDirty : {2, 1}) {
         auto two = std::make_shared<HTMemoryObject>();
-        two->addRegion(region(5, 0, 2, 2), p1->pageSize(), p1->pid());
-        two->addRegion(region(5, 0, 2, secondDirty), p2->pageSize(), p2->pid());
+        two->addRegion(region(5, 0, 2, 2), kPage, 1);
+        two->addRegion(region(5, 0, 2, secondDirty), kPage, 2);
         two->finalize(false);
         EXPECT_EQ(bool(two->processMemoryRegions()), secondDirty != 2) << secondDirty << " dirty";
     }
@@ -122,24 +107,20 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
 
 TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
 {
-    Processes process(true);
-    auto p1 = process(1);
-    auto p2 = process(2);
-    auto pageCounted = mappedTwiceByOne(*p1, *p2);
+    auto pageCounted = mappedTwiceByOne();
     pageCounted->finalize(false);
     EXPECT_EQ(totals(*pageCounted), (Totals{3 * kPage, kPage, 0, 0}));
 
     // With the switch on no process is charged less than its regions say.
-    auto object = mappedTwiceByOne(*p1, *p2);
+    auto object = mappedTwiceByOne();
     object->finalize(true);
     EXPECT_EQ(totals(*object), (Totals{4 * kPage, kPage, 0, 0}));
 
     // p1's regions report per-region heft: its view sums them as reported.
-    auto view1 = object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), true);
+    auto view1 = object->viewForProcess(1, kPage, true, true);
     EXPECT_EQ(view1->totalDirtySize(), 4 * kPage);
     EXPECT_EQ(view1->memoryRegions().size(), 2u);
-    EXPECT_EQ(object->viewForProcess(p2->pid(), p2->pageSize(), p2->breakDownPhysHeft(), true)->totalDirtySize(),
-              kPage);
+    EXPECT_EQ(object->viewForProcess(2, kPage, true, true)->totalDirtySize(), kPage);
     EXPECT_EQ(object->viewForProcess(3, kPage, true, true), object) << "no list of its own";
 }
 
@@ -148,46 +129,39 @@ TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
     // p2 reports one dirty page somewhere in four; p1, coming after it, one
     // dirty and one clean page in each half. The range list can only bound
     // the union (one page of each), yet p1's own view holds two of each.
-    Processes process(false);
-    auto p1 = process(1);
-    auto p2 = process(2);
     auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 4, 1), p2->pageSize(), p2->pid());
+    object->addRegion(region(5, 0, 4, 1), kPage, 2);
     for (uint64_t half : {0, 2}) {
         auto mapped = region(5, half, 2, 1);
         mapped->setCleanNonSpecSize(kPage);
-        object->addRegion(mapped, p1->pageSize(), p1->pid());
+        object->addRegion(mapped, kPage, 1);
     }
     object->finalize(false);
     EXPECT_EQ(totals(*object), (Totals{2 * kPage, 0, 2 * kPage, 0}));
-    EXPECT_EQ(totals(*object->viewForProcess(p1->pid(), p1->pageSize(), p1->breakDownPhysHeft(), false)),
-              (Totals{2 * kPage, 0, 2 * kPage, 0}));
+    EXPECT_EQ(totals(*object->viewForProcess(1, kPage, false, false)), (Totals{2 * kPage, 0, 2 * kPage, 0}));
 }
 
 TEST(HTMemoryObject, OwnedMemoryIsCleanToOtherProcesses)
 {
-    Processes process(false);
-    auto owner = process(7);
-    auto other = process(9);
     auto object = std::make_shared<HTMemoryObject>();
     auto mapped = region(5, 0, 4, 2, 1);
     mapped->setCleanNonSpecSize(kPage);
     mapped->setReclaimableSize(kPage);
     mapped->setWired(true);
-    object->addRegion(mapped, owner->pageSize(), owner->pid());
+    object->addRegion(mapped, kPage, 7);
     object->setOwnerPid(7);
     object->finalize(false);
 
-    EXPECT_EQ(object->viewForProcess(owner->pid(), owner->pageSize(), owner->breakDownPhysHeft(), false), object);
-    auto seen = object->viewForProcess(other->pid(), other->pageSize(), other->breakDownPhysHeft(), false);
+    EXPECT_EQ(object->viewForProcess(7, kPage, false, false), object);
+    auto seen = object->viewForProcess(9, kPage, false, false);
     EXPECT_EQ(totals(*seen), (Totals{0, 0, 4 * kPage, 0}));
     EXPECT_EQ(&seen->memoryRegions(), &object->memoryRegions()) << "a copy shares the region set";
 
     // Outside a kept per-process map a process sees the object whole, owned or not.
-    auto kept = mappedTwiceByOne(*process(1), *owner);
+    auto kept = mappedTwiceByOne(1, 7);
     kept->setOwnerPid(7);
     kept->finalize(false);
-    EXPECT_EQ(kept->viewForProcess(other->pid(), other->pageSize(), other->breakDownPhysHeft(), false), kept);
+    EXPECT_EQ(kept->viewForProcess(9, kPage, false, false), kept);
 }
 
 TEST(HTMemoryObject, NamesComeFromTheCanonicalRegion)
@@ -226,4 +200,31 @@ TEST(HTMemoryObject, MisuseStopsTheProgram)
     object->finalize(false);
     EXPECT_DEATH(object->finalize(false), "HTMemoryObject");
     EXPECT_DEATH(object->addRegion(region(5, 0, 1, 0), kPage), "HTMemoryObject");
+}
+
+TEST(HTMemoryCategory, EachObjectAndRegionCountsOnce)
+{
+    HTMemoryCategory category(HTSegmentText);
+    EXPECT_EQ(category.name(), std::nullopt);
+    auto first = textObject(1);
+    category.addMemoryObject(first);
+    category.addMemoryObject(first);
+    EXPECT_EQ(category.totalDirtySize(), kPage);
+    // A distinct object with the same totals counts in full.
+    category.addMemoryObject(textObject(2));
+    EXPECT_EQ(category.totalDirtySize(), 2 * kPage);
+    EXPECT_EQ(category.totalRegions(), 2);
+    // A copy is another object over the same regions: totals add, regions do not.
+    category.addMemoryObject(first->copy());
+    EXPECT_EQ(category.totalDirtySize(), 3 * kPage);
+    EXPECT_EQ(category.totalRegions(), 2);
+    EXPECT_EQ(category.detailedName(), "/usr/lib/libz.so");
+    EXPECT_EQ(category.fullName(), "__TEXT /usr/lib/libz.so");
+
+    // A summary has no detailed name.
+    HTMemoryCategory summary(HTSegmentText, true);
+    summary.addMemoryObject(textObject(1));
+    summary.addMemoryObject(textObject(2, "/usr/lib/libm.so"));
+    EXPECT_EQ(summary.detailedName(), std::nullopt);
+    EXPECT_EQ(summary.fullName(), "__TEXT");
 }
