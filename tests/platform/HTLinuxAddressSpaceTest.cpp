@@ -5,7 +5,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-
 #include <chrono>
 #include <optional>
 #include <sys/mman.h>
@@ -14,6 +13,8 @@
 namespace {
 
 const uint64_t kPage = static_cast<uint64_t>(::sysconf(_SC_PAGESIZE));
+constexpr int32_t kPresent = VM_PAGE_QUERY_PAGE_PRESENT, kDirty = VM_PAGE_QUERY_PAGE_DIRTY,
+                  kExternal = VM_PAGE_QUERY_PAGE_EXTERNAL, kReusable = VM_PAGE_QUERY_PAGE_REUSABLE;
 
 struct WalkedRegion {
     uint64_t start, size;
@@ -30,19 +31,11 @@ std::vector<WalkedRegion> walk(HTPlatform& platform, HTTaskPort& task, kern_retu
         uint32_t depth = 0xFFFFFFFF, count = VM_REGION_SUBMAP_INFO_COUNT_64;
         vm_region_submap_info_64 info{};
         result = platform.mach_vm_region_recurse(task, &address, &size, &depth, &info, &count);
-        if (result != KERN_SUCCESS) break;
+        if (result != KERN_SUCCESS) return regions;
         EXPECT_TRUE(depth == 0xFFFFFFFF && count == VM_REGION_SUBMAP_INFO_COUNT_64) << depth << " " << count;
         regions.push_back({address, size, info});
         address += size;
     }
-    return regions;
-}
-
-const WalkedRegion* regionAt(const std::vector<WalkedRegion>& regions, uint64_t start)
-{
-    for (const WalkedRegion& region : regions)
-        if (region.start == start) return &region;
-    return nullptr;
 }
 
 std::vector<int32_t> dispositions(HTPlatform& platform, HTTaskPort& task, uint64_t start, uint64_t pages,
@@ -57,10 +50,12 @@ std::vector<int32_t> dispositions(HTPlatform& platform, HTTaskPort& task, uint64
 
 bool pageFlagsReadable() { return ::access("/proc/kpageflags", R_OK) == 0; }
 
-constexpr uint64_t kTouched = 16, kFreed = 8, kFilePages = 4, kFileWritten = 3;
+// Enough freed pages that the kernel reports them LazyFree in smaps rather
+// than holding them all in its per-CPU batch.
+constexpr uint64_t kTouched = 16, kFreed = 64, kFilePages = 4, kFileWritten = 3;
 
-// A layout child: written and lazily freed anonymous memory, and a
-// shared file mapping partly written.
+// A layout child: written and lazily freed anonymous memory, and a shared
+// file mapping partly written.
 class HTLinuxAddressSpace : public testing::Test {
 protected:
     void SetUp() override
@@ -98,38 +93,36 @@ protected:
 TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
 {
     // The regions' figures are the end-to-end tests' (heft's against the
-    // kernel's); here, what they do not see: how the walk ends, and the page
-    // by page answers heft asks for when it tells shared pages apart.
+    // kernel's); here, how the walk ends and the page by page answers heft
+    // asks for when it tells shared pages apart.
     EXPECT_EQ(result_, KERN_INVALID_ADDRESS);
     ASSERT_GT(regions_.size(), 5u);
     for (size_t i = 1; i < regions_.size(); ++i)
         EXPECT_GE(regions_[i].start, regions_[i - 1].start + regions_[i - 1].size) << "regions overlap or go back";
 
     // The touched pages each alike, the inaccessible page either side never
-    // touched; the file's written pages present and external, the last not.
-    // Exact: the test looks well within the kernel's 30 s before it writes
-    // dirty file pages back.
-    kern_return_t result;
-    std::vector<int32_t> pages = dispositions(platform_, *task_, at(0) - kPage, kTouched + 2, result);
-    ASSERT_EQ(result, KERN_SUCCESS);
-    std::vector<int32_t> expected(kTouched + 2, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY);
+    // touched. A query longer than one chunk of pagemap answers the same,
+    // and writes nothing past the pages asked for.
+    std::vector<int32_t> expected(kTouched + 2, kPresent | kDirty);
     expected.front() = expected.back() = 0;
-    EXPECT_EQ(pages, expected);
-    // A query longer than one chunk of pagemap answers the same, and writes
-    // nothing past the pages asked for.
     const uint64_t longQuery = HTPageQueryChunk::kPages + kTouched + 2;
     std::vector<int32_t> answer(longQuery + HTPageQueryChunk::kPages, -1);
-    uint64_t count = longQuery;
-    ASSERT_EQ(platform_.mach_vm_page_range_query(*task_, at(0) - kPage, longQuery * kPage, answer.data(), &count),
-              KERN_SUCCESS);
-    EXPECT_EQ(count, longQuery);
-    EXPECT_TRUE(std::equal(expected.begin(), expected.end(), answer.begin()));
+    for (uint64_t pages : {kTouched + 2, longQuery}) {
+        uint64_t count = pages;
+        ASSERT_EQ(platform_.mach_vm_page_range_query(*task_, at(0) - kPage, pages * kPage, answer.data(), &count),
+                  KERN_SUCCESS);
+        EXPECT_EQ(count, pages);
+        EXPECT_TRUE(std::equal(expected.begin(), expected.end(), answer.begin())) << pages << " pages";
+    }
     EXPECT_EQ(std::count(answer.begin() + longQuery, answer.end(), -1), HTPageQueryChunk::kPages);
-    pages = dispositions(platform_, *task_, at(2), kFilePages, result);
+    // The file's written pages present and external, the last not. Exact:
+    // the test looks well within the kernel's 30 s before it writes dirty
+    // file pages back.
+    kern_return_t result;
+    std::vector<int32_t> pages = dispositions(platform_, *task_, at(2), kFilePages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
-    const int32_t external = VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_EXTERNAL;
     for (uint64_t i = 0; i < kFileWritten; ++i)
-        EXPECT_EQ(pages[i] & (external | VM_PAGE_QUERY_PAGE_REUSABLE), external);
+        EXPECT_EQ(pages[i] & (kPresent | kExternal | kReusable), kPresent | kExternal);
     EXPECT_EQ(pages[kFileWritten], 0);
     EXPECT_EQ(platform_.realpath("/tmp/.." + filePath_), std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
@@ -141,13 +134,18 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, nullptr), KERN_INVALID_ARGUMENT);
     EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, identities), KERN_SUCCESS);
 
-    // Lazily freed pages, still resident, are reusable page by page too.
+    // Lazily freed pages, still resident, are reusable page by page too: at
+    // least those the walk counted (the kernel may have let more out of its
+    // per-CPU batch since), the others dirty.
     if (!pageFlagsReadable()) GTEST_SKIP() << "reusable pages show in page queries only with /proc/kpageflags (root)";
-    const WalkedRegion* freed = regionAt(regions_, at(1));
-    ASSERT_NE(freed, nullptr);
+    auto freed = std::find_if(regions_.begin(), regions_.end(), [&](const auto& r) { return r.start == at(1); });
+    ASSERT_NE(freed, regions_.end());
     if (freed->info.pages_reusable == 0) GTEST_SKIP() << "the kernel reports no LazyFree pages";
-    EXPECT_EQ(dispositions(platform_, *task_, at(1), kFreed, result),
-              std::vector<int32_t>(kFreed, VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_REUSABLE));
+    pages = dispositions(platform_, *task_, at(1), kFreed, result);
+    EXPECT_GE(std::count(pages.begin(), pages.end(), kPresent | kReusable), freed->info.pages_reusable);
+    EXPECT_EQ(std::count(pages.begin(), pages.end(), kPresent | kReusable) +
+                  std::count(pages.begin(), pages.end(), kPresent | kDirty),
+              kFreed);
 }
 
 TEST_F(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
@@ -250,9 +248,9 @@ TEST(HTLinuxAddressSpaceOfItself, PagesOnlyReadAgreeWithTheKernelsPageFlags)
         ASSERT_EQ(::pread(pagemap, &entry, 8, static_cast<off_t>((start / kPage + i) * 8)), 8);
         ASSERT_EQ(::pread(kpageflags, &flags, 8, static_cast<off_t>((entry & ((uint64_t{1} << 55) - 1)) * 8)), 8);
         if ((flags & (uint64_t{1} << 24)) != 0)  // the zero page
-            EXPECT_EQ(answers[i] & ~VM_PAGE_QUERY_PAGE_EXTERNAL, VM_PAGE_QUERY_PAGE_PRESENT) << "zero page " << i;
+            EXPECT_EQ(answers[i] & ~kExternal, kPresent) << "zero page " << i;
         else
-            EXPECT_EQ(answers[i], VM_PAGE_QUERY_PAGE_PRESENT | VM_PAGE_QUERY_PAGE_DIRTY) << "page " << i;
+            EXPECT_EQ(answers[i], kPresent | kDirty) << "page " << i;
     }
     ::close(pagemap);
     ::close(kpageflags);
