@@ -15,12 +15,6 @@
 
 namespace {
 
-std::string readWhole(const char* path)
-{
-    HTProcBuffer buffer;
-    return buffer.readFile(AT_FDCWD, path) ? std::string(buffer.view()) : std::string();
-}
-
 // The argument area of a process through the platform; empty, with errno,
 // on failure.
 std::string procArgs(HTPlatform& platform, int32_t pid)
@@ -32,18 +26,13 @@ std::string procArgs(HTPlatform& platform, int32_t pid)
     return std::string(area.data(), length);
 }
 
-proc_bsdinfo record(HTPlatform& platform, int32_t pid, int expected = sizeof(proc_bsdinfo))
+// What proc_pidinfo returns for the full or the short record, errno cleared before.
+template<class Record>
+int pidinfo(HTPlatform& platform, int32_t pid, Record& record)
 {
-    proc_bsdinfo info{};
-    EXPECT_EQ(platform.proc_pidinfo(pid, PROC_PIDTBSDINFO, 0, &info, sizeof(info)), expected) << pid;
-    return info;
-}
-
-proc_bsdshortinfo shortRecord(HTPlatform& platform, int32_t pid, int expected = sizeof(proc_bsdshortinfo))
-{
-    proc_bsdshortinfo info{};
-    EXPECT_EQ(platform.proc_pidinfo(pid, PROC_PIDT_SHORTBSDINFO, 1, &info, sizeof(info)), expected) << pid;
-    return info;
+    errno = 0;
+    const int flavor = sizeof(Record) == sizeof(proc_bsdinfo) ? PROC_PIDTBSDINFO : PROC_PIDT_SHORTBSDINFO;
+    return platform.proc_pidinfo(pid, flavor, 0, &record, sizeof(record));
 }
 
 }  // namespace
@@ -54,17 +43,19 @@ TEST(HTLinuxPlatform, ChildZombieAndGone)
     HTLinuxPlatform platform;
     HTLayoutChild child({"exit"});
     ASSERT_TRUE(child.waitForExit());
-    EXPECT_EQ(shortRecord(platform, child.pid()).pbsi_status, SZOMB);
+    proc_bsdinfo full{};
+    proc_bsdshortinfo brief{};
+    EXPECT_EQ(pidinfo(platform, child.pid(), brief), static_cast<int>(sizeof(brief)));
+    EXPECT_EQ(brief.pbsi_status, SZOMB);
     errno = 0;
     EXPECT_EQ(procArgs(platform, child.pid()), "");
     EXPECT_EQ(errno, ENOENT) << "a zombie has no executable any more";
 
     const int32_t pid = child.pid();
     child.reap();
-    errno = 0;
-    record(platform, pid, 0);
-    EXPECT_EQ(std::exchange(errno, 0), ESRCH);
-    shortRecord(platform, pid, 0);
+    EXPECT_EQ(pidinfo(platform, pid, full), 0);
+    EXPECT_EQ(errno, ESRCH);
+    EXPECT_EQ(pidinfo(platform, pid, brief), 0);
     EXPECT_EQ(std::exchange(errno, 0), ESRCH);
     EXPECT_EQ(procArgs(platform, pid), "");
     EXPECT_EQ(errno, ESRCH);
@@ -94,10 +85,12 @@ TEST(HTLinuxPlatform, ListingHoldsKernelAndProcessesButNoKernelThreads)
     EXPECT_EQ(two[2], -1);
 
     // Outside a pid namespace, pid 2 is kthreadd, parent of every kernel thread.
-    if (!readWhole("/proc/2/stat").starts_with("2 (kthreadd) ")) GTEST_SKIP() << "no kernel threads visible here";
+    HTProcBuffer stat;
+    if (!stat.readFile(AT_FDCWD, "/proc/2/stat") || !stat.view().starts_with("2 (kthreadd) "))
+        GTEST_SKIP() << "no kernel threads visible here";
     EXPECT_EQ(std::count(pids.begin(), pids.end(), 2), 0);
-    errno = 0;
-    record(platform, 2, 0);
+    proc_bsdinfo info{};
+    EXPECT_EQ(pidinfo(platform, 2, info), 0);
     EXPECT_EQ(errno, ESRCH);
 }
 
@@ -140,7 +133,7 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
         std::shared_ptr<HTTaskPort> task;
         if (platform.task_for_pid(target, &task) != (HT_KERN_ERRNO_BASE | EACCES)) failures |= 2;
         proc_bsdinfo info{};
-        if (platform.proc_pidinfo(target, PROC_PIDTBSDINFO, 0, &info, sizeof(info)) != sizeof(info)) failures |= 4;
+        if (pidinfo(platform, target, info) != sizeof(info)) failures |= 4;
         return failures;
     };
     int failures = -1;
