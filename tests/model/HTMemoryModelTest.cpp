@@ -1,11 +1,15 @@
-#include "model/HTMemoryObject.h"
 #include "model/HTMemoryCategory.h"
+#include "model/HTMemoryObject.h"
 #include "model/HTMemoryRegion.h"
 
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <array>
+#include <functional>
 #include <memory>
+#include <utility>
+#include <vector>
 
 namespace {
 
@@ -227,4 +231,65 @@ TEST(HTMemoryCategory, EachObjectAndRegionCountsOnce)
     summary.addMemoryObject(textObject(2, "/usr/lib/libm.so"));
     EXPECT_EQ(summary.detailedName(), std::nullopt);
     EXPECT_EQ(summary.fullName(), "__TEXT");
+}
+
+TEST(HTMemoryRegion, EndOrderAndNames)
+{
+    auto spanning = [](uint64_t start, uint64_t size) {
+        auto made = region(5, 0, 0, 0);
+        made->setStart(start);
+        made->setSize(size);
+        return made;
+    };
+    EXPECT_EQ(spanning(HTNoAddress, 5 * kPage)->end(), HTNoAddress);
+    EXPECT_EQ(spanning(0x1000, 0x4000)->end(), 0x5000u);
+    std::vector<std::shared_ptr<HTMemoryRegion>> regions{spanning(0x1000, 0x1000), spanning(0x1000, 0x3000),
+                                                         spanning(0x800, 0x100)};
+    std::sort(regions.begin(), regions.end(), [](const auto& a, const auto& b) { return a->compare(*b) < 0; });
+    EXPECT_EQ(regions[0]->start(), 0x800u);
+    EXPECT_EQ(regions[1]->size(), 0x3000u);
+    EXPECT_EQ(regions[2]->compare(*spanning(0x1000, 0x1000)), 0);
+
+    HTMemoryRegion r;
+    r.setName("mapped file");
+    r.setDetailedName("");
+    EXPECT_EQ(r.fullName(), "mapped file");
+    r.setDetailedName("x");
+    EXPECT_EQ(r.fullName(), "mapped file x");
+    // Empty slots ask the region-type description, then fall through.
+    const std::pair<uint32_t, const char*> tags[] = {{240, "app-specific tag 1"},
+                                                     {255, "app-specific tag 16"},
+                                                     {0, "untagged (\"VM_ALLOCATE\")"},
+                                                     {100, "shared memory"},
+                                                     {99, "tag 99"},
+                                                     {300, "tag 300"},
+                                                     {0x80000000, "tag -2147483648"},
+                                                     {HTFakeRegionTag, "Owned physical heft (unmapped)"}};
+    for (auto [tag, name] : tags) EXPECT_EQ(HTMemoryRegion::categoryNameForTag(tag), name) << tag;
+}
+
+TEST(HTMemoryRegion, Eligibility)
+{
+    // {eligibleForProcessView, eligibleForSubranges} of a two-page shared
+    // region with one dirty page, after `change`.
+    using Both = std::pair<bool, bool>;
+    auto eligibility = [](const std::function<void(HTMemoryRegion&)>& change) {
+        auto r = region(5, 0, 2, 1);
+        r->setSegment(HTSegmentNoImage);
+        change(*r);
+        return Both(r->eligibleForProcessView(), r->eligibleForSubrangesUsingPageSize(kPage));
+    };
+    EXPECT_EQ(eligibility([](HTMemoryRegion&) {}), Both(true, true));
+    // Memory private to its process by nature.
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setUser_tag(HTFakeRegionTag); }), Both(false, false));
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setInSharedCache(true); }), Both(false, false));
+    for (uint8_t mode : {SM_PRIVATE, SM_EMPTY, SM_PRIVATE_ALIASED})
+        EXPECT_EQ(eligibility([mode](HTMemoryRegion& r) { r.setShare_mode(mode); }), Both(false, false));
+    for (uint8_t segment : {HTSegmentText, HTSegmentOther, HTSegmentLinkEdit})
+        EXPECT_EQ(eligibility([segment](HTMemoryRegion& r) { r.setSegment(segment); }), Both(false, false));
+    // Pages all of one kind, nothing at all, a single page, or owned memory.
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setReclaimableSize(2 * kPage); }), Both(true, false));
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setDirtySize(0); }), Both(true, false));
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setSize(kPage); }), Both(true, false));
+    EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setOwnedExclusivelyByParentProcess(true); }), Both(true, false));
 }
