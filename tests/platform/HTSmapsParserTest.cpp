@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cinttypes>
 #include <cstdio>
-#include <cstdlib>
 #include <fcntl.h>
 #include <set>
 #include <string>
@@ -20,11 +19,9 @@ namespace {
 constexpr uint64_t kPage = 4096;
 constexpr uint64_t kKiB = 1024;
 
-// Mappings captured from two real processes on x86-64 Linux 6.18: a probe
-// that laid out one mapping of every kind (the hugetlbfs ones come from a
-// second process, which puts them out of address order), plus two mappings
-// named with prctl(PR_SET_VMA_ANON_NAME) written in the kernel's format,
-// since the capturing kernel was built without named anonymous memory.
+// Mappings captured on x86-64 Linux 6.18 from a probe that laid out one of
+// every kind and a second process with the hugetlbfs ones (out of address
+// order), plus two named anonymous mappings written in the kernel's format.
 std::vector<HTSmapsEntry> parsedCapture()
 {
     HTProcBuffer file;
@@ -35,9 +32,8 @@ std::vector<HTSmapsEntry> parsedCapture()
     return entries;
 }
 
-// A parsed maps line on one line: start-end, protection and sharing,
-// offset, device, inode, KernelPageSize/Rss/Shared_Clean in KiB, the
-// VmFlags bits, the path.
+// start-end, protection and sharing, offset, device, inode,
+// KernelPageSize/Rss/Shared_Clean in KiB, VmFlags bits, path.
 std::string describe(const HTSmapsEntry& e)
 {
     char text[160];
@@ -49,11 +45,7 @@ std::string describe(const HTSmapsEntry& e)
     return text;
 }
 
-// The region records the walk makes of a mapping: tag, share mode,
-// inheritance, external pager, protection/max, file offset, pages
-// resident/dirtied/copied/reusable/swapped, reference and wired counts;
-// then the basic record's sharing, inheritance, protection/max and wired
-// count.
+// The walk's region record of a mapping, then its basic record.
 std::string describeRecord(const HTSmapsEntry& e)
 {
     const vm_region_submap_info_64 i = htSubmapInfo(e, 4242, kPage);
@@ -73,12 +65,12 @@ std::string describeRecord(const HTSmapsEntry& e)
 
 TEST(HTSmapsParser, EveryKindOfMappingAndItsRegionRecord)
 {
-    // The capture holds, in this order: the program, its heap, a huge page
-    // of anonymous memory, MADV_DONTFORK, MADV_FREE and mlocked memory, a
-    // private file mapping with one page copied on write and the same file
-    // shared, System V, POSIX, memfd and MAP_SHARED anonymous memory, named
-    // anonymous memory private and shared, libc, a guard page, vvar, vdso,
-    // the stack, vsyscall, and hugetlbfs shared and private.
+    // In order: the program, its heap, a huge page of anonymous memory,
+    // MADV_DONTFORK, MADV_FREE and mlocked memory, a private file mapping with
+    // a page copied on write and the same file shared, System V, POSIX, memfd
+    // and MAP_SHARED anonymous memory, named anonymous memory private and
+    // shared, libc, a guard page, vvar, vdso, the stack, vsyscall, hugetlbfs
+    // shared and private.
     std::vector<HTSmapsEntry> entries = parsedCapture();
     EXPECT_TRUE(std::is_sorted(entries.begin(), entries.end(),
                                [](const HTSmapsEntry& a, const HTSmapsEntry& b) { return a.start < b.start; }));
@@ -90,16 +82,11 @@ TEST(HTSmapsParser, EveryKindOfMappingAndItsRegionRecord)
 TEST(HTSmapsParser, ReusesRecordsAndSkipsWhatItCannotRead)
 {
     std::vector<HTSmapsEntry> entries = parsedCapture();
-    // A second, shorter text: no record of the first survives in it.
-    constexpr std::string_view text = "not a maps line\n"
-                                      "Rss:                 99 kB\n"
-                                      "7f00-zz00 rw-p 00000000 00:00 0 \n"
-                                      "Rss:                 98 kB\n"
-                                      "1000-3000 rw-s 00002000 00:01 7    /memfd:x (deleted)\n"
-                                      "Rss:                  8 kB\n"
-                                      "Swap:\n"
-                                      "Private_Dirty:        4 kB\n"
-                                      "VmFlags: rd wr sh mr mw me lo";  // cut short: no final line feed
+    // A second, shorter text, cut short without a final line feed: no
+    // record of the first survives in it.
+    HTProcBuffer file;
+    ASSERT_TRUE(file.readFile(AT_FDCWD, HEFT_TEST_DATA_DIR "/smaps-unreadable-lines.txt"));
+    const std::string_view text = file.view().substr(0, file.size() - 1);
     ASSERT_EQ(htParseSmaps(text, entries), 1u);
     ASSERT_EQ(entries.size(), 1u);
     EXPECT_EQ(describe(entries[0]), "1000-3000 3s 2000 0:1 7 0/8/0 1f /memfd:x (deleted)");
