@@ -21,8 +21,7 @@ struct WalkedRegion {
     vm_region_submap_info_64 info;
 };
 
-// The whole address space as the walk sees it; `result` is the code that
-// ended the walk.
+// The whole address space as the walk sees it; `result` ends the walk.
 std::vector<WalkedRegion> walk(HTPlatform& platform, HTTaskPort& task, kern_return_t& result)
 {
     std::vector<WalkedRegion> regions;
@@ -50,12 +49,10 @@ std::vector<int32_t> dispositions(HTPlatform& platform, HTTaskPort& task, uint64
 
 bool pageFlagsReadable() { return ::access("/proc/kpageflags", R_OK) == 0; }
 
-// Enough freed pages that the kernel reports them LazyFree in smaps rather
-// than holding them all in its per-CPU batch.
+// Enough freed pages that the kernel's per-CPU batch cannot hold them all back from LazyFree.
 constexpr uint64_t kTouched = 16, kFreed = 64, kFilePages = 4, kFileWritten = 3;
 
-// A layout child: written and lazily freed anonymous memory, and a shared
-// file mapping partly written.
+// A child with written and lazily freed anonymous memory, and a shared file mapping partly written.
 class HTLinuxAddressSpace : public testing::Test {
 protected:
     void SetUp() override
@@ -92,17 +89,14 @@ protected:
 
 TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
 {
-    // The regions' figures are the end-to-end tests' (heft's against the
-    // kernel's); here, how the walk ends and the page by page answers heft
-    // asks for when it tells shared pages apart.
+    // The regions' figures are the end-to-end tests'; here, how the walk ends and the page answers.
     EXPECT_EQ(result_, KERN_INVALID_ADDRESS);
     ASSERT_GT(regions_.size(), 5u);
     for (size_t i = 1; i < regions_.size(); ++i)
         EXPECT_GE(regions_[i].start, regions_[i - 1].start + regions_[i - 1].size) << "regions overlap or go back";
 
-    // The touched pages each alike, the inaccessible page either side never
-    // touched. A query longer than one chunk of pagemap answers the same,
-    // and writes nothing past the pages asked for.
+    // The touched pages between two inaccessible ones; a query longer than one chunk of pagemap answers the
+    // same and writes nothing past the pages asked for.
     std::vector<int32_t> expected(kTouched + 2, kPresent | kDirty);
     expected.front() = expected.back() = 0;
     const uint64_t longQuery = HTPageQueryChunk::kPages + kTouched + 2;
@@ -115,9 +109,7 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
         EXPECT_TRUE(std::equal(expected.begin(), expected.end(), answer.begin())) << pages << " pages";
     }
     EXPECT_EQ(std::count(answer.begin() + longQuery, answer.end(), -1), HTPageQueryChunk::kPages);
-    // The file's written pages present and external, the last not. Exact:
-    // the test looks well within the kernel's 30 s before it writes dirty
-    // file pages back.
+    // The file's written pages present and external, the last not (well within the 30 s before write-back).
     kern_return_t result;
     std::vector<int32_t> pages = dispositions(platform_, *task_, at(2), kFilePages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
@@ -134,9 +126,8 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, nullptr), KERN_INVALID_ARGUMENT);
     EXPECT_EQ(platform_.sharedPageIdentities(*task_, at(0), 2, identities), KERN_SUCCESS);
 
-    // Lazily freed pages, still resident, are reusable page by page too: at
-    // least those the walk counted (the kernel may have let more out of its
-    // per-CPU batch since), the others dirty.
+    // Lazily freed pages are reusable: at least those the walk counted (the kernel may since have let more out
+    // of its per-CPU batch), the others dirty.
     if (!pageFlagsReadable()) GTEST_SKIP() << "reusable pages show in page queries only with /proc/kpageflags (root)";
     auto freed = std::find_if(regions_.begin(), regions_.end(), [&](const auto& r) { return r.start == at(1); });
     ASSERT_NE(freed, regions_.end());
@@ -182,10 +173,8 @@ TEST_F(HTLinuxAddressSpace, ZombieAndReapedChildAnswerAsExited)
 
 TEST(HTLinuxAddressSpaceExit, ProcessKilledWhileItsMappingsAreReadIsNeverWhole)
 {
-    // Tens of thousands of mappings take the kernel milliseconds to list; a
-    // kill lands in the middle, and the text then ends early without an
-    // error. Whatever the moment, the walk has every mapping or says that
-    // the process exited.
+    // A kill lands while the kernel lists tens of thousands of mappings, and the text ends early without an
+    // error: whatever the moment, the walk has every mapping or says that the process exited.
     constexpr size_t kMappings = 30000;
     for (int delayMs : {1, 3, 6, 10, 20}) {
         SCOPED_TRACE("kill after " + std::to_string(delayMs) + " ms");
@@ -210,11 +199,8 @@ TEST(HTLinuxAddressSpaceExit, ProcessKilledWhileItsMappingsAreReadIsNeverWhole)
 
 TEST(HTLinuxAddressSpaceOfItself, PagesOnlyReadAgreeWithTheKernelsPageFlags)
 {
-    // Anonymous memory only read holds the shared zero page on most kernels
-    // (in a huge-page-aligned stretch, the huge zero page); a kernel may also
-    // give such a read a page of its own. Either way the answer must be what
-    // the page's own flags say: zero pages are present but cost nothing,
-    // other pages are dirty. Asked of the test itself.
+    // Memory only read holds the (huge) zero page or a page of its own; the answers must be what the page's
+    // flags say: zero pages are present but cost nothing, other pages are dirty. Asked of the test itself.
     if (!pageFlagsReadable()) GTEST_SKIP() << "needs /proc/kpageflags (root)";
     HTLinuxPlatform platform;
     constexpr uint64_t kHuge = 2u << 20;
@@ -232,8 +218,7 @@ TEST(HTLinuxAddressSpaceOfItself, PagesOnlyReadAgreeWithTheKernelsPageFlags)
     kern_return_t result;
     walk(platform, *task, result);
     const auto start = reinterpret_cast<uint64_t>(aligned);
-    // Asked alone, and after a scan of the mapping's populated pages, which
-    // learns on its way whether the mapping holds zero pages.
+    // Asked alone, and after a scan of populated pages, which learns whether the mapping holds zero pages.
     std::vector<int32_t> answers = dispositions(platform, *task, start, pages, result);
     ASSERT_EQ(result, KERN_SUCCESS);
     std::vector<HTPageRun> runs;
