@@ -6,8 +6,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <climits>
-#include <cstring>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <thread>
@@ -15,8 +13,7 @@
 
 namespace {
 
-// The argument area of a process through the platform; empty, with errno,
-// on failure.
+// The argument area of a process; empty, with errno, on failure.
 std::string procArgs(HTPlatform& platform, int32_t pid)
 {
     int name[3] = {CTL_KERN, KERN_PROCARGS2, pid};
@@ -104,11 +101,9 @@ TEST(HTLinuxPlatform, ArgumentAreaSizeAndShortBuffer)
     EXPECT_GE(argmax, 4096);
     EXPECT_LE(argmax, 1 << 20);
 
-    // The executable's path in it names every process heft reports, end to
-    // end; here, the calls heft does not make.
+    // The area itself is in every end-to-end run; here its size, and a buffer too small for the path.
     std::string area = procArgs(platform, ::getpid());
     ASSERT_GT(area.size(), 8u);
-    // Asked for its size, then into a buffer too small for the path.
     int name[3] = {CTL_KERN, KERN_PROCARGS2, ::getpid()};
     size_t needed = 0;
     ASSERT_EQ(platform.sysctl(name, 3, nullptr, &needed, nullptr, 0), 0);
@@ -123,8 +118,7 @@ TEST(HTLinuxPlatform, ArgumentAreaSizeAndShortBuffer)
 
 TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
 {
-    // Unprivileged, another user's executable and memory maps are closed:
-    // the failures carry EACCES, while the process record stays readable.
+    // Unprivileged, another user's executable and maps are closed (EACCES); the record stays readable.
     auto check = [](int32_t target) -> int {
         HTLinuxPlatform platform;
         int failures = 0;
@@ -143,8 +137,7 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
             GTEST_SKIP() << "needs root, or a pid 1 of another user";
         failures = check(1);
     } else {
-        // As root: a thread of the test gives up root (the bare system calls
-        // change that thread alone) and looks at a child that kept it.
+        // A thread gives up root (bare system calls change that thread alone) and looks at a child that kept it.
         HTLayoutChild child({});
         ASSERT_TRUE(child.ready());
         std::thread([&] {
@@ -156,7 +149,7 @@ TEST(HTLinuxPlatform, OtherUsersProcessesNeedTheRightToTrace)
     EXPECT_EQ(failures, 0) << "1: argument area, 2: task port, 4: record";
 }
 
-TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
+TEST(HTLinuxPlatform, TaskPortAndSettings)
 {
     HTLinuxPlatform platform;
     std::shared_ptr<HTTaskPort> task;
@@ -164,10 +157,7 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     auto* linuxTask = dynamic_cast<HTLinuxTaskPort*>(task.get());
     ASSERT_NE(linuxTask, nullptr);
     EXPECT_EQ(linuxTask->pid(), ::getpid());
-    // (That the handle holds no descriptor between calls, the end-to-end
-    // tests see: heft measures more processes than it may open files.)
-    // A handle on a process of the same pid that started at another time
-    // (the pid recycled since) opens nothing.
+    // A handle on a process of the same pid that started at another time (the pid recycled) opens nothing.
     ASSERT_TRUE(linuxTask->startTime());
     HTLinuxTaskPort recycled(::getpid(), *linuxTask->startTime() + 1);
     errno = 0;
@@ -178,11 +168,6 @@ TEST(HTLinuxPlatform, TaskPortOfTheTestItself)
     EXPECT_NE(platform.task_for_pid(0, &task), KERN_SUCCESS);
     EXPECT_EQ(task, nullptr);
     EXPECT_EQ(platform.mach_error_string(MACH_SEND_INVALID_DEST), "process is gone");
-}
-
-TEST(HTLinuxPlatform, NoSettingByName)
-{
-    HTLinuxPlatform platform;
     int32_t value = -1;
     size_t length = sizeof(value);
     for (const char* absent : {"vm.self_region_heft", "vm.get_owned_vmobjects", "kern.nothing"}) {
