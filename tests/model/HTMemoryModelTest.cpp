@@ -15,8 +15,7 @@ namespace {
 
 constexpr uint64_t kPage = 4096;
 
-// A mapping of `pages` pages at page `offsetPages` of object `objectId`,
-// with `dirtyPages` dirty and `swappedPages` swapped.
+// A shared mapping of `pages` pages from page `offsetPages` of an object, some dirty and swapped.
 std::shared_ptr<HTMemoryRegion> region(uint64_t objectId, uint64_t offsetPages, uint64_t pages, uint64_t dirtyPages,
                                        uint64_t swappedPages = 0, uint8_t shareMode = SM_SHARED)
 {
@@ -38,8 +37,7 @@ Totals totals(const HTMemoryObject& o)
     return {o.totalDirtySize(), o.totalSwappedSize(), o.totalCleanSize(), o.totalReclaimableSize()};
 }
 
-// p1 maps two pages twice and its regions report them twice; p2 maps the
-// page after them. Counted by pages: three dirty pages, one swapped.
+// p1 maps two pages twice (and reports them twice), p2 the page after: three dirty pages, one swapped.
 std::shared_ptr<HTMemoryObject> mappedTwiceByOne(int32_t p1 = 1, int32_t p2 = 2)
 {
     auto object = std::make_shared<HTMemoryObject>();
@@ -98,8 +96,7 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
     ASSERT_EQ(object->processMemoryRegions()->keys(), (std::vector<int32_t>{2, 1}));
     EXPECT_EQ(object->processMemoryRegions()->find(1)->size(), 1u);
 
-    // Two processes, one region each: dropped when both equal the totals,
-    // kept when one differs.
+    // Two processes, one region each: dropped when both equal the totals, kept when one differs.
     for (uint64_t secondDirty : {2, 1}) {
         auto two = std::make_shared<HTMemoryObject>();
         two->addRegion(region(5, 0, 2, 2), kPage, 1);
@@ -130,9 +127,8 @@ TEST(HTMemoryObject, ViewsOfProcessesWithRegionsOfTheirOwn)
 
 TEST(HTMemoryObject, TotalsAreNeverBelowWhatOneProcessSees)
 {
-    // p2 reports one dirty page somewhere in four; p1, coming after it, one
-    // dirty and one clean page in each half. The range list can only bound
-    // the union (one page of each), yet p1's own view holds two of each.
+    // p2 reports one dirty page in four; p1, after it, one dirty and one clean page in each half. The range
+    // list can only bound the union (one page of each), yet p1's own view holds two of each.
     auto object = std::make_shared<HTMemoryObject>();
     object->addRegion(region(5, 0, 4, 1), kPage, 2);
     for (uint64_t half : {0, 2}) {
@@ -270,8 +266,7 @@ TEST(HTMemoryRegion, EndOrderAndNames)
 
 TEST(HTMemoryRegion, Eligibility)
 {
-    // {eligibleForProcessView, eligibleForSubranges} of a two-page shared
-    // region with one dirty page, after `change`.
+    // {eligibleForProcessView, eligibleForSubranges} of a two-page shared region, one page dirty, after `change`.
     using Both = std::pair<bool, bool>;
     auto eligibility = [](const std::function<void(HTMemoryRegion&)>& change) {
         auto r = region(5, 0, 2, 1);

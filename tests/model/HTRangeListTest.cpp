@@ -123,9 +123,8 @@ TEST(HTRangeList, SpansAndTotalsOfTheRangesInTheDataFile)
     EXPECT_EQ(cases, 27);
 }
 
-// Processes with random pages, added in random order, against the union of
-// their page sets. Some report runs of one kind, exact, as a region's
-// sub-ranges; others only their totals over a whole range.
+// Processes with random pages against the union of their page sets: some report runs of one kind, exact, as a
+// region's sub-ranges; others only their totals over a whole range.
 TEST(HTRangeList, TotalsMatchTheUnionOfPages)
 {
     constexpr size_t kPages = 64;
@@ -139,12 +138,8 @@ TEST(HTRangeList, TotalsMatchTheUnionOfPages)
     // Full kinds of an exact span, one bit each; -1 for an inexact one.
     auto pattern = [](const HTRangeListNode& node) {
         int full = 0;
-        for (size_t kind = 0; kind < kKinds; ++kind) {
-            if (node.*kSpanTotals[kind] == node.size)
-                full |= 1 << kind;
-            else if (node.*kSpanTotals[kind] != 0)
-                return -1;
-        }
+        for (size_t kind = 0; kind < kKinds; ++kind)
+            full = node.*kSpanTotals[kind] == node.size ? full | 1 << kind : node.*kSpanTotals[kind] != 0 ? -1 : full;
         return full;
     };
 
@@ -208,9 +203,8 @@ TEST(HTRangeList, TotalsMatchTheUnionOfPages)
 
 TEST(HTRangeList, LongListsAreAddedInOnePassAndFreedWithoutRecursion)
 {
-    // Alternating runs stay apart; added again, as a forked process that
-    // shares them would, each lands on its own span. Walking the list from
-    // its head for each run would take minutes here.
+    // Alternating runs stay apart; added again, as by a forked process, each lands on its own span. Walking
+    // the list from its head for each run would take minutes here.
     constexpr uint64_t count = 200000;
     std::vector<Range> alternating;
     for (uint64_t i = 0; i < count; ++i)
