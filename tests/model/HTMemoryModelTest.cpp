@@ -7,6 +7,7 @@
 #include <algorithm>
 #include <array>
 #include <functional>
+#include <initializer_list>
 #include <memory>
 #include <utility>
 #include <vector>
@@ -37,14 +38,20 @@ Totals totals(const HTMemoryObject& o)
     return {o.totalDirtySize(), o.totalSwappedSize(), o.totalCleanSize(), o.totalReclaimableSize()};
 }
 
+// An object of the regions, each mapped by the process of its pid (none when negative).
+std::shared_ptr<HTMemoryObject>
+objectOf(std::initializer_list<std::pair<std::shared_ptr<HTMemoryRegion>, int32_t>> regions)
+{
+    auto made = std::make_shared<HTMemoryObject>();
+    for (const auto& [mapped, pid] : regions)
+        pid < 0 ? made->addRegion(mapped, kPage) : made->addRegion(mapped, kPage, pid);
+    return made;
+}
+
 // p1 maps two pages twice (and reports them twice), p2 the page after: three dirty pages, one swapped.
 std::shared_ptr<HTMemoryObject> mappedTwiceByOne(int32_t p1 = 1, int32_t p2 = 2)
 {
-    auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 2, 2), kPage, p1);
-    object->addRegion(region(5, 0, 2, 2, 1), kPage, p1);
-    object->addRegion(region(5, 2, 1, 1), kPage, p2);
-    return object;
+    return objectOf({{region(5, 0, 2, 2), p1}, {region(5, 0, 2, 2, 1), p1}, {region(5, 2, 1, 1), p2}});
 }
 
 // A finalised object of one "__TEXT" region with one dirty page.
@@ -53,8 +60,7 @@ std::shared_ptr<HTMemoryObject> textObject(uint64_t objectId, const char* path =
     auto text = region(objectId, 0, 1, 1);
     text->setName("__TEXT");
     text->setDetailedName(path);
-    auto made = std::make_shared<HTMemoryObject>();
-    made->addRegion(text, kPage);
+    auto made = objectOf({{text, -1}});
     made->finalize(false);
     return made;
 }
@@ -63,9 +69,7 @@ std::shared_ptr<HTMemoryObject> textObject(uint64_t objectId, const char* path =
 
 TEST(HTMemoryObject, TotalsCountEachPageOnce)
 {
-    auto object = std::make_shared<HTMemoryObject>();
-    object->addRegion(region(5, 0, 4, 4), kPage, 1);
-    object->addRegion(region(5, 2, 4, 4), kPage, 1);
+    auto object = objectOf({{region(5, 0, 4, 4), 1}, {region(5, 2, 4, 4), 1}});
     // Only a region's sub-ranges count once it has some.
     auto pieces = region(5, 16, 4, 4);
     pieces->addSubrange(16 * kPage, kPage, HTMemoryTotals{0, 0, kPage, 0, 0, 0}, kPage);
@@ -98,9 +102,7 @@ TEST(HTMemoryObject, PerProcessMapIsKeptOnlyWhenItTellsSomething)
 
     // Two processes, one region each: dropped when both equal the totals, kept when one differs.
     for (uint64_t secondDirty : {2, 1}) {
-        auto two = std::make_shared<HTMemoryObject>();
-        two->addRegion(region(5, 0, 2, 2), kPage, 1);
-        two->addRegion(region(5, 0, 2, secondDirty), kPage, 2);
+        auto two = objectOf({{region(5, 0, 2, 2), 1}, {region(5, 0, 2, secondDirty), 2}});
         two->finalize(false);
         EXPECT_EQ(bool(two->processMemoryRegions()), secondDirty != 2) << secondDirty << " dirty";
     }
@@ -172,10 +174,8 @@ TEST(HTMemoryObject, NamesComeFromTheCanonicalRegion)
     auto mapped = region(5, 0, 1, 1);
     mapped->setName("mapped file");
     mapped->setDetailedName("/tmp/data");
-    auto owned = std::make_shared<HTMemoryObject>();
-    EXPECT_EQ(owned->name(), std::nullopt);
-    owned->addRegion(fake, kPage);
-    owned->addRegion(mapped, kPage);
+    EXPECT_EQ(objectOf({})->name(), std::nullopt);
+    auto owned = objectOf({{fake, -1}, {mapped, -1}});
     owned->setOwnerPid(7);
     owned->finalize(false);
     EXPECT_EQ(fake->fullName(), "mapped file /tmp/data");
@@ -187,10 +187,7 @@ TEST(HTMemoryObject, NamesComeFromTheCanonicalRegion)
     auto piece = region(0, 1, 1, 0);
     piece->setInSharedCache(true);
     piece->setName("__TEXT");
-    auto cache = std::make_shared<HTMemoryObject>();
-    cache->addRegion(unused, kPage);
-    cache->addRegion(piece, kPage);
-    EXPECT_EQ(cache->name(), "__TEXT");
+    EXPECT_EQ(objectOf({{unused, -1}, {piece, -1}})->name(), "__TEXT");
 }
 
 TEST(HTMemoryObject, MisuseStopsTheProgram)
