@@ -51,9 +51,8 @@ const HTPlatformImage* imageWithPath(const std::vector<HTPlatformImage>& images,
 // The name of the image segment holding the address; empty when none.
 std::string segmentAt(const HTPlatformImage& image, uint64_t address)
 {
-    for (const auto& segment : image.segments) {
+    for (const auto& segment : image.segments)
         if (segment.start <= address && address < segment.start + segment.size) return segment.name;
-    }
     return "";
 }
 

@@ -118,7 +118,7 @@ TEST(HTProcBuffer, ReadsWholeFilesOfAnySizeIntoOneBuffer)
     EXPECT_EQ(errno, EISDIR);
 }
 
-TEST(HTProcStatParser, FieldsOfAnyCommandNameAndRefusedLines)
+TEST(HTProcStatParser, FieldsOfAnyCommandNameStatesAndRefusedLines)
 {
     std::ifstream file(HEFT_TEST_DATA_DIR "/proc-stat-lines.txt");
     int rows = 0;
@@ -145,13 +145,10 @@ TEST(HTProcStatParser, FieldsOfAnyCommandNameAndRefusedLines)
     const std::string cat = capture("proc-stat-cat.txt");
     for (size_t length = 0; length <= cat.find(" 36232") + 1; ++length)
         EXPECT_FALSE(htParseProcStat(std::string_view(cat).substr(0, length))) << "length " << length;
-}
-
-TEST(HTProcStatParser, StateLettersMapToRecordStatus)
-{
-    const std::pair<char, uint32_t> rows[] = {{'R', SRUN},  {'S', SSLEEP}, {'D', SSLEEP}, {'I', SSLEEP},
-                                              {'T', SSTOP}, {'t', SSTOP},  {'Z', SZOMB},  {'X', SZOMB}};
-    for (auto [state, status] : rows) EXPECT_EQ(htProcStatusForState(state), status) << state;
+    // State letters and the record status they map to.
+    const std::pair<char, uint32_t> states[] = {{'R', SRUN},  {'S', SSLEEP}, {'D', SSLEEP}, {'I', SSLEEP},
+                                                {'T', SSTOP}, {'t', SSTOP},  {'Z', SZOMB},  {'X', SZOMB}};
+    for (auto [state, status] : states) EXPECT_EQ(htProcStatusForState(state), status) << state;
 }
 
 TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)
