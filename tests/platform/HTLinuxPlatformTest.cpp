@@ -13,6 +13,7 @@
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <thread>
+#include <type_traits>
 #include <utility>
 
 namespace {
@@ -32,7 +33,7 @@ template<class Record>
 int pidinfo(HTPlatform& platform, int32_t pid, Record& record)
 {
     errno = 0;
-    const int flavor = sizeof(Record) == sizeof(proc_bsdinfo) ? PROC_PIDTBSDINFO : PROC_PIDT_SHORTBSDINFO;
+    const int flavor = std::is_same_v<Record, proc_bsdinfo> ? PROC_PIDTBSDINFO : PROC_PIDT_SHORTBSDINFO;
     return platform.proc_pidinfo(pid, flavor, 0, &record, sizeof(record));
 }
 
