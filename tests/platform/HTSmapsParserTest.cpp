@@ -8,7 +8,6 @@
 #include <algorithm>
 #include <cinttypes>
 #include <cstdio>
-#include <cstdlib>
 #include <fcntl.h>
 #include <set>
 #include <string>
@@ -20,24 +19,8 @@ namespace {
 constexpr uint64_t kPage = 4096;
 constexpr uint64_t kKiB = 1024;
 
-// Mappings captured from two real processes on x86-64 Linux 6.18: a probe
-// that laid out one mapping of every kind (the hugetlbfs ones come from a
-// second process, which puts them out of address order), plus two mappings
-// named with prctl(PR_SET_VMA_ANON_NAME) written in the kernel's format,
-// since the capturing kernel was built without named anonymous memory.
-std::vector<HTSmapsEntry> parsedCapture()
-{
-    HTProcBuffer file;
-    EXPECT_TRUE(file.readFile(AT_FDCWD, HEFT_TEST_DATA_DIR "/smaps-every-kind.txt"));
-    std::vector<HTSmapsEntry> entries;
-    EXPECT_EQ(htParseSmaps(file.view(), entries), 22u);
-    EXPECT_EQ(entries.size(), 22u);
-    return entries;
-}
-
-// A parsed maps line on one line: start-end, protection and sharing,
-// offset, device, inode, KernelPageSize/Rss/Shared_Clean in KiB, the
-// VmFlags bits, the path.
+// start-end, protection and sharing, offset, device, inode,
+// KernelPageSize/Rss/Shared_Clean in KiB, VmFlags bits, path.
 std::string describe(const HTSmapsEntry& e)
 {
     char text[160];
@@ -49,11 +32,7 @@ std::string describe(const HTSmapsEntry& e)
     return text;
 }
 
-// The region records the walk makes of a mapping: tag, share mode,
-// inheritance, external pager, protection/max, file offset, pages
-// resident/dirtied/copied/reusable/swapped, reference and wired counts;
-// then the basic record's sharing, inheritance, protection/max and wired
-// count.
+// The walk's region record of a mapping, then its basic record.
 std::string describeRecord(const HTSmapsEntry& e)
 {
     const vm_region_submap_info_64 i = htSubmapInfo(e, 4242, kPage);
@@ -71,63 +50,36 @@ std::string describeRecord(const HTSmapsEntry& e)
 
 }  // namespace
 
-TEST(HTSmapsParser, EveryKindOfMappingAndItsRegionRecord)
+TEST(HTSmapsParser, EveryKindOfMappingItsRecordsAndIdentities)
 {
-    // The capture holds, in this order: the program, its heap, a huge page
-    // of anonymous memory, MADV_DONTFORK, MADV_FREE and mlocked memory, a
-    // private file mapping with one page copied on write and the same file
-    // shared, System V, POSIX, memfd and MAP_SHARED anonymous memory, named
-    // anonymous memory private and shared, libc, a guard page, vvar, vdso,
-    // the stack, vsyscall, and hugetlbfs shared and private.
-    std::vector<HTSmapsEntry> entries = parsedCapture();
+    // Captured on Linux 6.18 (two named anonymous mappings written in the kernel's format), in order: the
+    // program, its heap, a huge page of anonymous memory, MADV_DONTFORK, MADV_FREE and mlocked memory, a private
+    // file mapping with a page copied on write and the same file shared, System V, POSIX, memfd and MAP_SHARED
+    // anonymous memory, named anonymous memory private and shared, libc, a guard page, vvar, vdso, the stack,
+    // vsyscall, then hugetlbfs shared and private from another process, out of address order.
+    HTProcBuffer file;
+    ASSERT_TRUE(file.readFile(AT_FDCWD, HEFT_TEST_DATA_DIR "/smaps-every-kind.txt"));
+    std::vector<HTSmapsEntry> entries;
+    EXPECT_EQ(htParseSmaps(file.view(), entries), 22u);
+    ASSERT_EQ(entries.size(), 22u);
     EXPECT_TRUE(std::is_sorted(entries.begin(), entries.end(),
                                [](const HTSmapsEntry& a, const HTSmapsEntry& b) { return a.start < b.start; }));
-    std::string text;
-    for (const HTSmapsEntry& entry : entries) text += describe(entry) + "\n    " + describeRecord(entry) + "\n";
-    expectReport("smaps-every-kind-records.txt", text);
-}
+    std::string report;
+    for (const HTSmapsEntry& entry : entries) report += describe(entry) + "\n    " + describeRecord(entry) + "\n";
+    expectReport("smaps-every-kind-records.txt", report);
 
-TEST(HTSmapsParser, ReusesRecordsAndSkipsWhatItCannotRead)
-{
-    std::vector<HTSmapsEntry> entries = parsedCapture();
-    // A second, shorter text: no record of the first survives in it.
-    constexpr std::string_view text = "not a maps line\n"
-                                      "Rss:                 99 kB\n"
-                                      "7f00-zz00 rw-p 00000000 00:00 0 \n"
-                                      "Rss:                 98 kB\n"
-                                      "1000-3000 rw-s 00002000 00:01 7    /memfd:x (deleted)\n"
-                                      "Rss:                  8 kB\n"
-                                      "Swap:\n"
-                                      "Private_Dirty:        4 kB\n"
-                                      "VmFlags: rd wr sh mr mw me lo";  // cut short: no final line feed
-    ASSERT_EQ(htParseSmaps(text, entries), 1u);
-    ASSERT_EQ(entries.size(), 1u);
-    EXPECT_EQ(describe(entries[0]), "1000-3000 3s 2000 0:1 7 0/8/0 1f /memfd:x (deleted)");
-    EXPECT_EQ(entries[0].swap, 0u);
-    EXPECT_EQ(entries[0].privateDirty, 4 * kKiB);
-    EXPECT_EQ(entries[0].kind, HTSmapsKind::SharedMemory);
-    EXPECT_EQ(htParseSmaps("", entries), 0u);
-    EXPECT_TRUE(entries.empty());
-}
-
-TEST(HTLinuxRegionInfo, ObjectIdentities)
-{
-    const std::vector<HTSmapsEntry> entries = parsedCapture();
     const HTSmapsEntry &heap = entries[1], &privateFile = entries[8];
-    // Files and shared memory (the file shared, System V, named shared
-    // memory) are named by (device, inode), top bit set: the same in every
-    // process and every mapping. Private anonymous memory is the process's
-    // own (top bits 01), one object a mapping.
-    for (const HTSmapsEntry* entry : {&privateFile, &entries[9], &entries[10], &entries[15]}) {
-        EXPECT_EQ(htRegionObjectId(*entry, 200), htRegionObjectId(*entry, 100)) << entry->path;
-        EXPECT_EQ(htRegionObjectId(*entry, 100) >> 63, 1u) << entry->path;
+    // Files and shared memory are named by (device, inode), top bit set: the same in every process and mapping.
+    // Private anonymous memory is the process's own (top bits 01), one object a mapping.
+    for (size_t shared : {8, 9, 10, 15}) {
+        EXPECT_EQ(htRegionObjectId(entries[shared], 200), htRegionObjectId(entries[shared], 100)) << shared;
+        EXPECT_EQ(htRegionObjectId(entries[shared], 100) >> 63, 1u) << shared;
     }
     EXPECT_EQ(htRegionObjectId(entries[9], 100), htRegionObjectId(privateFile, 100));
     EXPECT_NE(htRegionObjectId(heap, 100), htRegionObjectId(heap, 200));
     EXPECT_EQ(htRegionObjectId(heap, 100) >> 62, 1u);
 
-    // All distinct within one process (the two mappings of one file
-    // aside), never 0 nor all ones, and the 32-bit id is the low half.
+    // All distinct (the two mappings of one file aside), never 0 nor all ones; the 32-bit id is the low half.
     std::set<uint64_t> ids;
     for (const HTSmapsEntry& entry : entries) {
         vm_region_submap_info_64 info = htSubmapInfo(entry, 100, kPage);
@@ -144,4 +96,16 @@ TEST(HTLinuxRegionInfo, ObjectIdentities)
     nextStart.start += kPage;
     EXPECT_NE(htRegionObjectId(nextInode, 1), htRegionObjectId(privateFile, 1));
     EXPECT_NE(htRegionObjectId(nextStart, 100), htRegionObjectId(heap, 100));
+
+    // A second, shorter text, cut short without a final line feed: no record of the first survives.
+    ASSERT_TRUE(file.readFile(AT_FDCWD, HEFT_TEST_DATA_DIR "/smaps-unreadable-lines.txt"));
+    const std::string_view text = file.view().substr(0, file.size() - 1);
+    ASSERT_EQ(htParseSmaps(text, entries), 1u);
+    ASSERT_EQ(entries.size(), 1u);
+    EXPECT_EQ(describe(entries[0]), "1000-3000 3s 2000 0:1 7 0/8/0 1f /memfd:x (deleted)");
+    EXPECT_EQ(entries[0].swap, 0u);
+    EXPECT_EQ(entries[0].privateDirty, 4 * kKiB);
+    EXPECT_EQ(entries[0].kind, HTSmapsKind::SharedMemory);
+    EXPECT_EQ(htParseSmaps("", entries), 0u);
+    EXPECT_TRUE(entries.empty());
 }
