@@ -1,4 +1,5 @@
 #include "process/HTTargetSelection.h"
+#include "output/HTExpectedReport.h"
 #include "platform/fake/HTFakePlatform.h"
 
 #include <gtest/gtest.h>
@@ -6,7 +7,6 @@
 #include <iterator>
 #include <sstream>
 #include <string>
-#include <tuple>
 #include <vector>
 
 namespace {
@@ -71,40 +71,25 @@ TEST_F(HTTargetSelectionTest, SelectionUnderEachOption)
         platform_->process(pid)->dirtyFlags =
             PROC_DIRTY_TRACKED | PROC_DIRTY_ALLOWS_IDLE_EXIT | (pid == 203 ? PROC_DIRTY_IS_DIRTY : 0);
     }
-    // Operands, pids, exclusions, options (-a, -t, --unmapped, -s) and the
-    // selection.
-    const std::tuple<const char*, const char*, const char*, std::string, const char*> rows[] = {
-        // A name selects every process of that name; 100 is named twice.
-        {"worker 100 init", "", "", "", "100 201 203 1"},
-        // heft leaves itself out; exclusions that match nothing stay silent.
-        {"heft worker", "500", "201 helper nosuchthing", "", "501 100 203"},
-        {"", "500", "", "", ""},
-        // Descendants come after the exclusions, heft's own pid among them;
-        // an excluded target has none to add.
-        {"shell", "", "202", "t", "200 201 202 500 501 203"},
-        {"", "202", "helper", "t", ""},
-        // All but heft and the excluded; operands are not looked at.
-        {"nosuchthing", "1", "worker", "a", "0 1 200 202 501"},
-        {"", "", "", "a", "0 1 100 200 201 202 203 501"},
-        // The unmapped search adds, hidden, every other process but the
-        // kernel and the excluded.
-        {"", "201", "init", "u", "100! 200! 202! 203! 501! 201"},
-        {"worker shell", "", "", "s", "203 200"},
-        {"", "100 201", "", "s", ""},
-        {"", "", "", "", "error 8: Must specify at least one process or snapfile"},
-    };
-    for (const auto& [operands, pids, excluded, options, selected] : rows) {
+    const std::string name = "cli/selections";
+    std::istringstream lines(contentsOf(std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name + ".scenario"));
+    std::string said;
+    for (std::string text; std::getline(lines, text);) {
+        const HTScenarioLine line(text);
+        if (line.kind != "select") continue;
         HTTargetSelection::Request request;
-        request.potentialTargetProcesses = words(operands);
-        for (const std::string& pid : words(pids)) request.targetPids.set(std::stoi(pid), std::nullopt);
-        request.excludedPidsOrProcesses = words(excluded);
+        request.potentialTargetProcesses = words(line.text("operands").value_or(""));
+        for (const std::string& pid : words(line.text("pids").value_or("")))
+            request.targetPids.set(std::stoi(pid), std::nullopt);
+        request.excludedPidsOrProcesses = words(line.text("exclude").value_or(""));
+        const std::string options = line.text("options").value_or("");
         request.targetAll = options == "a";
         request.targetChildren = options == "t";
         request.searchForUnmapped = options == "u";
         request.skipIdleExitClean = options == "s";
-        EXPECT_EQ(select(request), selected) << operands << " / " << pids << " / " << excluded << " / " << options;
-        EXPECT_EQ(standardError_, "");
+        said += text + "\n  " + select(request) + "\n" + standardError_;
     }
+    expectReport(name + ".txt", said);
 
     // Names found stay with their pids, unless the pid was given too; -t
     // finds descendants by pid.
