@@ -1,7 +1,4 @@
-// Support for the tests that run the built heft on live processes: running a
-// program and capturing its streams, temporary directories and swap that
-// clean up after themselves, what the kernel itself says about a process's
-// memory, and reading heft's JSON report.
+// Running the built heft on live processes, the kernel's own figures for them, and reading heft's JSON report.
 
 #pragma once
 
@@ -12,12 +9,14 @@
 #include <sys/stat.h>
 #include <sys/swap.h>
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 #include <rapidjson/document.h>
 
+#include <algorithm>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <set>
 
 extern char** environ;
@@ -26,33 +25,31 @@ namespace heft_e2e {
 
 inline constexpr const char* kHeftBinary = HEFT_BINARY;
 inline constexpr const char* kSetpriv = "/usr/bin/setpriv";
-inline constexpr uid_t kNobody = 65534;
 inline constexpr uint64_t kMiB = 1024 * 1024;
 inline constexpr const char* kUntagged = "untagged (\"VM_ALLOCATE\")";
 
 inline std::string readFile(const std::string& path)
 {
-    std::ifstream file(path);
-    std::ostringstream contents;
-    contents << file.rdbuf();
-    return contents.str();
+    return {std::istreambuf_iterator<char>(std::ifstream(path).rdbuf()), std::istreambuf_iterator<char>()};
 }
 
 inline std::string n(uint64_t value) { return std::to_string(value); }
 
+MATCHER_P(HoldsOnce, text, "holds \"" + std::string(text) + "\" once")
+{
+    size_t first = arg.find(text);
+    return first != std::string::npos && arg.find(text, first + 1) == std::string::npos;
+}
+
 struct Outcome {
     int status = -1;  // the exit status, or -1 when the program did not exit normally
-    std::string standardOutput;
-    std::string standardError;
+    std::string standardOutput, standardError;
 };
 
-// Runs `program` with `arguments` (arguments[0] is the name it sees itself
-// called by), its streams captured in memory files, which unlike pipes never
-// fill up and stall it. A non-zero `openFiles` is its open-file limit, soft
-// and hard. An alarm, which survives exec, stops a run that hangs.
+// Runs `program` (called arguments[0]) with its streams in memory files, which unlike pipes never fill up and
+// stall it; a non-zero `openFiles` limits its open files. An alarm, which survives exec, stops a run that hangs.
 inline Outcome runProgram(const char* program, std::vector<std::string> arguments, rlim_t openFiles = 0)
 {
-    Outcome outcome;
     const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
     std::vector<char*> argv;
     for (auto& argument : arguments) argv.push_back(argument.data());
@@ -70,10 +67,10 @@ inline Outcome runProgram(const char* program, std::vector<std::string> argument
     }
     int status = 0;
     while (child > 0 && waitpid(child, &status, 0) < 0 && errno == EINTR) {}
-    outcome.status = child > 0 && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     EXPECT_FALSE(WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM) << arguments[0] << " hung";
-    outcome.standardOutput = readFile("/proc/self/fd/" + std::to_string(streams[0]));
-    outcome.standardError = readFile("/proc/self/fd/" + std::to_string(streams[1]));
+    Outcome outcome{child > 0 && WIFEXITED(status) ? WEXITSTATUS(status) : -1,
+                    readFile("/proc/self/fd/" + std::to_string(streams[0])),
+                    readFile("/proc/self/fd/" + std::to_string(streams[1]))};
     for (int fd : streams) close(fd);
     return outcome;
 }
@@ -84,22 +81,24 @@ inline Outcome runHeft(std::vector<std::string> arguments)
     return runProgram(kHeftBinary, std::move(arguments));
 }
 
-// Whether another user may run the program at `path`: every directory on
-// the way must be searchable by all and the file executable by all. A build
-// tree under a private temporary directory is not.
-inline bool everyoneMayRun(const std::string& path)
-{
-    struct stat info {};
-    for (size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1))
-        if (stat(path.substr(0, slash).c_str(), &info) != 0 || (info.st_mode & S_IXOTH) == 0) return false;
-    return stat(path.c_str(), &info) == 0 && (info.st_mode & S_IXOTH) != 0;
-}
-
-// heft run by the unprivileged user nobody.
 inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
 {
     arguments.insert(arguments.begin(), {"setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", kHeftBinary});
     return runProgram(kSetpriv, std::move(arguments));
+}
+
+// Why the user nobody cannot run heft and the layout program (every directory on the way searchable by all, which
+// one under a private temporary directory is not); empty when it can.
+inline std::string whyNobodyCannotRun()
+{
+    if (geteuid() != 0) return "running heft as another user needs root";
+    if (access(kSetpriv, X_OK) != 0) return std::string(kSetpriv) + " is needed to change the user";
+    struct stat info {};
+    for (const std::string path : {kHeftBinary, HEFT_LAYOUT_PROGRAM})
+        for (size_t end = 0; end != std::string::npos;)
+            if (stat(path.substr(0, end = path.find('/', end + 1)).c_str(), &info) != 0 || !(info.st_mode & S_IXOTH))
+                return "the user nobody may not run " + path;
+    return "";
 }
 
 // A directory under /tmp, removed with everything in it.
@@ -119,31 +118,27 @@ struct TempDir {
     std::string file(const char* name) const { return path + "/" + name; }
     size_t entries() const
     {
-        size_t count = 0;
-        for (const auto& entry : std::filesystem::directory_iterator(path)) count += entry.exists();
-        return count;
+        std::filesystem::directory_iterator listing(path);
+        return std::count_if(begin(listing), end(listing), [](const auto& entry) { return entry.exists(); });
     }
 
     std::string path;
 };
 
-// Swap for the tests that push pages out: the system's own when it has some
-// (/proc/swaps lists one after its heading), otherwise a 256 MiB swap file,
-// turned off and removed again with this object, also when the test fails.
-class SwapArea {
-public:
+// Swap for the tests that push pages out: the system's own (listed after the heading of /proc/swaps), otherwise a
+// 256 MiB swap file, turned off and removed with this object, also when the test fails.
+struct SwapArea {
     SwapArea()
     {
         std::string swaps = readFile("/proc/swaps");
-        available_ = swaps.find('\n') + 1 < swaps.size();
-        if (available_) return;
+        if ((available = swaps.find('\n') + 1 < swaps.size())) return;
         Outcome made = runProgram("/bin/sh",
                                   {"sh", "-ec",
                                    "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
                                    "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
         path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
-        enabled_ = available_ = made.status == 0;
-        reason_ = made.standardError;
+        enabled_ = available = made.status == 0;
+        reason = made.standardError;
     }
     ~SwapArea()
     {
@@ -152,12 +147,8 @@ public:
     }
     SwapArea(const SwapArea&) = delete;
 
-    bool available() const { return available_; }
-    const std::string& reason() const { return reason_; }
-
-private:
-    std::string path_, reason_;
-    bool enabled_ = false, available_ = false;
+    std::string path_, reason;
+    bool enabled_ = false, available = false;
 };
 
 // A "Name:  123 kB" field of a /proc file's text, in bytes; 0 when absent.
@@ -178,11 +169,8 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
     return end == std::string::npos ? std::string() : smaps.substr(start, end - start);
 }
 
-// What the kernel charges `pid` that it cannot take back: the written and
-// swapped pages of its mappings, and its page tables. `proportionally`
-// divides each page among the processes that map it, so that summed over a
-// set of processes each page counts once. A non-zero `thread` is read
-// instead of the main thread (whose files read empty once it has exited).
+// What the kernel charges `pid` that it cannot take back: written and swapped pages, page tables; each page divided
+// among the processes that map it when `proportionally`. Read through `thread` if any (the main one has exited).
 inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
     std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
@@ -219,32 +207,6 @@ inline uint64_t number(const rapidjson::Value* object, const char* key)
     return found && found->IsUint64() ? found->GetUint64() : 0;
 }
 
-inline auto arrayIn(const rapidjson::Value& object, const char* key)
-{
-    static const rapidjson::Value empty(rapidjson::kArrayType);
-    const rapidjson::Value* array = member(&object, key);
-    return (array && array->IsArray() ? *array : empty).GetArray();
-}
-
-inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t pid)
-{
-    for (const auto& process : arrayIn(report, "processes"))
-        if (number(&process, "pid") == static_cast<uint64_t>(pid)) return &process;
-    return nullptr;
-}
-
-// The region of `process` (listed with -v) that holds `address`.
-inline const rapidjson::Value* regionAt(const rapidjson::Value* process, uint64_t address)
-{
-    static const rapidjson::Value none;
-    for (const auto& region : arrayIn(process ? *process : none, "regions")) {
-        uint64_t start = number(&region, "addr");
-        if (start <= address && address < start + number(&region, "vsize")) return &region;
-    }
-    ADD_FAILURE() << "no region holds " << std::hex << address;
-    return nullptr;
-}
-
 inline std::string nameOf(const rapidjson::Value* object)
 {
     const rapidjson::Value* name = member(object, "name");
@@ -257,25 +219,47 @@ inline uint64_t figure(const rapidjson::Value* owner, const std::string& categor
     return number(member(member(owner, "categories"), category), key);
 }
 
+inline auto arrayIn(const rapidjson::Value* object, const char* key)
+{
+    static const rapidjson::Value empty(rapidjson::kArrayType);
+    const rapidjson::Value* array = member(object, key);
+    return (array && array->IsArray() ? *array : empty).GetArray();
+}
+
+inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t pid)
+{
+    for (const auto& process : arrayIn(&report, "processes"))
+        if (number(&process, "pid") == static_cast<uint64_t>(pid)) return &process;
+    return nullptr;
+}
+
+// The region of `process` (listed with -v) that holds `address`.
+inline const rapidjson::Value* regionAt(const rapidjson::Value* process, uint64_t address)
+{
+    for (const auto& region : arrayIn(process, "regions"))
+        if (uint64_t start = number(&region, "addr"); start <= address && address < start + number(&region, "vsize"))
+            return &region;
+    ADD_FAILURE() << "no region holds " << std::hex << address;
+    return nullptr;
+}
+
 inline std::set<int> pidsOf(const rapidjson::Value& shared)
 {
     std::set<int> pids;
-    for (const auto& pid : arrayIn(shared, "pids")) pids.insert(pid.GetInt());
+    for (const auto& pid : arrayIn(&shared, "pids")) pids.insert(pid.GetInt());
     return pids;
 }
 
 // The table common to exactly `pids`; null when there is none.
 inline const rapidjson::Value* sharedBy(const rapidjson::Value& report, const std::set<int>& pids)
 {
-    for (const auto& shared : arrayIn(report, "shared"))
+    for (const auto& shared : arrayIn(&report, "shared"))
         if (!shared.HasMember("specific_to_pid") && pidsOf(shared) == pids) return &shared;
     return nullptr;
 }
 
-// A process's heft against the kernel's count of what cannot be taken back
-// from it, read right after heft ran while the process sat still: anonymous
-// memory of a blocked process stays as it is, so the two agree exactly, but
-// writeback may clean up to `cleanedSince` of dirty file pages in between.
+// A process's heft against the kernel's figure read right after: a blocked process's anonymous memory stays as it
+// is, so the two agree exactly, but writeback may clean up to `cleanedSince` of dirty file pages in between.
 inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0,
                                     pid_t thread = 0)
 {
@@ -287,20 +271,25 @@ class HTE2EReportTest : public testing::Test {
 protected:
     void SetUp() override { ASSERT_FALSE(directory_.path.empty()) << "mkdtemp: " << std::strerror(errno); }
 
-    // Runs heft for the text report, every region and figure in bytes, and
-    // for the JSON report, parsed into `report`.
-    Outcome runForReport(std::vector<std::string> arguments, rapidjson::Document& report)
+    // Starts child_ with `directives`, then runs heft with `arguments` and the child's pid for the text report
+    // (text_), every region and figure in bytes, and the JSON report (report_); false if either fails.
+    bool layOutAndMeasure(std::vector<std::string> directives, std::vector<std::string> arguments = {})
     {
+        child_.emplace(std::move(directives));
+        if (!child_->ready()) return false;
         std::string path = directory_.file("report.json");
         unlink(path.c_str());
         arguments.insert(arguments.begin(), {"-v", "-w", "-f", "bytes", "-j", path});
-        Outcome outcome = runHeft(arguments);
-        EXPECT_EQ(outcome.status, 0) << outcome.standardError;
-        loadReport(path, report);
-        return outcome;
+        arguments.push_back(child_->pidString());
+        text_ = runHeft(arguments);
+        EXPECT_EQ(text_.status, 0) << text_.standardError;
+        return loadReport(path, report_);
     }
 
     TempDir directory_;
+    std::optional<HTLayoutChild> child_;
+    rapidjson::Document report_;
+    Outcome text_;
 };
 
 }  // namespace heft_e2e
