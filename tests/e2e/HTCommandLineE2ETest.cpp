@@ -19,9 +19,7 @@ struct Run {
 void expectRuns(const std::vector<Run>& runs, Outcome (*run)(std::vector<std::string>))
 {
     for (const Run& expected : runs) {
-        std::string command;
-        for (const auto& argument : expected.arguments) command += " " + argument;
-        SCOPED_TRACE("heft" + command);
+        SCOPED_TRACE(testing::PrintToString(expected.arguments));
         Outcome outcome = run(expected.arguments);
         EXPECT_EQ(outcome.status, expected.status);
         EXPECT_THAT(outcome.standardError, expected.standardError);
@@ -34,9 +32,7 @@ TEST(HTCommandLineE2ETest, RunsThatEndBeforeTheAnalysisPrintTheirMessages)
     // The parser's messages go to standard error, the usage after them (in full, so that any change shows); the
     // option parser's own are the C library's, one line naming heft and the option.
     const std::string usage = readFile(std::filesystem::path(__FILE__).parent_path() / "../data/usage.txt");
-    const auto complaint = [](const char* option) {
-        return AllOf(StartsWith("heft: "), HasSubstr(option), HoldsOnce("\n"));
-    };
+    auto complaint = [](const char* option) { return AllOf(StartsWith("heft: "), HasSubstr(option), HoldsOnce("\n")); };
     const auto noTarget = AllOf(StartsWith("WARNING: "), EndsWith("Must specify at least one process or snapfile\n"));
     const std::string noSuchProcess = "Unable to find pid for process matching 'heft-e2e-no-such-process'\n";
     expectRuns({{{"-h"}, 0, "", usage},

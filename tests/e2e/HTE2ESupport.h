@@ -19,8 +19,6 @@
 #include <optional>
 #include <set>
 
-extern char** environ;
-
 namespace heft_e2e {
 
 inline constexpr const char* kHeftBinary = HEFT_BINARY;
@@ -46,14 +44,13 @@ struct Outcome {
     std::string standardOutput, standardError;
 };
 
-// Runs `program` (called arguments[0]) with its streams in memory files, which unlike pipes never fill up and
-// stall it; a non-zero `openFiles` limits its open files. An alarm, which survives exec, stops a run that hangs.
+// Runs `program` as arguments[0], its streams in memory files (which never fill up as pipes do), its open files
+// limited to a non-zero `openFiles`, and stopped by an alarm (which survives exec) if it hangs.
 inline Outcome runProgram(const char* program, std::vector<std::string> arguments, rlim_t openFiles = 0)
 {
     const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
-    std::vector<char*> argv;
-    for (auto& argument : arguments) argv.push_back(argument.data());
-    argv.push_back(nullptr);
+    std::vector<char*> argv(arguments.size() + 1);
+    std::ranges::transform(arguments, argv.begin(), [](auto& argument) { return argument.data(); });
     pid_t child = fork();
     if (child == 0) {
         dup2(streams[0], STDOUT_FILENO);
@@ -62,7 +59,7 @@ inline Outcome runProgram(const char* program, std::vector<std::string> argument
         close_range(3, ~0U, 0);
         if (openFiles != 0 && setrlimit(RLIMIT_NOFILE, &files) != 0) _exit(126);
         alarm(180);
-        execve(program, argv.data(), environ);
+        execv(program, argv.data());
         _exit(127);
     }
     int status = 0;
@@ -103,17 +100,9 @@ inline std::string whyNobodyCannotRun()
 
 // A directory under /tmp, removed with everything in it.
 struct TempDir {
-    TempDir()
-    {
-        char pattern[] = "/tmp/heft-e2e-XXXXXX";
-        if (mkdtemp(pattern) != nullptr) path = pattern;
-    }
-    ~TempDir()
-    {
-        std::error_code ignored;
-        if (!path.empty()) std::filesystem::remove_all(path, ignored);
-    }
+    TempDir() = default;
     TempDir(const TempDir&) = delete;
+    ~TempDir() { std::filesystem::remove_all(path, ignored); }
 
     std::string file(const char* name) const { return path + "/" + name; }
     size_t entries() const
@@ -122,7 +111,8 @@ struct TempDir {
         return std::count_if(begin(listing), end(listing), [](const auto& entry) { return entry.exists(); });
     }
 
-    std::string path;
+    std::string pattern = "/tmp/heft-e2e-XXXXXX", path = mkdtemp(pattern.data()) ? pattern : "";
+    std::error_code ignored;
 };
 
 // Swap for the tests that push pages out: the system's own (listed after the heading of /proc/swaps), otherwise a
@@ -145,7 +135,6 @@ struct SwapArea {
         if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << strerror(errno);
         if (!path_.empty()) unlink(path_.c_str());
     }
-    SwapArea(const SwapArea&) = delete;
 
     std::string path_, reason;
     bool enabled_ = false, available = false;
@@ -174,8 +163,7 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
 inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
     std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
-    std::string rollup = readFile(base + "/smaps_rollup");
-    std::string status = readFile(base + "/status");
+    std::string rollup = readFile(base + "/smaps_rollup"), status = readFile(base + "/status");
     EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;
     uint64_t pages = proportionally
         ? kernelField(rollup, "Pss_Dirty") + kernelField(rollup, "SwapPss")
@@ -188,35 +176,30 @@ inline bool between(uint64_t value, uint64_t least, uint64_t most) { return leas
 inline bool loadReport(const std::string& path, rapidjson::Document& document)
 {
     std::string text = readFile(path);
-    document.Parse(text.c_str());
-    if (!document.HasParseError() && document.IsObject()) return true;
-    ADD_FAILURE() << "no JSON report at " << path << ": " << text.substr(0, 200);
-    return false;
+    const bool loaded = !document.Parse(text.c_str()).HasParseError() && document.IsObject();
+    EXPECT_TRUE(loaded) << "no JSON report at " << path << ": " << text.substr(0, 200);
+    return loaded;
 }
 
-inline const rapidjson::Value* member(const rapidjson::Value* object, const std::string& key)
+inline const rapidjson::Value* member(const rapidjson::Value* object, const char* key)
 {
-    if (object == nullptr || !object->IsObject()) return nullptr;
-    auto found = object->FindMember(key.c_str());
-    return found == object->MemberEnd() ? nullptr : &found->value;
+    return object && object->IsObject() && object->HasMember(key) ? &(*object)[key] : nullptr;
 }
 
 inline uint64_t number(const rapidjson::Value* object, const char* key)
 {
-    const rapidjson::Value* found = member(object, key);
-    return found && found->IsUint64() ? found->GetUint64() : 0;
+    return member(object, key) && member(object, key)->IsUint64() ? member(object, key)->GetUint64() : 0;
 }
 
 inline std::string nameOf(const rapidjson::Value* object)
 {
-    const rapidjson::Value* name = member(object, "name");
-    return name && name->IsString() ? name->GetString() : "";
+    return member(object, "name") && member(object, "name")->IsString() ? member(object, "name")->GetString() : "";
 }
 
 // A figure of a category of a process's own memory or a shared table.
 inline uint64_t figure(const rapidjson::Value* owner, const std::string& category, const char* key)
 {
-    return number(member(member(owner, "categories"), category), key);
+    return number(member(member(owner, "categories"), category.c_str()), key);
 }
 
 inline auto arrayIn(const rapidjson::Value* object, const char* key)

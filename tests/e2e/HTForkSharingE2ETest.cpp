@@ -7,9 +7,11 @@
 namespace {
 
 using namespace heft_e2e;
+using testing::HasSubstr, testing::Not;
 
 constexpr const char* kUnidentifiedNotice =
     "Memory shared after fork may be counted more than once: telling its pages apart needs root\n";
+constexpr const char* kNeedsRoot = "telling pages shared after a fork apart needs the page frames (root)";
 constexpr uint64_t kFileSize = 8 * kMiB;
 // What a table may hold besides the layout: pages the C library and the allocator write.
 constexpr uint64_t kSlack = 128 * 1024;
@@ -17,7 +19,7 @@ constexpr uint64_t kSlack = 128 * 1024;
 // A parent writes `shared` bytes, lays out `extra` (directive 1) and forks children: child i overwrites slice i
 // and writes `own` bytes. Then the parent writes `after` bytes.
 struct Family {
-    uint64_t shared = 64 * kMiB, children = 4, slice = kMiB, own = 8 * kMiB, after = 16 * kMiB;
+    uint64_t shared = 4 * kMiB, children = 4, slice = 64 * 1024, own = kMiB, after = kMiB;
     std::vector<std::string> extra;
 
     std::vector<std::string> directives() const
@@ -48,12 +50,6 @@ uint64_t ownDirtyBesidesPageTables(const rapidjson::Value* process)
 
 class HTForkSharingE2ETest : public HTE2EReportTest {
 protected:
-    void SetUp() override
-    {
-        if (geteuid() != 0) GTEST_SKIP() << "telling pages shared after a fork apart needs the page frames (root)";
-        HTE2EReportTest::SetUp();
-    }
-
     void measureFamily(const Family& layout)
     {
         ASSERT_TRUE(layOutAndMeasure(layout.directives(), {"-t"}));
@@ -63,7 +59,7 @@ protected:
 
     const rapidjson::Value* summary(const std::string& category)
     {
-        return member(member(&report_, "summary"), category);
+        return member(member(&report_, "summary"), category.c_str());
     }
 
     std::set<int> members_;
@@ -71,8 +67,9 @@ protected:
 
 TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProcessesThatMapIt)
 {
+    if (geteuid() != 0) GTEST_SKIP() << kNeedsRoot;
     SwapArea swap;  // without one the paged-out pages stay in memory, dirty
-    const Family layout{.extra = {"pageout", n(16 * kMiB)}};
+    const Family layout{64 * kMiB, 4, kMiB, 8 * kMiB, 16 * kMiB, {"pageout", n(16 * kMiB)}};
     ASSERT_NO_FATAL_FAILURE(measureFamily(layout));
     const pid_t parent = child_->pid();
 
@@ -83,8 +80,8 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
     const uint64_t total = number(summary("total"), "dirty");
     EXPECT_NEAR(static_cast<double>(total), static_cast<double>(kernel), static_cast<double>(kernel) / 100);
     for (int pid : members_) expectHeftMatchesKernel(report_, pid);
-    EXPECT_THAT(text_.standardOutput, testing::HasSubstr("\nSummary Heft: " + n(total) + " B\n"));
-    EXPECT_THAT(text_.standardError, testing::Not(testing::HasSubstr(kUnidentifiedNotice)));  // root tells them apart
+    EXPECT_THAT(text_.standardOutput, HasSubstr("\nSummary Heft: " + n(total) + " B\n"));
+    EXPECT_THAT(text_.standardError, Not(HasSubstr(kUnidentifiedNotice)));  // root tells them apart
 
     // Untouched by the children, the shared and swapped mappings are the five's; the slice a child wrote is its own
     // copy, the parent's original the other four's. Dirty figures include swap.
@@ -113,6 +110,7 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
 
 TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePagesOnce)
 {
+    if (geteuid() != 0) GTEST_SKIP() << kNeedsRoot;
     // Written: the parent's copies of the first half, which the children inherit, and the file's pages of the second,
     // dirty or written back. Read: no copies, so fork leaves the child's page tables empty; the parent has two runs.
     for (const auto& [read, writtenBack] : {std::pair{false, true}, std::pair{false, false}, std::pair{true, true}}) {
@@ -122,17 +120,11 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePage
         // does not copy.
         int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
         ASSERT_GE(fd, 0) << std::strerror(errno);
-        const std::string block(kMiB, '\x5a');
         for (uint64_t written = 0; written < kFileSize; written += kMiB)
-            ASSERT_EQ(write(fd, block.data(), kMiB), static_cast<ssize_t>(kMiB));
+            ASSERT_EQ(write(fd, std::string(kMiB, 'Z').data(), kMiB), static_cast<ssize_t>(kMiB));
         EXPECT_TRUE(!writtenBack || fsync(fd) == 0) << std::strerror(errno);
         close(fd);
-        const Family layout{.shared = 4 * kMiB,
-                            .children = read ? 1u : 4u,
-                            .slice = 64 * 1024,
-                            .own = kMiB,
-                            .after = kMiB,
-                            .extra = {"private", path, read ? "read" : "written"}};
+        const Family layout{.children = read ? 1u : 4u, .extra = {"private", path, read ? "read" : "written"}};
         ASSERT_NO_FATAL_FAILURE(measureFamily(layout));
         const pid_t parent = child_->pid();
         const std::string category = "mapped file " + path;
@@ -146,17 +138,15 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePage
             for (int pid : members_) expectHeftMatchesKernel(report_, pid, writtenBack ? 0 : kFileSize / 2);
             continue;
         }
-        const pid_t child = *members_.begin() == parent ? *members_.rbegin() : *members_.begin();
+        const auto child = static_cast<pid_t>(child_->value(2));
         uint64_t resident = kernelField(mappingAt(parent, child_->value(1)), "Rss");
         EXPECT_GE(resident, kFileSize / 2);
         EXPECT_EQ(kernelField(mappingAt(child, child_->value(1)), "Rss"), 0u);
         // The parent sees the pages in its own table and the ones it shares.
         uint64_t parentClean = figure(processIn(report_, parent), category, "clean");
-        for (const auto& shared : arrayIn(&report_, "shared")) {
-            bool mine = shared.HasMember("specific_to_pid") ? shared["specific_to_pid"].GetInt() == parent
-                                                            : pidsOf(shared).count(parent) != 0;
-            if (mine) parentClean += figure(&shared, category, "clean");
-        }
+        for (const auto& table : arrayIn(&report_, "shared"))
+            if (table.HasMember("specific_to_pid") ? table["specific_to_pid"] == parent : pidsOf(table).count(parent))
+                parentClean += figure(&table, category, "clean");
         EXPECT_GE(parentClean, resident);
         EXPECT_PRED3(between, clean, parentClean, kFileSize);
     }
@@ -166,7 +156,7 @@ TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceTh
 {
     if (std::string why = whyNobodyCannotRun(); !why.empty()) GTEST_SKIP() << why;
     ASSERT_EQ(chmod(directory_.path.c_str(), 0777), 0);
-    const Family layout{.shared = 4 * kMiB, .children = 3, .slice = 64 * 1024, .own = kMiB, .after = kMiB, .extra = {}};
+    const Family layout{.children = 3};
     HTLayoutChild family(layout.directives(), 65534);  // nobody
     ASSERT_TRUE(family.ready());
     const std::string path = directory_.file("nobody.json");

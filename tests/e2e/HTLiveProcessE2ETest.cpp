@@ -5,6 +5,7 @@
 namespace {
 
 using namespace heft_e2e;
+using testing::HasSubstr, testing::Not;
 
 using HTLiveProcessE2ETest = HTE2EReportTest;
 
@@ -49,9 +50,8 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     EXPECT_GE(figure(process, kUntagged, "dirty"), (locked ? 84 : 80) * kMiB);
     EXPECT_GE(figure(process, kUntagged, "swapped"), swapped);
     EXPECT_GE(figure(process, kUntagged, "regions"), 4u);
-    EXPECT_THAT(
-        text_.standardOutput,
-        testing::HasSubstr(" [" + child.pidString() + "]: 64-bit\tHeft: " + n(number(process, "heft")) + " B ("));
+    EXPECT_THAT(text_.standardOutput,
+                HasSubstr(" [" + child.pidString() + "]: 64-bit\tHeft: " + n(number(process, "heft")) + " B ("));
     if (!locked) GTEST_SKIP() << "mlock: " << std::strerror(static_cast<int>(child.value(2, 1))) << "; not checked";
     if (!pagedOut) GTEST_SKIP() << "no swap (" << swap.reason << ") or MADV_PAGEOUT failed; swap not checked";
 }
@@ -78,7 +78,7 @@ TEST_F(HTLiveProcessE2ETest, SegmentSharedByTwoProcessesCountsOnce)
         EXPECT_EQ(number(regionAt(process, child->value(0)), "dirty"), kSize);
         hefts += number(process, "heft");
         EXPECT_THAT(text_.standardOutput,
-                    testing::HasSubstr("Shared with " + nameOf(process) + " [" + child->pidString() + "]:\n"));
+                    HasSubstr("Shared with " + nameOf(process) + " [" + child->pidString() + "]:\n"));
     }
     // The segment is whole in exactly one shared table, the two's; the summary is the two hefts less one copy of it.
     int tables = 0;
@@ -140,7 +140,7 @@ TEST_F(HTLiveProcessE2ETest, ManyProcessesUnderALowOpenFileLimit)
     for (uint64_t pid : family.line(1)) arguments.push_back(n(pid));
     Outcome outcome = runProgram(kHeftBinary, arguments, 64);
     EXPECT_EQ(outcome.status, 0) << outcome.standardError;
-    EXPECT_THAT(outcome.standardError, testing::Not(testing::HasSubstr("open files")));
+    EXPECT_THAT(outcome.standardError, Not(HasSubstr("open files")));
     ASSERT_TRUE(loadReport(directory_.file("many.json"), report_));
     EXPECT_EQ(arrayIn(&report_, "processes").Size(), kChildren + 1u);
     for (const auto& process : arrayIn(&report_, "processes"))
@@ -159,7 +159,7 @@ TEST_F(HTLiveProcessE2ETest, ProcessesExitingDuringTheRunLeaveAWholeReport)
         // Not the test itself, which built with a sanitizer reserves terabytes of shadow memory.
         Outcome outcome = runHeft({"-a", "-x", n(getpid()), "-j", path});
         EXPECT_EQ(outcome.status, 0) << outcome.standardError;
-        EXPECT_THAT(outcome.standardOutput, testing::HasSubstr("\nSummary Heft: "));
+        EXPECT_THAT(outcome.standardOutput, HasSubstr("\nSummary Heft: "));
         EXPECT_TRUE(loadReport(path, report_) && report_.HasMember("total heft"));
         EXPECT_GT(arrayIn(&report_, "processes").Size(), 1u);
     }

@@ -10,6 +10,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
 #include <iterator>
@@ -32,9 +33,8 @@ public:
             return fd >= 0 && fsync(fd) == 0 ? close(fd) : -1;
         }();
         directives.insert(directives.begin(), "heft-layout");
-        std::vector<char*> argv;
-        for (auto& directive : directives) argv.push_back(directive.data());
-        argv.push_back(nullptr);
+        std::vector<char*> argv(directives.size() + 1);
+        std::ranges::transform(directives, argv.begin(), [](auto& directive) { return directive.data(); });
         int ready[2];
         if (pipe2(ready, O_CLOEXEC) != 0) return;
         if ((pid_ = fork()) == 0) {

@@ -1,21 +1,19 @@
 /* The layout program: a real process with known memory for the tests, plain C
  * built without sanitizers, whose shadow memory would blur it. Each directive
- * prints a line of numbers; then it prints "ready" and waits as laid out until
- * killed, all it started in its process group. Anonymous memory lies between
- * two inaccessible pages, one mapping of exactly SIZE. A failed call exits 3.
+ * prints a line of numbers; then "ready", and it waits as laid out until killed,
+ * with all it started in its process group. A failed call exits with status 3.
  *
- *   anon|free|lock|pageout SIZE  written private anonymous memory, then left as
- *                      it is, MADV_FREE'd, mlocked or pushed to swap: ADDRESS ERRNO
- *   file PATH SIZE N   PATH mapped shared, its first N bytes written: ADDRESS
- *   private PATH written|read   PATH mapped privately (see below): ADDRESS
- *   mappings COUNT     COUNT one-page mappings that cannot merge: ADDRESS
- *   fork COUNT SLICE OWN   COUNT children; child i writes slice i from the end of
- *                      the first directive's memory and OWN bytes: pids, once ready
- *   tree               a child with two, the first with one: FIRST SECOND GRANDCHILD
- *   churn              children that write memory and exit, for ever: 0
- *   exit               exits at once, with status 0
- *   exit-main          the main thread exits; a worker thread prints its id once
- *                      the main thread is a zombie */
+ *   anon|free|lock|pageout SIZE  written private anonymous memory between two
+ *       inaccessible pages, left so, MADV_FREE'd, mlocked or paged out: ADDRESS ERRNO
+ *   file PATH SIZE N    PATH mapped shared, its first N bytes written: ADDRESS
+ *   private PATH written|read    PATH mapped privately (see below): ADDRESS
+ *   mappings COUNT      COUNT one-page mappings that cannot merge: ADDRESS
+ *   fork COUNT SLICE OWN   children, child i writing slice i from the end of the
+ *       first directive's memory and OWN bytes of its own: their pids, once ready
+ *   tree                a child with two, the first with one: FIRST SECOND GRANDCHILD
+ *   churn               children that write memory and exit, for ever: 0
+ *   exit                exits at once, with status 0
+ *   exit-main           the main thread exits; a worker prints its id once it is a zombie */
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
@@ -41,14 +39,11 @@ static void need(int ok, const char* what)
     if (!ok) perror(what), exit(3);
 }
 
-/* Writes or reads a byte of every page. */
+/* Writes, or reads, a byte of every page. */
 static void touch(char* start, size_t size, int write)
 {
-    for (size_t offset = 0; offset < size; offset += page)
-        if (write)
-            start[offset] = (char)(1 + (offset / page) % 255);
-        else
-            (void)*(volatile const char*)(start + offset);
+    for (size_t at = 0; at < size; at += page)
+        write ? (void)(start[at] = (char)(1 + (at / page) % 255)) : (void)*(volatile const char*)(start + at);
 }
 
 static char* mapWritten(size_t size)
@@ -146,8 +141,8 @@ static void* worker(void* unused)
     return unused;
 }
 
-/* Whether argv[i] is the directive `name` and has its `count` arguments; its argument `k` as a number. */
-#define IS(name, count) (strcmp(argv[i], name) == 0 && i + (count) < argc)
+/* Whether argv[i] is the directive `name` with its `count` arguments, to be skipped; its argument `k`. */
+#define IS(name, count) (strcmp(argv[i], name) == 0 && i + (count) < argc && (skip = (count), 1))
 #define NUMBER(k) ((size_t)strtoull(argv[i + (k)], NULL, 10))
 
 int main(int argc, char** argv)
@@ -157,7 +152,7 @@ int main(int argc, char** argv)
     setpgid(0, 0);
     char* first = NULL;
     size_t firstSize = 0;
-    for (int i = 1; i < argc; ++i) {
+    for (int i = 1, skip = 0; i < argc; i += 1 + skip, skip = 0) {
         char* pages = NULL;
         size_t size = 0;
         if (IS("anon", 1) || IS("free", 1) || IS("lock", 1) || IS("pageout", 1)) {
@@ -167,7 +162,6 @@ int main(int argc, char** argv)
             if (IS("lock", 1)) error = mlock(pages, size);
             if (IS("pageout", 1)) error = madvise(pages, size, MADV_PAGEOUT);
             printf("%lu %d\n", (unsigned long)pages, error ? errno : 0);
-            i += 1;
         } else if (IS("file", 3) || IS("private", 2)) {
             /* A private mapping covers the whole file: "written" writes its first half and reads the rest,
              * "read" maps it read-only and reads its first and third quarter. */
@@ -183,7 +177,6 @@ int main(int argc, char** argv)
             touch(pages, shared ? NUMBER(3) : writable ? 2 * quarter : quarter, writable);
             if (!shared) touch(pages + 2 * quarter, writable ? size - 2 * quarter : quarter, 0);
             printf("%lu\n", (unsigned long)pages);
-            i += shared ? 3 : 2;
         } else if (IS("mappings", 1)) {
             /* Every other page inaccessible: no two mappings can merge. */
             pages = mmap(NULL, 2 * NUMBER(1) * page, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
@@ -191,10 +184,8 @@ int main(int argc, char** argv)
             for (size_t m = 0; m < NUMBER(1); ++m)
                 need(mprotect(pages + 2 * m * page, page, PROT_READ) == 0, "mprotect");
             printf("%lu\n", (unsigned long)pages);
-            i += 1;
         } else if (IS("fork", 3) && first != NULL) {
             forkFamily((int)NUMBER(1), NUMBER(2), NUMBER(3), first, firstSize);
-            i += 3;
         } else if (IS("tree", 0)) {
             tree();
         } else if (IS("churn", 0)) {
@@ -204,7 +195,6 @@ int main(int argc, char** argv)
         } else if (IS("exit", 0)) {
             return 0;
         } else if (IS("exit-main", 0)) {
-            fflush(stdout);
             pthread_t thread;
             need(pthread_create(&thread, NULL, worker, NULL) == 0, "pthread_create");
             pthread_exit(NULL);
