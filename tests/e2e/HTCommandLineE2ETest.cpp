@@ -29,8 +29,7 @@ void expectRuns(const std::vector<Run>& runs, Outcome (*run)(std::vector<std::st
 
 TEST(HTCommandLineE2ETest, RunsThatEndBeforeTheAnalysisPrintTheirMessages)
 {
-    // The parser's messages go to standard error, the usage after them (in full, so that any change shows); the
-    // option parser's own are the C library's, one line naming heft and the option.
+    // Messages on standard error, the usage in full after them; the C library's name heft and the option in a line.
     const std::string usage = readFile(std::filesystem::path(__FILE__).parent_path() / "../data/usage.txt");
     auto complaint = [](const char* option) { return AllOf(StartsWith("heft: "), HasSubstr(option), HoldsOnce("\n")); };
     const auto noTarget = AllOf(StartsWith("WARNING: "), EndsWith("Must specify at least one process or snapfile\n"));
@@ -49,8 +48,7 @@ TEST(HTCommandLineE2ETest, RunsThatEndBeforeTheAnalysisPrintTheirMessages)
 TEST(HTCommandLineE2ETest, UnprivilegedRunsNeedingRootStop)
 {
     if (std::string why = whyNobodyCannotRun(); !why.empty()) GTEST_SKIP() << why;
-    // A process heft may not read is reported by pid, and the reason follows when it tried to open it. The notice
-    // comes from parsing, before the privileges are checked.
+    // An unreadable process is named by pid, with the reason if heft tried it; the notice comes before the check.
     const std::string unread = "Unable to analyze process with pid 1 (try as root?)\n", root = "Must run as root.\n";
     const auto unopened = AllOf(StartsWith(unread), HasSubstr(" [1]: could not be opened: "), EndsWith(kNoProcesses));
     expectRuns({{{"-a"}, 1, root, ""},
@@ -71,8 +69,7 @@ TEST(HTCommandLineE2ETest, SelectingALiveProcessReportsItOnceEscapesItsNameAndWr
     HTLayoutChild child({}, HTLayoutChild::kSameUser, directory.path + "/" + name);  // lays out nothing, and waits
     ASSERT_TRUE(child.ready());
     const std::string pid = child.pidString();
-    // Reported once however often it was named; the header stays one line, and paths come from the kernel with
-    // the line feed written as "\012".
+    // Reported once however often named, its header one line; the kernel writes a line feed in a path as "\012".
     const auto reportedOnce = HoldsOnce(" [" + pid + "]: 64-bit\tHeft: ");
     const auto escaped = AllOf(reportedOnce, Not(HasSubstr("\x1B")), HasSubstr("__TEXT .../evil\\012\\t\\x1B[7mname\n"),
                                HasSubstr("evil\\n\\t\\x1B[7mname [" + pid + "]: 64-bit\tHeft: "));

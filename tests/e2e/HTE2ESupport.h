@@ -44,8 +44,7 @@ struct Outcome {
     std::string standardOutput, standardError;
 };
 
-// Runs `program` as arguments[0], its streams in memory files (which never fill up as pipes do), its open files
-// limited to a non-zero `openFiles`, and stopped by an alarm (which survives exec) if it hangs.
+// Runs `program`, output to memory files (which never stall it as pipes may), stopped by an alarm if it hangs.
 inline Outcome runProgram(const char* program, std::vector<std::string> arguments, rlim_t openFiles = 0)
 {
     const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
@@ -84,8 +83,7 @@ inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
     return runProgram(kSetpriv, std::move(arguments));
 }
 
-// Why the user nobody cannot run heft and the layout program (every directory on the way searchable by all, which
-// one under a private temporary directory is not); empty when it can.
+// Why the user nobody may not run heft and the layout program (as under a private directory); empty if it may.
 inline std::string whyNobodyCannotRun()
 {
     if (geteuid() != 0) return "running heft as another user needs root";
@@ -105,18 +103,13 @@ struct TempDir {
     ~TempDir() { std::filesystem::remove_all(path, ignored); }
 
     std::string file(const char* name) const { return path + "/" + name; }
-    size_t entries() const
-    {
-        std::filesystem::directory_iterator listing(path);
-        return std::count_if(begin(listing), end(listing), [](const auto& entry) { return entry.exists(); });
-    }
+    size_t entries() const { return std::distance(std::filesystem::directory_iterator(path), {}); }
 
     std::string pattern = "/tmp/heft-e2e-XXXXXX", path = mkdtemp(pattern.data()) ? pattern : "";
     std::error_code ignored;
 };
 
-// Swap for the tests that push pages out: the system's own (listed after the heading of /proc/swaps), otherwise a
-// 256 MiB swap file, turned off and removed with this object, also when the test fails.
+// The system's swap if any (listed after the heading of /proc/swaps), else a swap file that goes with this object.
 struct SwapArea {
     SwapArea()
     {
@@ -158,8 +151,8 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
     return end == std::string::npos ? std::string() : smaps.substr(start, end - start);
 }
 
-// What the kernel charges `pid` that it cannot take back: written and swapped pages, page tables; each page divided
-// among the processes that map it when `proportionally`. Read through `thread` if any (the main one has exited).
+// The written and swapped pages and page tables of `pid`, shared pages divided among their mappers if
+// `proportionally`; read through `thread` if any (once the main thread has exited).
 inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
     std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
@@ -241,8 +234,7 @@ inline const rapidjson::Value* sharedBy(const rapidjson::Value& report, const st
     return nullptr;
 }
 
-// A process's heft against the kernel's figure read right after: a blocked process's anonymous memory stays as it
-// is, so the two agree exactly, but writeback may clean up to `cleanedSince` of dirty file pages in between.
+// A blocked process's heft is exactly the kernel's figure read after, but for up to `cleanedSince` written back.
 inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0,
                                     pid_t thread = 0)
 {
@@ -254,8 +246,7 @@ class HTE2EReportTest : public testing::Test {
 protected:
     void SetUp() override { ASSERT_FALSE(directory_.path.empty()) << "mkdtemp: " << std::strerror(errno); }
 
-    // Starts child_ with `directives`, then runs heft with `arguments` and the child's pid for the text report
-    // (text_), every region and figure in bytes, and the JSON report (report_); false if either fails.
+    // Lays out child_ and reports on it in bytes, every region, as text_ and report_; false if either fails.
     bool layOutAndMeasure(std::vector<std::string> directives, std::vector<std::string> arguments = {})
     {
         child_.emplace(std::move(directives));

@@ -1,6 +1,5 @@
-// The built heft measuring a family sharing memory only because it forked: anonymous memory, swapped pages and a
-// privately mapped file. Each heft holds all pages the process maps, the summary each page once, and the tables
-// each page with exactly the processes that map it.
+// A family sharing memory since it forked: each heft holds all the pages the process maps, the summary each page
+// once, and the tables each page with exactly the processes that map it.
 
 #include "e2e/HTE2ESupport.h"
 
@@ -16,8 +15,7 @@ constexpr uint64_t kFileSize = 8 * kMiB;
 // What a table may hold besides the layout: pages the C library and the allocator write.
 constexpr uint64_t kSlack = 128 * 1024;
 
-// A parent writes `shared` bytes, lays out `extra` (directive 1) and forks children: child i overwrites slice i
-// and writes `own` bytes. Then the parent writes `after` bytes.
+// The parent writes `shared`, lays out `extra`, forks children (each writes a slice and `own`), writes `after`.
 struct Family {
     uint64_t shared = 4 * kMiB, children = 4, slice = 64 * 1024, own = kMiB, after = kMiB;
     std::vector<std::string> extra;
@@ -57,10 +55,7 @@ protected:
         ASSERT_EQ(members_.size(), layout.children + 1);
     }
 
-    const rapidjson::Value* summary(const std::string& category)
-    {
-        return member(member(&report_, "summary"), category.c_str());
-    }
+    const rapidjson::Value* summary(const char* category) { return member(member(&report_, "summary"), category); }
 
     std::set<int> members_;
 };
@@ -73,8 +68,7 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
     ASSERT_NO_FATAL_FAILURE(measureFamily(layout));
     const pid_t parent = child_->pid();
 
-    // The summary counts each page once, as the kernel's shares summed over the family do; 1% for stacks and the C
-    // library's data, which may change by a page or two in between, far less than a page counted once a process.
+    // Each page once, as the kernel's shares summed over the family; 1% for pages written between the two reads.
     uint64_t kernel = 0;
     for (int pid : members_) kernel += kernelHeft(pid, true);
     const uint64_t total = number(summary("total"), "dirty");
@@ -83,8 +77,8 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
     EXPECT_THAT(text_.standardOutput, HasSubstr("\nSummary Heft: " + n(total) + " B\n"));
     EXPECT_THAT(text_.standardError, Not(HasSubstr(kUnidentifiedNotice)));  // root tells them apart
 
-    // Untouched by the children, the shared and swapped mappings are the five's; the slice a child wrote is its own
-    // copy, the parent's original the other four's. Dirty figures include swap.
+    // What the children left untouched, the swapped pages too (dirty figures include swap), is the five's; the slice
+    // a child wrote is its own copy, and the parent's original the other four's.
     const uint64_t untouched = layout.shared - layout.children * layout.slice + 16 * kMiB;
     EXPECT_PRED3(between, figure(sharedBy(report_, members_), kUntagged, "dirty"), untouched, untouched + kSlack);
     for (int pid : members_) {
@@ -111,13 +105,12 @@ TEST_F(HTForkSharingE2ETest, ForkedAndSwappedMemoryCountsOnceWithExactlyTheProce
 TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePagesOnce)
 {
     if (geteuid() != 0) GTEST_SKIP() << kNeedsRoot;
-    // Written: the parent's copies of the first half, which the children inherit, and the file's pages of the second,
-    // dirty or written back. Read: no copies, so fork leaves the child's page tables empty; the parent has two runs.
+    // Written: the parent's copies of the first half, which the children inherit, then file pages. Read: no copies,
+    // so the child's page tables for it stay empty; only the parent maps file pages, in two runs.
     for (const auto& [read, writtenBack] : {std::pair{false, true}, std::pair{false, false}, std::pair{true, true}}) {
         const std::string path = directory_.file(writtenBack ? "written-back.bin" : "dirty.bin");
         SCOPED_TRACE((read ? "read " : "written ") + path);
-        // A MiB at a time: at once, it may land in folios the parent maps by the page-middle directory, which fork
-        // does not copy.
+        // A MiB at a time: at once, it may land in folios mapped by page-middle directories, which fork does not copy.
         int fd = open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0644);
         ASSERT_GE(fd, 0) << std::strerror(errno);
         for (uint64_t written = 0; written < kFileSize; written += kMiB)
@@ -128,7 +121,8 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePage
         ASSERT_NO_FATAL_FAILURE(measureFamily(layout));
         const pid_t parent = child_->pid();
         const std::string category = "mapped file " + path;
-        const uint64_t dirty = number(summary(category), "dirty"), clean = number(summary(category), "clean");
+        const uint64_t dirty = number(summary(category.c_str()), "dirty"),
+                       clean = number(summary(category.c_str()), "clean");
         if (!read) {
             EXPECT_EQ(dirty + clean, kFileSize);
             EXPECT_GE(dirty, kFileSize / 2);

@@ -1,4 +1,4 @@
-// The built heft measuring live children whose memory the test lays out, against the layout and the kernel's figures.
+// The built heft measuring children whose memory the test lays out, against the layout and the kernel's figures.
 
 #include "e2e/HTE2ESupport.h"
 
@@ -20,8 +20,8 @@ TEST_F(HTLiveProcessE2ETest, AnonymousMemoryIsDirtySwappedReclaimableOrWiredAsLa
     ASSERT_NE(process, nullptr);
     const bool locked = child.value(2, 1) == 0, pagedOut = swap.available && child.value(3, 1) == 0;
 
-    // Each mapping is one region of its size, and a blocked child's pages stay as laid out, except lazily freed ones:
-    // the kernel's to take at any moment, heft's figure lies between what is left after heft ran and the whole.
+    // One region a mapping, its figures as laid out, which a blocked child's pages stay, except lazily freed ones: the
+    // kernel may take them at any moment, so heft's lie between what is left after it ran and the whole.
     const uint64_t lazyFree = kernelField(mappingAt(child.pid(), child.value(1)), "LazyFree"),
                    swapped = kernelField(mappingAt(child.pid(), child.value(3)), "Swap");
     EXPECT_GT(lazyFree, 8 * kMiB) << "the kernel reclaimed the freed pages at once";

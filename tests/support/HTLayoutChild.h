@@ -1,5 +1,4 @@
-// The layout program (layout.c) as a child of the test, waited for until it has laid out its memory, and killed
-// and reaped with all it started when this object goes, also when an assertion failed on the way.
+// The layout program (layout.c) run until it has laid out its memory, then killed with all it started and reaped.
 
 #pragma once
 
@@ -70,10 +69,7 @@ public:
         static const std::vector<uint64_t> none;
         return index < lines_.size() ? lines_[index] : none;
     }
-    uint64_t value(size_t index, size_t position = 0) const
-    {
-        return position < line(index).size() ? line(index)[position] : 0;
-    }
+    uint64_t value(size_t index, size_t at = 0) const { return at < line(index).size() ? line(index)[at] : 0; }
 
     // Waits for the child to exit and leaves it a zombie until reap().
     bool waitForExit()
