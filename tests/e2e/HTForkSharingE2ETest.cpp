@@ -150,7 +150,7 @@ TEST_F(HTForkSharingE2ETest, WithoutRootHeftMeasuresItsOwnProcessesAndSaysOnceTh
 {
     if (std::string why = whyNobodyCannotRun(); !why.empty()) GTEST_SKIP() << why;
     ASSERT_EQ(chmod(directory_.path.c_str(), 0777), 0);
-    const Family layout{.children = 3};
+    const Family layout{.children = 3, .extra = {}};
     HTLayoutChild family(layout.directives(), 65534);  // nobody
     ASSERT_TRUE(family.ready());
     const std::string path = directory_.file("nobody.json");
