@@ -1,7 +1,4 @@
-// Support for the tests that run the built heft on live processes: running a
-// program and capturing its streams, temporary directories and swap that
-// clean up after themselves, what the kernel itself says about a process's
-// memory, and reading heft's JSON report.
+// Running the built heft on live processes, the kernel's own figures for them, and reading heft's JSON report.
 
 #pragma once
 
@@ -12,51 +9,47 @@
 #include <sys/stat.h>
 #include <sys/swap.h>
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
 #include <rapidjson/document.h>
 
+#include <algorithm>
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <optional>
 #include <set>
-
-extern char** environ;
 
 namespace heft_e2e {
 
 inline constexpr const char* kHeftBinary = HEFT_BINARY;
 inline constexpr const char* kSetpriv = "/usr/bin/setpriv";
-inline constexpr uid_t kNobody = 65534;
 inline constexpr uint64_t kMiB = 1024 * 1024;
 inline constexpr const char* kUntagged = "untagged (\"VM_ALLOCATE\")";
 
 inline std::string readFile(const std::string& path)
 {
-    std::ifstream file(path);
-    std::ostringstream contents;
-    contents << file.rdbuf();
-    return contents.str();
+    return {std::istreambuf_iterator<char>(std::ifstream(path).rdbuf()), std::istreambuf_iterator<char>()};
 }
 
 inline std::string n(uint64_t value) { return std::to_string(value); }
 
+MATCHER_P(HoldsOnce, text, "holds \"" + std::string(text) + "\" once")
+{
+    size_t first = arg.find(text);
+    return first != std::string::npos && arg.find(text, first + 1) == std::string::npos;
+}
+
 struct Outcome {
     int status = -1;  // the exit status, or -1 when the program did not exit normally
-    std::string standardOutput;
-    std::string standardError;
+    std::string standardOutput, standardError;
 };
 
-// Runs `program` with `arguments` (arguments[0] is the name it sees itself
-// called by), its streams captured in memory files, which unlike pipes never
-// fill up and stall it. A non-zero `openFiles` is its open-file limit, soft
-// and hard. An alarm, which survives exec, stops a run that hangs.
+// Runs `program`, output to memory files (which never stall it as pipes may), stopped by an alarm if it hangs.
 inline Outcome runProgram(const char* program, std::vector<std::string> arguments, rlim_t openFiles = 0)
 {
-    Outcome outcome;
     const int streams[2] = {memfd_create("heft-e2e-out", MFD_CLOEXEC), memfd_create("heft-e2e-err", MFD_CLOEXEC)};
-    std::vector<char*> argv;
-    for (auto& argument : arguments) argv.push_back(argument.data());
-    argv.push_back(nullptr);
+    std::vector<char*> argv(arguments.size() + 1);
+    std::ranges::transform(arguments, argv.begin(), [](auto& argument) { return argument.data(); });
     pid_t child = fork();
     if (child == 0) {
         dup2(streams[0], STDOUT_FILENO);
@@ -65,15 +58,15 @@ inline Outcome runProgram(const char* program, std::vector<std::string> argument
         close_range(3, ~0U, 0);
         if (openFiles != 0 && setrlimit(RLIMIT_NOFILE, &files) != 0) _exit(126);
         alarm(180);
-        execve(program, argv.data(), environ);
+        execv(program, argv.data());
         _exit(127);
     }
     int status = 0;
     while (child > 0 && waitpid(child, &status, 0) < 0 && errno == EINTR) {}
-    outcome.status = child > 0 && WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     EXPECT_FALSE(WIFSIGNALED(status) && WTERMSIG(status) == SIGALRM) << arguments[0] << " hung";
-    outcome.standardOutput = readFile("/proc/self/fd/" + std::to_string(streams[0]));
-    outcome.standardError = readFile("/proc/self/fd/" + std::to_string(streams[1]));
+    Outcome outcome{child > 0 && WIFEXITED(status) ? WEXITSTATUS(status) : -1,
+                    readFile("/proc/self/fd/" + std::to_string(streams[0])),
+                    readFile("/proc/self/fd/" + std::to_string(streams[1]))};
     for (int fd : streams) close(fd);
     return outcome;
 }
@@ -84,80 +77,60 @@ inline Outcome runHeft(std::vector<std::string> arguments)
     return runProgram(kHeftBinary, std::move(arguments));
 }
 
-// Whether another user may run the program at `path`: every directory on
-// the way must be searchable by all and the file executable by all. A build
-// tree under a private temporary directory is not.
-inline bool everyoneMayRun(const std::string& path)
-{
-    struct stat info {};
-    for (size_t slash = path.find('/', 1); slash != std::string::npos; slash = path.find('/', slash + 1))
-        if (stat(path.substr(0, slash).c_str(), &info) != 0 || (info.st_mode & S_IXOTH) == 0) return false;
-    return stat(path.c_str(), &info) == 0 && (info.st_mode & S_IXOTH) != 0;
-}
-
-// heft run by the unprivileged user nobody.
 inline Outcome runHeftAsNobody(std::vector<std::string> arguments)
 {
     arguments.insert(arguments.begin(), {"setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", kHeftBinary});
     return runProgram(kSetpriv, std::move(arguments));
 }
 
+// Why the user nobody may not run heft and the layout program (as under a private directory); empty if it may.
+inline std::string whyNobodyCannotRun()
+{
+    if (geteuid() != 0) return "running heft as another user needs root";
+    if (access(kSetpriv, X_OK) != 0) return std::string(kSetpriv) + " is needed to change the user";
+    struct stat info {};
+    for (const std::string path : {kHeftBinary, HEFT_LAYOUT_PROGRAM})
+        for (size_t end = 0; end != std::string::npos;)
+            if (stat(path.substr(0, end = path.find('/', end + 1)).c_str(), &info) != 0 || !(info.st_mode & S_IXOTH))
+                return "the user nobody may not run " + path;
+    return "";
+}
+
 // A directory under /tmp, removed with everything in it.
 struct TempDir {
-    TempDir()
-    {
-        char pattern[] = "/tmp/heft-e2e-XXXXXX";
-        if (mkdtemp(pattern) != nullptr) path = pattern;
-    }
-    ~TempDir()
-    {
-        std::error_code ignored;
-        if (!path.empty()) std::filesystem::remove_all(path, ignored);
-    }
+    TempDir() = default;
     TempDir(const TempDir&) = delete;
+    ~TempDir() { std::filesystem::remove_all(path, ignored); }
 
     std::string file(const char* name) const { return path + "/" + name; }
-    size_t entries() const
-    {
-        size_t count = 0;
-        for (const auto& entry : std::filesystem::directory_iterator(path)) count += entry.exists();
-        return count;
-    }
+    size_t entries() const { return std::distance(std::filesystem::directory_iterator(path), {}); }
 
-    std::string path;
+    std::string pattern = "/tmp/heft-e2e-XXXXXX", path = mkdtemp(pattern.data()) ? pattern : "";
+    std::error_code ignored;
 };
 
-// Swap for the tests that push pages out: the system's own when it has some
-// (/proc/swaps lists one after its heading), otherwise a 256 MiB swap file,
-// turned off and removed again with this object, also when the test fails.
-class SwapArea {
-public:
+// The system's swap if any (listed after the heading of /proc/swaps), else a swap file that goes with this object.
+struct SwapArea {
     SwapArea()
     {
         std::string swaps = readFile("/proc/swaps");
-        available_ = swaps.find('\n') + 1 < swaps.size();
-        if (available_) return;
+        if ((available = swaps.find('\n') + 1 < swaps.size())) return;
         Outcome made = runProgram("/bin/sh",
                                   {"sh", "-ec",
                                    "f=$(mktemp /tmp/heft-e2e-swap-XXXXXX); echo \"$f\"\n"
                                    "fallocate -l 256M \"$f\"; mkswap \"$f\" >&2; swapon \"$f\""});
         path_ = made.standardOutput.substr(0, made.standardOutput.find('\n'));
-        enabled_ = available_ = made.status == 0;
-        reason_ = made.standardError;
+        enabled_ = available = made.status == 0;
+        reason = made.standardError;
     }
     ~SwapArea()
     {
         if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << strerror(errno);
         if (!path_.empty()) unlink(path_.c_str());
     }
-    SwapArea(const SwapArea&) = delete;
 
-    bool available() const { return available_; }
-    const std::string& reason() const { return reason_; }
-
-private:
-    std::string path_, reason_;
-    bool enabled_ = false, available_ = false;
+    std::string path_, reason;
+    bool enabled_ = false, available = false;
 };
 
 // A "Name:  123 kB" field of a /proc file's text, in bytes; 0 when absent.
@@ -178,16 +151,12 @@ inline std::string mappingAt(pid_t pid, uint64_t address)
     return end == std::string::npos ? std::string() : smaps.substr(start, end - start);
 }
 
-// What the kernel charges `pid` that it cannot take back: the written and
-// swapped pages of its mappings, and its page tables. `proportionally`
-// divides each page among the processes that map it, so that summed over a
-// set of processes each page counts once. A non-zero `thread` is read
-// instead of the main thread (whose files read empty once it has exited).
+// The written and swapped pages and page tables of `pid`, shared pages divided among their mappers if
+// `proportionally`; read through `thread` if any (once the main thread has exited).
 inline uint64_t kernelHeft(pid_t pid, bool proportionally = false, pid_t thread = 0)
 {
     std::string base = "/proc/" + std::to_string(pid) + (thread ? "/task/" + std::to_string(thread) : "");
-    std::string rollup = readFile(base + "/smaps_rollup");
-    std::string status = readFile(base + "/status");
+    std::string rollup = readFile(base + "/smaps_rollup"), status = readFile(base + "/status");
     EXPECT_FALSE(rollup.empty() || status.empty()) << "cannot read the memory figures of " << pid;
     uint64_t pages = proportionally
         ? kernelField(rollup, "Pss_Dirty") + kernelField(rollup, "SwapPss")
@@ -200,35 +169,42 @@ inline bool between(uint64_t value, uint64_t least, uint64_t most) { return leas
 inline bool loadReport(const std::string& path, rapidjson::Document& document)
 {
     std::string text = readFile(path);
-    document.Parse(text.c_str());
-    if (!document.HasParseError() && document.IsObject()) return true;
-    ADD_FAILURE() << "no JSON report at " << path << ": " << text.substr(0, 200);
-    return false;
+    const bool loaded = !document.Parse(text.c_str()).HasParseError() && document.IsObject();
+    EXPECT_TRUE(loaded) << "no JSON report at " << path << ": " << text.substr(0, 200);
+    return loaded;
 }
 
-inline const rapidjson::Value* member(const rapidjson::Value* object, const std::string& key)
+inline const rapidjson::Value* member(const rapidjson::Value* object, const char* key)
 {
-    if (object == nullptr || !object->IsObject()) return nullptr;
-    auto found = object->FindMember(key.c_str());
-    return found == object->MemberEnd() ? nullptr : &found->value;
+    return object && object->IsObject() && object->HasMember(key) ? &(*object)[key] : nullptr;
 }
 
 inline uint64_t number(const rapidjson::Value* object, const char* key)
 {
-    const rapidjson::Value* found = member(object, key);
-    return found && found->IsUint64() ? found->GetUint64() : 0;
+    return member(object, key) && member(object, key)->IsUint64() ? member(object, key)->GetUint64() : 0;
 }
 
-inline auto arrayIn(const rapidjson::Value& object, const char* key)
+inline std::string nameOf(const rapidjson::Value* object)
+{
+    return member(object, "name") && member(object, "name")->IsString() ? member(object, "name")->GetString() : "";
+}
+
+// A figure of a category of a process's own memory or a shared table.
+inline uint64_t figure(const rapidjson::Value* owner, const std::string& category, const char* key)
+{
+    return number(member(member(owner, "categories"), category.c_str()), key);
+}
+
+inline auto arrayIn(const rapidjson::Value* object, const char* key)
 {
     static const rapidjson::Value empty(rapidjson::kArrayType);
-    const rapidjson::Value* array = member(&object, key);
+    const rapidjson::Value* array = member(object, key);
     return (array && array->IsArray() ? *array : empty).GetArray();
 }
 
 inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t pid)
 {
-    for (const auto& process : arrayIn(report, "processes"))
+    for (const auto& process : arrayIn(&report, "processes"))
         if (number(&process, "pid") == static_cast<uint64_t>(pid)) return &process;
     return nullptr;
 }
@@ -236,46 +212,29 @@ inline const rapidjson::Value* processIn(const rapidjson::Value& report, pid_t p
 // The region of `process` (listed with -v) that holds `address`.
 inline const rapidjson::Value* regionAt(const rapidjson::Value* process, uint64_t address)
 {
-    static const rapidjson::Value none;
-    for (const auto& region : arrayIn(process ? *process : none, "regions")) {
-        uint64_t start = number(&region, "addr");
-        if (start <= address && address < start + number(&region, "vsize")) return &region;
-    }
+    for (const auto& region : arrayIn(process, "regions"))
+        if (uint64_t start = number(&region, "addr"); start <= address && address < start + number(&region, "vsize"))
+            return &region;
     ADD_FAILURE() << "no region holds " << std::hex << address;
     return nullptr;
-}
-
-inline std::string nameOf(const rapidjson::Value* object)
-{
-    const rapidjson::Value* name = member(object, "name");
-    return name && name->IsString() ? name->GetString() : "";
-}
-
-// A figure of a category of a process's own memory or a shared table.
-inline uint64_t figure(const rapidjson::Value* owner, const std::string& category, const char* key)
-{
-    return number(member(member(owner, "categories"), category), key);
 }
 
 inline std::set<int> pidsOf(const rapidjson::Value& shared)
 {
     std::set<int> pids;
-    for (const auto& pid : arrayIn(shared, "pids")) pids.insert(pid.GetInt());
+    for (const auto& pid : arrayIn(&shared, "pids")) pids.insert(pid.GetInt());
     return pids;
 }
 
 // The table common to exactly `pids`; null when there is none.
 inline const rapidjson::Value* sharedBy(const rapidjson::Value& report, const std::set<int>& pids)
 {
-    for (const auto& shared : arrayIn(report, "shared"))
+    for (const auto& shared : arrayIn(&report, "shared"))
         if (!shared.HasMember("specific_to_pid") && pidsOf(shared) == pids) return &shared;
     return nullptr;
 }
 
-// A process's heft against the kernel's count of what cannot be taken back
-// from it, read right after heft ran while the process sat still: anonymous
-// memory of a blocked process stays as it is, so the two agree exactly, but
-// writeback may clean up to `cleanedSince` of dirty file pages in between.
+// A blocked process's heft is exactly the kernel's figure read after, but for up to `cleanedSince` written back.
 inline void expectHeftMatchesKernel(const rapidjson::Value& report, pid_t pid, uint64_t cleanedSince = 0,
                                     pid_t thread = 0)
 {
@@ -287,20 +246,24 @@ class HTE2EReportTest : public testing::Test {
 protected:
     void SetUp() override { ASSERT_FALSE(directory_.path.empty()) << "mkdtemp: " << std::strerror(errno); }
 
-    // Runs heft for the text report, every region and figure in bytes, and
-    // for the JSON report, parsed into `report`.
-    Outcome runForReport(std::vector<std::string> arguments, rapidjson::Document& report)
+    // Lays out child_ and reports on it in bytes, every region, as text_ and report_; false if either fails.
+    bool layOutAndMeasure(std::vector<std::string> directives, std::vector<std::string> arguments = {})
     {
+        child_.emplace(std::move(directives));
+        if (!child_->ready()) return false;
         std::string path = directory_.file("report.json");
         unlink(path.c_str());
         arguments.insert(arguments.begin(), {"-v", "-w", "-f", "bytes", "-j", path});
-        Outcome outcome = runHeft(arguments);
-        EXPECT_EQ(outcome.status, 0) << outcome.standardError;
-        loadReport(path, report);
-        return outcome;
+        arguments.push_back(child_->pidString());
+        text_ = runHeft(arguments);
+        EXPECT_EQ(text_.status, 0) << text_.standardError;
+        return loadReport(path, report_);
     }
 
     TempDir directory_;
+    std::optional<HTLayoutChild> child_;
+    rapidjson::Document report_;
+    Outcome text_;
 };
 
 }  // namespace heft_e2e

@@ -1,7 +1,4 @@
-// The layout program (tests/support/layout.c) run as a child of the test:
-// started with its directives, waited for until it has laid out its memory,
-// and killed and reaped with everything it started when this object goes,
-// also when an assertion failed on the way.
+// The layout program (layout.c) run until it has laid out its memory, then killed with all it started and reaped.
 
 #pragma once
 
@@ -12,8 +9,10 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdint>
+#include <iterator>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -26,24 +25,18 @@ public:
     explicit HTLayoutChild(std::vector<std::string> directives, uid_t user = kSameUser,
                            const std::string& program = HEFT_LAYOUT_PROGRAM)
     {
-        // The processes it forks come to the test when it dies, to be reaped
-        // here rather than left to the system's init.
-        prctl(PR_SET_CHILD_SUBREAPER, 1);
-        // Written back before the first child runs it: the children's code
-        // and data are then clean file pages, not dirty ones they all share.
-        static const int synced = [] {
+        prctl(PR_SET_CHILD_SUBREAPER, 1);  // what it forks comes to the test to reap, not to init
+        // Written back before the first child runs it, so that its code and data are clean file pages.
+        [[maybe_unused]] static const int synced = [] {
             int fd = open(HEFT_LAYOUT_PROGRAM, O_RDONLY | O_CLOEXEC);
             return fd >= 0 && fsync(fd) == 0 ? close(fd) : -1;
         }();
-        (void)synced;
         directives.insert(directives.begin(), "heft-layout");
-        std::vector<char*> argv;
-        for (auto& directive : directives) argv.push_back(directive.data());
-        argv.push_back(nullptr);
+        std::vector<char*> argv(directives.size() + 1);
+        std::ranges::transform(directives, argv.begin(), [](auto& directive) { return directive.data(); });
         int ready[2];
         if (pipe2(ready, O_CLOEXEC) != 0) return;
-        pid_ = fork();
-        if (pid_ == 0) {
+        if ((pid_ = fork()) == 0) {
             prctl(PR_SET_PDEATHSIG, SIGKILL);
             dup2(ready[1], STDOUT_FILENO);
             if (user != kSameUser && (setgroups(0, nullptr) != 0 || setgid(user) != 0 || setuid(user) != 0)) _exit(2);
@@ -60,8 +53,7 @@ public:
         std::istringstream lines(text);
         for (std::string line; std::getline(lines, line) && line != "ready";) {
             std::istringstream numbers(line);
-            lines_.emplace_back();
-            for (uint64_t value; numbers >> value;) lines_.back().push_back(value);
+            lines_.emplace_back(std::istream_iterator<uint64_t>(numbers), std::istream_iterator<uint64_t>());
         }
     }
     ~HTLayoutChild() { reap(); }
@@ -72,15 +64,12 @@ public:
     pid_t pid() const { return pid_; }
     std::string pidString() const { return std::to_string(pid_); }
     // The numbers the directive `index` printed; 0 for one it did not print.
-    uint64_t value(size_t index, size_t position = 0) const
-    {
-        return index < lines_.size() && position < lines_[index].size() ? lines_[index][position] : 0;
-    }
     const std::vector<uint64_t>& line(size_t index) const
     {
         static const std::vector<uint64_t> none;
         return index < lines_.size() ? lines_[index] : none;
     }
+    uint64_t value(size_t index, size_t at = 0) const { return at < line(index).size() ? line(index)[at] : 0; }
 
     // Waits for the child to exit and leaves it a zombie until reap().
     bool waitForExit()
@@ -89,9 +78,7 @@ public:
         return pid_ > 0 && waitid(P_PID, static_cast<id_t>(pid_), &info, WEXITED | WNOWAIT) == 0;
     }
 
-    // Kills the child's process group, and reaps the child and then the
-    // members it left to the test: afterwards none of their pids names a
-    // process.
+    // Kills the child's process group and reaps it all: afterwards none of their pids names a process.
     void reap()
     {
         if (pid_ <= 0) return;

@@ -1,33 +1,19 @@
-/* The layout program: the one program the tests run when they need a real
- * process with known memory. It is plain C, built without sanitizers, so that
- * no sanitizer runtime (whose shadow memory would dwarf and blur what is being
- * measured) comes with it, also when the tests themselves are sanitized.
+/* The layout program: a real process with known memory for the tests, plain C
+ * built without sanitizers, whose shadow memory would blur it. Each directive
+ * prints a line of numbers; then "ready", and it waits as laid out until killed,
+ * with all it started in its process group. A failed call exits with status 3.
  *
- * Its arguments are directives, done in order; each prints one line of
- * numbers. Then it prints "ready" and waits, its memory exactly as laid out,
- * until it is killed. Every process it starts is in its process group.
- *
- *   anon SIZE          written private anonymous memory: ADDRESS 0
- *   free SIZE          the same, then MADV_FREE'd: ADDRESS ERRNO
- *   lock SIZE          the same, then mlocked: ADDRESS ERRNO
- *   pageout SIZE       the same, then pushed to swap (MADV_PAGEOUT): ADDRESS ERRNO
- *   file PATH SIZE N   PATH mapped shared, its first N bytes written: ADDRESS
- *   private PATH HOW   PATH mapped privately; HOW "written": writable, its first
- *                      half written, the rest read; "read": read-only, its first
- *                      and third quarter read: ADDRESS
- *   mappings COUNT     COUNT one-page mappings that cannot merge: ADDRESS
- *   fork COUNT SLICE OWN   COUNT children; child i writes slice i, counted from
- *                      the end, of the first directive's memory and OWN bytes
- *                      of its own, and waits: their pids, once all are ready
- *   tree               a child with two children, the first with a child of
- *                      its own: FIRST SECOND GRANDCHILD
- *   churn              children that write memory and exit, for ever: 0
- *   exit               exits at once, with status 0
- *   exit-main          the main thread exits; a worker thread goes on, and
- *                      prints its thread id once the main thread is a zombie
- *
- * Anonymous memory lies between two inaccessible pages, so that the kernel
- * cannot merge it with a neighbour: it is one mapping of exactly SIZE. */
+ *   anon|free|lock|pageout SIZE  written private anonymous memory between two
+ *       inaccessible pages, left so, MADV_FREE'd, mlocked or paged out: ADDRESS ERRNO
+ *   file PATH SIZE N    PATH mapped shared, its first N bytes written: ADDRESS
+ *   private PATH written|read    PATH mapped privately (see below): ADDRESS
+ *   mappings COUNT      COUNT one-page mappings that cannot merge: ADDRESS
+ *   fork COUNT SLICE OWN   children, child i writing slice i from the end of the
+ *       first directive's memory and OWN bytes of its own: their pids, once ready
+ *   tree                a child with two, the first with one: FIRST SECOND GRANDCHILD
+ *   churn               children that write memory and exit, for ever: 0
+ *   exit                exits at once, with status 0
+ *   exit-main           the main thread exits; a worker prints its id once it is a zombie */
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
@@ -48,43 +34,33 @@
 
 static size_t page;
 
-static void touch(char* start, size_t size)
+static void need(int ok, const char* what)
 {
-    for (size_t offset = 0; offset < size; offset += page) start[offset] = (char)(1 + (offset / page) % 255);
+    if (!ok) perror(what), exit(3);
 }
 
-static void readPages(const char* start, size_t size)
+/* Writes, or reads, a byte of every page. */
+static void touch(char* start, size_t size, int write)
 {
-    for (size_t offset = 0; offset < size; offset += page) (void)*(volatile const char*)(start + offset);
+    for (size_t at = 0; at < size; at += page)
+        write ? (void)(start[at] = (char)(1 + (at / page) % 255)) : (void)*(volatile const char*)(start + at);
 }
 
 static char* mapWritten(size_t size)
 {
     char* base = mmap(NULL, size + 2 * page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-    if (base == MAP_FAILED) exit(3);
+    need(base != MAP_FAILED, "mmap");
     mprotect(base, page, PROT_NONE);
     mprotect(base + page + size, page, PROT_NONE);
-    touch(base + page, size);
+    touch(base + page, size, 1);
     return base + page;
-}
-
-static char* mapFile(const char* path, size_t size, int flags, int writable)
-{
-    int fd = open(path, writable ? O_RDWR : O_RDONLY);
-    struct stat status;
-    if (fd < 0 || fstat(fd, &status) != 0) exit(3);
-    if (size == 0) size = (size_t)status.st_size;
-    char* pages = mmap(NULL, size, writable ? PROT_READ | PROT_WRITE : PROT_READ, flags, fd, 0);
-    if (pages == MAP_FAILED) exit(3);
-    close(fd);
-    return pages;
 }
 
 /* A forked child that dies with its parent, also when the parent died first. */
 static pid_t forkChild(void)
 {
     pid_t parent = getpid(), pid = fork();
-    if (pid < 0) exit(3);
+    need(pid >= 0, "fork");
     if (pid == 0) {
         prctl(PR_SET_PDEATHSIG, SIGKILL);
         if (getppid() != parent) _exit(0);
@@ -92,88 +68,82 @@ static pid_t forkChild(void)
     return pid;
 }
 
+static void waitForEver(void)
+{
+    for (;;) pause();
+}
+
+static void sendPid(int fd, pid_t pid) { need(write(fd, &pid, sizeof(pid)) == sizeof(pid), "write"); }
+
+static pid_t receivePid(int fd)
+{
+    pid_t pid;
+    need(read(fd, &pid, sizeof(pid)) == sizeof(pid), "a child died on the way");
+    return pid;
+}
+
 static void forkFamily(int count, size_t slice, size_t own, char* first, size_t firstSize)
 {
     int ready[2];
-    if (pipe(ready) != 0) exit(3);
-    pid_t* children = calloc((size_t)count, sizeof(pid_t));
+    need(pipe(ready) == 0, "pipe");
     for (int i = 0; i < count; ++i) {
-        if ((children[i] = forkChild()) > 0) continue;
-        touch(first + firstSize - (size_t)(i + 1) * slice, slice);
+        if (forkChild() > 0) continue;
+        touch(first + firstSize - (size_t)(i + 1) * slice, slice, 1);
         mapWritten(own);
-        if (write(ready[1], "", 1) != 1) _exit(3);
-        for (;;) pause();
+        sendPid(ready[1], getpid());
+        waitForEver();
     }
     close(ready[1]);
-    char byte;
-    for (int i = 0; i < count; ++i)
-        if (read(ready[0], &byte, 1) != 1) exit(5); /* a child died on the way */
-    for (int i = 0; i < count; ++i) printf("%d%c", (int)children[i], i + 1 < count ? ' ' : '\n');
-    free(children);
-}
-
-static pid_t pauseInChild(void)
-{
-    pid_t pid = forkChild();
-    if (pid == 0)
-        for (;;) pause();
-    return pid;
+    for (int i = 0; i < count; ++i) printf("%d%c", (int)receivePid(ready[0]), i + 1 < count ? ' ' : '\n');
 }
 
 static void tree(void)
 {
     int report[2];
-    if (pipe(report) != 0) exit(3);
-    pid_t first = forkChild();
+    need(pipe(report) == 0, "pipe");
+    pid_t first = forkChild(), second, grandchild;
     if (first == 0) {
-        pid_t grandchild = pauseInChild();
-        if (write(report[1], &grandchild, sizeof(grandchild)) != sizeof(grandchild)) _exit(3);
-        for (;;) pause();
+        if ((grandchild = forkChild()) == 0) waitForEver();
+        sendPid(report[1], grandchild);
+        waitForEver();
     }
-    pid_t second = pauseInChild(), grandchild;
-    if (read(report[0], &grandchild, sizeof(grandchild)) != sizeof(grandchild)) exit(5);
-    printf("%d %d %d\n", (int)first, (int)second, (int)grandchild);
+    if ((second = forkChild()) == 0) waitForEver();
+    printf("%d %d %d\n", (int)first, (int)second, (int)receivePid(report[0]));
 }
 
 static void churn(void)
 {
     unsigned seed = (unsigned)getpid();
-    int alive = 0;
-    for (;;) {
+    for (int alive = 0;; ++alive, usleep(2000)) {
         while (waitpid(-1, NULL, alive >= 16 ? 0 : WNOHANG) > 0) --alive;
         if (forkChild() == 0) {
             mapWritten((1 + rand_r(&seed) % 8) << 20);
             usleep(rand_r(&seed) % 20000);
             _exit(0);
         }
-        ++alive;
-        usleep(2000);
     }
 }
 
-static char mainThreadState(void)
-{
-    char path[64], line[512];
-    snprintf(path, sizeof(path), "/proc/%d/stat", (int)getpid());
-    int fd = open(path, O_RDONLY);
-    ssize_t length = fd < 0 ? -1 : read(fd, line, sizeof(line) - 1);
-    if (fd >= 0) close(fd);
-    if (length <= 0) return '?';
-    line[length] = '\0';
-    char* end = strrchr(line, ')');
-    return end != NULL && end[1] == ' ' ? end[2] : '?';
-}
-
+/* Prints its thread id once the main thread is a zombie: state Z after the name in /proc/self/stat. */
 static void* worker(void* unused)
 {
-    while (mainThreadState() != 'Z') usleep(1000);
+    char line[512], *end = NULL;
+    while (end == NULL || strncmp(end, ") Z", 3) != 0) {
+        usleep(1000);
+        FILE* stat = fopen("/proc/self/stat", "r");
+        line[stat ? fread(line, 1, sizeof(line) - 1, stat) : 0] = '\0';
+        if (stat) fclose(stat);
+        end = strrchr(line, ')');
+    }
     printf("%d\nready\n", (int)gettid());
     fflush(stdout);
-    for (;;) pause();
+    waitForEver();
     return unused;
 }
 
-#define IS(name) (strcmp(directive, name) == 0)
+/* Whether argv[i] is the directive `name` with its `count` arguments, to be skipped; its argument `k`. */
+#define IS(name, count) (strcmp(argv[i], name) == 0 && i + (count) < argc && (skip = (count), 1))
+#define NUMBER(k) ((size_t)strtoull(argv[i + (k)], NULL, 10))
 
 int main(int argc, char** argv)
 {
@@ -182,65 +152,54 @@ int main(int argc, char** argv)
     setpgid(0, 0);
     char* first = NULL;
     size_t firstSize = 0;
-    for (int i = 1; i < argc; ++i) {
-        const char* directive = argv[i];
-        size_t size = i + 1 < argc ? strtoull(argv[i + 1], NULL, 10) : 0;
+    for (int i = 1, skip = 0; i < argc; i += 1 + skip, skip = 0) {
         char* pages = NULL;
-        int error = 0;
-        if (IS("anon") || IS("free") || IS("lock") || IS("pageout")) {
-            pages = mapWritten(size);
-            if (IS("free")) error = madvise(pages, size, MADV_FREE) ? errno : 0;
-            if (IS("lock")) error = mlock(pages, size) ? errno : 0;
-            if (IS("pageout")) error = madvise(pages, size, MADV_PAGEOUT) ? errno : 0;
-            printf("%lu %d\n", (unsigned long)pages, error);
-            ++i;
-        } else if (IS("file") && i + 3 < argc) {
-            size = strtoull(argv[i + 2], NULL, 10);
-            pages = mapFile(argv[i + 1], size, MAP_SHARED, 1);
-            touch(pages, strtoull(argv[i + 3], NULL, 10));
-            printf("%lu\n", (unsigned long)pages);
-            i += 3;
-        } else if (IS("private") && i + 2 < argc) {
-            int written = strcmp(argv[i + 2], "written") == 0;
-            pages = mapFile(argv[i + 1], 0, MAP_PRIVATE, written);
+        size_t size = 0;
+        if (IS("anon", 1) || IS("free", 1) || IS("lock", 1) || IS("pageout", 1)) {
+            pages = mapWritten(size = NUMBER(1));
+            int error = 0;
+            if (IS("free", 1)) error = madvise(pages, size, MADV_FREE);
+            if (IS("lock", 1)) error = mlock(pages, size);
+            if (IS("pageout", 1)) error = madvise(pages, size, MADV_PAGEOUT);
+            printf("%lu %d\n", (unsigned long)pages, error ? errno : 0);
+        } else if (IS("file", 3) || IS("private", 2)) {
+            /* A private mapping covers the whole file: "written" writes its first half and reads the rest,
+             * "read" maps it read-only and reads its first and third quarter. */
+            int shared = IS("file", 3), writable = shared || strcmp(argv[i + 2], "written") == 0;
+            int fd = open(argv[i + 1], writable ? O_RDWR : O_RDONLY);
             struct stat status;
-            size = stat(argv[i + 1], &status) == 0 ? (size_t)status.st_size : 0;
+            need(fd >= 0 && fstat(fd, &status) == 0, argv[i + 1]);
+            size = shared ? NUMBER(2) : (size_t)status.st_size;
+            pages = mmap(NULL, size, PROT_READ | (writable ? PROT_WRITE : 0), shared ? MAP_SHARED : MAP_PRIVATE, fd, 0);
+            need(pages != MAP_FAILED, "mmap");
+            close(fd);
             size_t quarter = size / page / 4 * page;
-            if (written) {
-                touch(pages, 2 * quarter);
-                readPages(pages + 2 * quarter, size - 2 * quarter);
-            } else {
-                readPages(pages, quarter);
-                readPages(pages + 2 * quarter, quarter);
-            }
+            touch(pages, shared ? NUMBER(3) : writable ? 2 * quarter : quarter, writable);
+            if (!shared) touch(pages + 2 * quarter, writable ? size - 2 * quarter : quarter, 0);
             printf("%lu\n", (unsigned long)pages);
-            i += 2;
-        } else if (IS("mappings")) {
+        } else if (IS("mappings", 1)) {
             /* Every other page inaccessible: no two mappings can merge. */
-            pages = mmap(NULL, 2 * size * page, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
-            if (pages == MAP_FAILED) return 3;
-            for (size_t m = 0; m < size; ++m)
-                if (mprotect(pages + 2 * m * page, page, PROT_READ) != 0) return 3;
+            pages = mmap(NULL, 2 * NUMBER(1) * page, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0);
+            need(pages != MAP_FAILED, "mmap");
+            for (size_t m = 0; m < NUMBER(1); ++m)
+                need(mprotect(pages + 2 * m * page, page, PROT_READ) == 0, "mprotect");
             printf("%lu\n", (unsigned long)pages);
-            ++i;
-        } else if (IS("fork") && i + 3 < argc && first != NULL) {
-            forkFamily((int)size, strtoull(argv[i + 2], NULL, 10), strtoull(argv[i + 3], NULL, 10), first, firstSize);
-            i += 3;
-        } else if (IS("tree")) {
+        } else if (IS("fork", 3) && first != NULL) {
+            forkFamily((int)NUMBER(1), NUMBER(2), NUMBER(3), first, firstSize);
+        } else if (IS("tree", 0)) {
             tree();
-        } else if (IS("churn")) {
+        } else if (IS("churn", 0)) {
             printf("0\nready\n");
             fflush(stdout);
             churn();
-        } else if (IS("exit")) {
+        } else if (IS("exit", 0)) {
             return 0;
-        } else if (IS("exit-main")) {
-            fflush(stdout);
+        } else if (IS("exit-main", 0)) {
             pthread_t thread;
-            if (pthread_create(&thread, NULL, worker, NULL) != 0) return 3;
+            need(pthread_create(&thread, NULL, worker, NULL) == 0, "pthread_create");
             pthread_exit(NULL);
         } else {
-            fprintf(stderr, "layout: cannot lay out '%s'\n", directive);
+            fprintf(stderr, "layout: cannot lay out '%s'\n", argv[i]);
             return 2;
         }
         if (first == NULL && pages != NULL) first = pages, firstSize = size;
@@ -248,5 +207,5 @@ int main(int argc, char** argv)
     }
     printf("ready\n");
     fflush(stdout);
-    for (;;) pause();
+    waitForEver();
 }
