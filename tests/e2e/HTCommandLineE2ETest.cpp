@@ -30,7 +30,7 @@ void expectRuns(const std::vector<Run>& runs, Outcome (*run)(std::vector<std::st
 TEST(HTCommandLineE2ETest, RunsThatEndBeforeTheAnalysisPrintTheirMessages)
 {
     // Messages on standard error, the usage in full after them; the C library's name heft and the option in a line.
-    const std::string usage = readFile(std::filesystem::path(__FILE__).parent_path() / "../data/usage.txt");
+    const std::string usage = readFile(std::string(HEFT_TEST_DATA_DIR) + "/usage.txt");
     auto complaint = [](const char* option) { return AllOf(StartsWith("heft: "), HasSubstr(option), HoldsOnce("\n")); };
     const auto noTarget = AllOf(StartsWith("WARNING: "), EndsWith("Must specify at least one process or snapfile\n"));
     const std::string noSuchProcess = "Unable to find pid for process matching 'heft-e2e-no-such-process'\n";
