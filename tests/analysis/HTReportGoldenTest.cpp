@@ -35,8 +35,6 @@ protected:
         for (std::string raw; std::getline(lines, raw);) {
             const HTScenarioLine line(raw);
             const std::string& kind = line.kind;
-            auto text = [&](const char* key) { return line.text(key); };
-            auto number = [&](const char* key, uint64_t fallback = 0) { return line.number(key, fallback); };
             if (kind == "global-error") HTProcess::_addGlobalError(line.argument);
             if (kind == "aux") {
                 if (!last->auxData()) last->setAuxData(auxInto = std::make_shared<HTAuxDataMap>());
@@ -49,47 +47,49 @@ protected:
                 if (value == "map") auxInto = inner;
             }
             if (kind == "set") {
-                settings_.summaryFormat = static_cast<int64_t>(number("format", HTTextFormatFormatted));
-                settings_.textOptions = static_cast<int64_t>(number("options"));
-                settings_.textSort = text("sort").value_or("Dirty");
-                settings_.verbose = number("verbose");
-                settings_.summarize = number("summarize");
-                settings_.breakDownPhysHeft = number("breakdown");
-                settings_.sharingAnalysisDisabled = number("nosharing");
-                platform_->sharedPagesIdentifiable = !number("noidentities");
+                settings_.summaryFormat = static_cast<int64_t>(line.number("format", HTTextFormatFormatted));
+                settings_.textOptions = static_cast<int64_t>(line.number("options"));
+                settings_.textSort = line.text("sort").value_or("Dirty");
+                settings_.verbose = line.number("verbose");
+                settings_.summarize = line.number("summarize");
+                settings_.breakDownPhysHeft = line.number("breakdown");
+                settings_.sharingAnalysisDisabled = line.number("nosharing");
+                platform_->sharedPagesIdentifiable = !line.number("noidentities");
             } else if (kind == "process") {
-                processes.push_back(last = process(std::stoi(line.argument), {}, text("bits") != "32"));
-                if (text("name")) last->setName(*text("name"));
+                processes.push_back(last = process(std::stoi(line.argument), {}, line.text("bits") != "32"));
+                if (line.text("name")) last->setName(*line.text("name"));
                 last->setDisplayString(last->name() + " [" + line.argument + "]");
-                last->setHiddenFromDisplay(text("hidden").has_value());
+                last->setHiddenFromDisplay(line.text("hidden").has_value());
                 for (auto [at, end] = line.fields.equal_range("warning"); at != end; ++at)
                     last->warnings().push_back(at->second);
-                if (auto error = text("error")) last->scriptError(*error);
-                last->setPageSize(number("pagesize", kPage));
+                if (auto error = line.text("error")) last->scriptError(*error);
+                last->setPageSize(line.number("pagesize", kPage));
             } else if (kind == "forked") {
                 std::vector<std::string> pages;
-                std::istringstream list(text("pages").value_or(""));
+                std::istringstream list(line.text("pages").value_or(""));
                 for (std::string page; std::getline(list, page, ',');) pages.push_back(page);
-                processes.push_back(
-                    forkedProcess(platform_, std::stoi(line.argument), pages, number("per"), settings_, text("file")));
+                processes.push_back(forkedProcess(platform_, std::stoi(line.argument), pages, line.number("per"),
+                                                  settings_, line.text("file")));
             } else if (kind == "region") {
-                const uint64_t dirty = number("dirty"), clean = number("clean"), swapped = number("swapped");
-                last->script().push_back({.objectId = number("id"),
-                                          .offset = number("offset") * kPage,
-                                          .size = number("pages", dirty + clean + swapped) * kPage + number("extra"),
-                                          .dirty = dirty * kPage,
-                                          .swapped = swapped * kPage,
-                                          .clean = clean * kPage,
-                                          .shareMode = text("cow") ? SM_COW : SM_SHARED,
-                                          .segment = static_cast<uint8_t>(number("segment", HTSegmentNoImage)),
-                                          .name = text("name"),
-                                          .detailedName = text("path"),
-                                          .inSharedCache = text("cache").has_value(),
-                                          .start = number("start"),
-                                          .owned = text("owned").has_value(),
-                                          .fake = text("unmapped").has_value(),
-                                          .wired = text("wired").has_value(),
-                                          .reclaimable = number("reclaimable") * kPage});
+                const uint64_t dirty = line.number("dirty"), clean = line.number("clean"),
+                               swapped = line.number("swapped");
+                last->script().push_back(
+                    {.objectId = line.number("id"),
+                     .offset = line.number("offset") * kPage,
+                     .size = line.number("pages", dirty + clean + swapped) * kPage + line.number("extra"),
+                     .dirty = dirty * kPage,
+                     .swapped = swapped * kPage,
+                     .clean = clean * kPage,
+                     .shareMode = line.text("cow") ? SM_COW : SM_SHARED,
+                     .segment = static_cast<uint8_t>(line.number("segment", HTSegmentNoImage)),
+                     .name = line.text("name"),
+                     .detailedName = line.text("path"),
+                     .inSharedCache = line.text("cache").has_value(),
+                     .start = line.number("start"),
+                     .owned = line.text("owned").has_value(),
+                     .fake = line.text("unmapped").has_value(),
+                     .wired = line.text("wired").has_value(),
+                     .reclaimable = line.number("reclaimable") * kPage});
             }
         }
         return processes;

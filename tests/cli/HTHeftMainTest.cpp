@@ -1,6 +1,7 @@
 #include "cli/HTHeftMain.h"
 
 #include "base/HTNoticeLog.h"
+#include "output/HTExpectedReport.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
@@ -8,15 +9,15 @@
 
 #include <cerrno>
 #include <cstring>
+#include <iterator>
+#include <sstream>
 #include <string>
 #include <unistd.h>
 #include <vector>
 
 namespace {
 
-// The run up to the analysis, against a scripted system. The exact texts
-// a user sees are checked end to end on the built program; here the checks
-// are about what the run does to the system and in which order.
+// Whole runs against a scripted system.
 class HTHeftMainTest : public testing::Test {
 protected:
     void SetUp() override
@@ -45,18 +46,28 @@ protected:
     std::shared_ptr<HTFakePlatform> platform_ = std::make_shared<HTFakePlatform>();
 };
 
-TEST_F(HTHeftMainTest, OnlyTheBreakdownModeAsksWhichObjectsAProcessOwns)
+TEST_F(HTHeftMainTest, Runs)
 {
-    const char* kDirtyAnalysis = "VM Object Dirty Analysis: Enabled\n";
-    auto [status, out, error] = run({"--vmObjectDirty", "42"});
-    EXPECT_EQ(status, 0);
-    EXPECT_NE(out.find(kDirtyAnalysis), std::string::npos) << out;
-    EXPECT_EQ(platform_->ownedVmObjectQueries, 0);
-
-    std::tie(status, out, error) = run({"42"});
-    EXPECT_EQ(std::make_tuple(status, out.find(kDirtyAnalysis), error), std::make_tuple(0, std::string::npos, ""));
-    EXPECT_NE(out.find("\nworker [42]: 64-bit\tHeft: "), std::string::npos) << out;
-    EXPECT_GT(platform_->ownedVmObjectQueries, 0);
+    const std::string name = "cli/main";
+    std::istringstream lines(contentsOf(std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name + ".scenario"));
+    std::string said;
+    for (std::string text; std::getline(lines, text);) {
+        const HTScenarioLine line(text);
+        if (line.kind == "set") platform_->euid = static_cast<uint32_t>(line.number("euid"));
+        if (line.kind == "zombie") {
+            HTFakePlatform::Process& zombie = platform_->addProcess(std::stoi(line.argument), 1, *line.text("name"));
+            zombie.info.pbi_status = SZOMB;
+            zombie.regionFailureIndex = 0;
+        }
+        if (line.kind != "run") continue;
+        std::istringstream words(text.substr(4));
+        std::vector<std::string> arguments{std::istream_iterator<std::string>(words), {}};
+        platform_->ownedVmObjectQueries = 0;
+        auto [status, out, error] = run(arguments);
+        said += text + "\n  status " + std::to_string(status) + ", " + std::to_string(platform_->ownedVmObjectQueries) +
+            " owned-object queries\n" + out + (error.empty() ? "" : "standard error:\n" + error) + "\n";
+    }
+    expectReport(name + ".txt", said);
 }
 
 TEST_F(HTHeftMainTest, TheJSONFileIsOpenedFirstAndGoneWhenTheRunFails)
@@ -73,31 +84,6 @@ TEST_F(HTHeftMainTest, TheJSONFileIsOpenedFirstAndGoneWhenTheRunFails)
     EXPECT_EQ(status, 1);
     EXPECT_EQ(error,
               "Unable to open JSON output file '" + std::string(directory) + "/out.json': No such file or directory\n");
-}
-
-TEST_F(HTHeftMainTest, AllProcessesAndUnmappedNeedRootNamingProcessesDoesNot)
-{
-    platform_->euid = 1000;
-    EXPECT_EQ(run({"-a"}), std::make_tuple(1, "", "Must run as root.\n"));
-    EXPECT_EQ(run({"--unmapped", "42"}), std::make_tuple(1, "", "Must run as root.\n"));
-    EXPECT_EQ(std::get<0>(run({"worker"})), 0);
-    // A command-line error is reported before privileges are looked at.
-    auto [status, out, error] = run({"-a", "-f", "bad"});
-    EXPECT_EQ(status, 1);
-    EXPECT_EQ(error.rfind("Unrecognized argument to -f", 0), 0u) << error;
-}
-
-TEST_F(HTHeftMainTest, WhatBefellTheProcessesFollowsTheGatheringEscaped)
-{
-    // A zombie whose name would split the line and drive the terminal.
-    HTFakePlatform::Process& zombie = platform_->addProcess(43, 1, "evil\n\x1B[7m");
-    zombie.info.pbi_status = SZOMB;
-    zombie.regionFailureIndex = 0;
-    auto [status, out, error] = run({"43"});
-    EXPECT_EQ(status, 0);
-    EXPECT_EQ(error,
-              "evil\\n\\x1B[7m [43]: had exited and was not yet reaped (a zombie) when read; "
-              "marked \"(zombie)\" in the report\n");
 }
 
 }  // namespace

@@ -16,6 +16,14 @@
 #include <string>
 #include <vector>
 
+// The whole of a file.
+inline std::string contentsOf(const std::string& path)
+{
+    std::stringstream text;
+    text << std::ifstream(path, std::ios::binary).rdbuf();
+    return text.str();
+}
+
 inline void expectReport(const std::string& name, const std::string& actual)
 {
     const std::string path = std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name;
@@ -24,17 +32,7 @@ inline void expectReport(const std::string& name, const std::string& actual)
         std::ofstream(path, std::ios::binary) << actual;
         return;
     }
-    std::stringstream expected;
-    expected << std::ifstream(path, std::ios::binary).rdbuf();
-    EXPECT_EQ(actual, expected.str()) << "differs from " << path << "; HEFT_UPDATE_REPORTS=1 rewrites it";
-}
-
-// The whole of a file.
-inline std::string contentsOf(const std::string& path)
-{
-    std::stringstream text;
-    text << std::ifstream(path, std::ios::binary).rdbuf();
-    return text.str();
+    EXPECT_EQ(actual, contentsOf(path)) << "differs from " << path << "; HEFT_UPDATE_REPORTS=1 rewrites it";
 }
 
 // One line of a scenario: a keyword, then pairs of a key and a value, with

@@ -1,9 +1,5 @@
-// Processes read from a scripted kernel: each scenario under
-// tests/data/reports/processes/ scripts the kernel's answers and the reads,
-// and everything each read gave (regions, sub-ranges, figures, warnings,
-// errors, what standard error was told, which calls were made) is compared
-// with the expected file of the same name. The README there says how
-// scenarios are written.
+// Processes read from a scripted kernel, and everything each read gave,
+// compared with expected files: see tests/data/reports/processes/README.md.
 
 #include "base/HTNoticeLog.h"
 #include "model/HTAuxData.h"
@@ -35,11 +31,8 @@ public:
     }
     // What one run remembers: the ledger template, and whether running out
     // of descriptors was said.
-    static void forgetRun()
-    {
-        _forgetLedgerTemplate();
-        _forgetOutOfDescriptors();
-    }
+    using HTUserProcess::_forgetLedgerTemplate;
+    using HTUserProcess::_forgetOutOfDescriptors;
 
 protected:
     int _platformCode() override { return sharedCache_ ? 3 : HTUserProcess::_platformCode(); }
@@ -48,24 +41,13 @@ private:
     bool sharedCache_;
 };
 
-const std::map<std::string, int64_t> kNames = {
-    {"private", SM_PRIVATE},
-    {"cow", SM_COW},
-    {"shared", SM_SHARED},
-    {"volatile", VM_PURGABLE_VOLATILE},
-    {"nonvolatile", VM_PURGABLE_NONVOLATILE},
-    {"empty", VM_PURGABLE_EMPTY},
-    {"run", SRUN},
-    {"zombie", SZOMB},
-    {"lp64", PROC_FLAG_LP64},
-    {"inexit", PROC_FLAG_LP64 | PROC_FLAG_INEXIT},
-    {"gone", MACH_SEND_INVALID_DEST},
-    {"failure", KERN_FAILURE},
-    {"emfile", HT_KERN_ERRNO_BASE | EMFILE},
-    {"enfile", HT_KERN_ERRNO_BASE | ENFILE},
-    {"eperm", EPERM},
-    {"fake", HTFakeRegionTag},
-};
+// clang-format off
+const std::map<std::string, int64_t> kNames = {{"private", SM_PRIVATE}, {"cow", SM_COW}, {"shared", SM_SHARED},
+    {"volatile", VM_PURGABLE_VOLATILE}, {"nonvolatile", VM_PURGABLE_NONVOLATILE}, {"empty", VM_PURGABLE_EMPTY},
+    {"run", SRUN}, {"zombie", SZOMB}, {"lp64", PROC_FLAG_LP64}, {"inexit", PROC_FLAG_LP64 | PROC_FLAG_INEXIT},
+    {"gone", MACH_SEND_INVALID_DEST}, {"failure", KERN_FAILURE}, {"emfile", HT_KERN_ERRNO_BASE | EMFILE},
+    {"enfile", HT_KERN_ERRNO_BASE | ENFILE}, {"eperm", EPERM}, {"fake", HTFakeRegionTag}};
+// clang-format on
 
 // A number, or one of the names above.
 int64_t valueOf(const std::string& text)
@@ -87,14 +69,13 @@ std::vector<int64_t> listOf(const std::string& text)
 // e external, - none.
 int32_t disposition(const std::string& letters)
 {
+    const std::map<char, int32_t> bits = {{'p', VM_PAGE_QUERY_PAGE_PRESENT},
+                                          {'d', VM_PAGE_QUERY_PAGE_DIRTY},
+                                          {'o', VM_PAGE_QUERY_PAGE_PAGED_OUT},
+                                          {'r', VM_PAGE_QUERY_PAGE_REUSABLE},
+                                          {'e', VM_PAGE_QUERY_PAGE_EXTERNAL}};
     int32_t kind = 0;
-    for (char letter : letters)
-        kind |= letter == 'p' ? VM_PAGE_QUERY_PAGE_PRESENT
-            : letter == 'd'   ? VM_PAGE_QUERY_PAGE_DIRTY
-            : letter == 'o'   ? VM_PAGE_QUERY_PAGE_PAGED_OUT
-            : letter == 'r'   ? VM_PAGE_QUERY_PAGE_REUSABLE
-            : letter == 'e'   ? VM_PAGE_QUERY_PAGE_EXTERNAL
-                              : 0;
+    for (char letter : letters) kind |= bits.count(letter) ? bits.at(letter) : 0;
     return kind;
 }
 
@@ -111,7 +92,8 @@ protected:
 
     static void forgetRun()
     {
-        HTScenarioProcess::forgetRun();
+        HTScenarioProcess::_forgetLedgerTemplate();
+        HTScenarioProcess::_forgetOutOfDescriptors();
         HTProcess::_clearGlobalErrors();
         HTNoticeLog::standardError().take();
     }
@@ -129,7 +111,7 @@ protected:
             const HTScenarioLine line(raw);
             if (line.kind == "set") set(line);
             if (line.kind == "template") {
-                HTScenarioProcess::forgetRun();
+                HTScenarioProcess::_forgetLedgerTemplate();
                 platform_->ledgerTemplate.reset();
                 if (line.argument != "none") {
                     std::istringstream names(line.argument);
