@@ -34,6 +34,28 @@ struct HTPlatformImage {
     std::vector<HTPlatformImageSegment> segments;
 };
 
+// A loaded kernel module: its bundle identifier and its load tag.
+struct HTLoadedModule {
+    std::string bundleIdentifier;
+    uint64_t loadTag = 0;
+};
+
+// A source location of kernel code.
+struct HTSourceInfo {
+    std::string path;
+    int32_t line = 0;
+};
+
+// Names the running kernel's code addresses.
+class HTKernelSymbolResolver {
+public:
+    virtual ~HTKernelSymbolResolver() = default;
+    // The name of the symbol at the address; nullopt when none is known.
+    virtual std::optional<std::string> symbolName(uint64_t address) = 0;
+    // Where in the kernel's sources the code at the address comes from.
+    virtual std::optional<HTSourceInfo> sourceInfo(uint64_t address) = 0;
+};
+
 class HTPlatform {
 public:
     virtual ~HTPlatform() = default;
@@ -149,6 +171,20 @@ public:
     }
     // The path with symbolic links resolved; nullopt when it cannot be.
     virtual std::optional<std::string> realpath(const std::string& path) { return std::nullopt; }
+
+    // --- the kernel's memory ----------------------------------------------
+    // The kernel's zones (names and figures, one each) and the sites of its
+    // memory accounting. The vectors are filled afresh.
+    virtual kern_return_t mach_memory_info(std::vector<mach_zone_name_t>& names, std::vector<mach_zone_info_t>& zones,
+                                           std::vector<mach_memory_info_t>& sites)
+    {
+        return KERN_FAILURE;
+    }
+    // The loaded kernel modules; an empty list when there are none or the
+    // kernel does not say.
+    virtual std::vector<HTLoadedModule> OSKextCopyLoadedKextInfo() { return {}; }
+    // A symbol resolver for the running kernel; null when there is none.
+    virtual std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() { return nullptr; }
 
     // --- the calling program -------------------------------------------
     virtual int32_t getpid() = 0;

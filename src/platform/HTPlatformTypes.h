@@ -3,6 +3,7 @@
 // Records and constants of the kernel interface heft is written against.
 // Each backend fills them from what its own kernel exposes.
 
+#include <cstddef>
 #include <cstdint>
 
 using kern_return_t = int32_t;
@@ -234,3 +235,61 @@ struct proc_bsdshortinfo {
     uint32_t pbsi_rfu;
 };
 static_assert(sizeof(proc_bsdshortinfo) == 64, "proc_bsdshortinfo is 64 bytes");
+
+// --- the kernel's memory ----------------------------------------------------
+
+// The length of a zone's name and of a memory-info record's own name.
+inline constexpr size_t MACH_ZONE_NAME_MAX_LEN = 80;
+
+// A zone's name: 80 bytes of text, not necessarily NUL-terminated.
+struct mach_zone_name_t {
+    char mzn_name[MACH_ZONE_NAME_MAX_LEN];
+};
+static_assert(sizeof(mach_zone_name_t) == 80, "a zone name is 80 bytes");
+
+// A zone's figures; zone info i belongs to zone name i.
+struct mach_zone_info_t {
+    uint64_t mzi_count;     // elements in use
+    uint64_t mzi_cur_size;  // bytes held now
+    uint64_t mzi_max_size;
+    uint64_t mzi_elem_size;  // bytes an element
+    uint64_t mzi_alloc_size;
+    uint64_t mzi_sum_size;
+    uint64_t mzi_exhaustible;
+    uint64_t mzi_collectable;  // non-zero: free elements can be given back
+};
+static_assert(sizeof(mach_zone_info_t) == 64, "a zone info is 64 bytes");
+
+// One site of the kernel's memory accounting: a tag, a module, a piece of
+// kernel code, or a counter.
+struct mach_memory_info_t {
+    uint64_t flags;
+    uint64_t site;
+    uint64_t size;
+    uint64_t free;
+    uint64_t largest;
+    uint64_t collectable_bytes;
+    uint64_t mapped;
+    uint64_t peak;
+    uint16_t tag;
+    uint16_t zone;
+    uint16_t _resv[2];
+    uint64_t _resv2[3];
+    char name[MACH_ZONE_NAME_MAX_LEN];  // NUL-terminated
+};
+static_assert(sizeof(mach_memory_info_t) == 176, "a memory-info record is 176 bytes");
+
+// mach_memory_info_t flags: the site's type in the low byte, then bits.
+inline constexpr uint64_t VM_KERN_SITE_TYPE = 0xff;
+inline constexpr uint64_t VM_KERN_SITE_TAG = 0;      // `site` is a VM_KERN_MEMORY tag
+inline constexpr uint64_t VM_KERN_SITE_KMOD = 1;     // `site` is a module's load tag
+inline constexpr uint64_t VM_KERN_SITE_KERNEL = 2;   // `site` is a code address
+inline constexpr uint64_t VM_KERN_SITE_COUNTER = 3;  // `site` is a VM_KERN_COUNT index
+inline constexpr uint64_t VM_KERN_SITE_WIRED = 0x100;
+inline constexpr uint64_t VM_KERN_SITE_HIDE = 0x200;
+inline constexpr uint64_t VM_KERN_SITE_NAMED = 0x400;  // the record carries its own name
+inline constexpr uint64_t VM_KERN_SITE_ZONE = 0x800;   // `zone` indexes the zone names
+
+// Tags the kernel's own accounting gives special meaning.
+inline constexpr uint64_t VM_KERN_MEMORY_KALLOC = 13;
+inline constexpr uint64_t VM_KERN_MEMORY_MLOCK = 24;  // memory user processes wired
