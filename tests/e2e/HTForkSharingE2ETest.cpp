@@ -139,7 +139,8 @@ TEST_F(HTForkSharingE2ETest, PrivateFileMappingsCountTheirCopiesAndTheirFilePage
         // The parent sees the pages in its own table and the ones it shares.
         uint64_t parentClean = figure(processIn(report_, parent), category, "clean");
         for (const auto& table : arrayIn(&report_, "shared"))
-            if (table.HasMember("specific_to_pid") ? table["specific_to_pid"] == parent : pidsOf(table).count(parent))
+            if (table.HasMember("specific_to_pid") ? number(&table, "specific_to_pid") == static_cast<uint64_t>(parent)
+                                                   : pidsOf(table).count(parent) != 0)
                 parentClean += figure(&table, category, "clean");
         EXPECT_GE(parentClean, resident);
         EXPECT_PRED3(between, clean, parentClean, kFileSize);
