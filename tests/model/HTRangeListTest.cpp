@@ -187,7 +187,9 @@ TEST(HTRangeList, TotalsMatchTheUnionOfPages)
         const HTMemoryTotals unionOfPages = bytes(all);
         EXPECT_TRUE(list.exact() || !everyRangeExact);
         for (uint64_t HTMemoryTotals::*total : kTotals) {
-            if (list.exact()) EXPECT_EQ(sum.*total, unionOfPages.*total);
+            if (list.exact()) {
+                EXPECT_EQ(sum.*total, unionOfPages.*total);
+            }
             EXPECT_GE(sum.*total, largest.*total);
             EXPECT_LE(sum.*total, unionOfPages.*total);
         }
