@@ -8,6 +8,8 @@
 #include "output/HTExpectedReport.h"
 #include "output/HTOutputFormatterJSON.h"
 #include "output/HTOutputFormatterText.h"
+#include "process/HTKernelProcess.h"
+#include "process/HTKernelScript.h"
 
 #include <gtest/gtest.h>
 
@@ -36,6 +38,14 @@ protected:
             const HTScenarioLine line(raw);
             const std::string& kind = line.kind;
             if (kind == "global-error") HTProcess::_addGlobalError(line.argument);
+            if (kind == "kernel") {
+                auto kernel = std::make_shared<HTKernelProcess>(platform_);
+                kernel->setSettings(settings_);
+                kernel->initWithBsdInfo(
+                    platform_->addProcess(0, 0, "kernel", {}, PROC_FLAG_SYSTEM | PROC_FLAG_LP64).info);
+                processes.push_back(kernel);
+            }
+            scriptKernel(*platform_, line);
             if (kind == "aux") {
                 if (!last->auxData()) last->setAuxData(auxInto = std::make_shared<HTAuxDataMap>());
                 if (line.fields.empty()) continue;

@@ -7,6 +7,8 @@
 #include "model/HTMemoryRegion.h"
 #include "output/HTExpectedReport.h"
 #include "platform/fake/HTFakePlatform.h"
+#include "process/HTKernelProcess.h"
+#include "process/HTKernelScript.h"
 #include "process/HTUserProcess.h"
 
 #include <gtest/gtest.h>
@@ -46,7 +48,7 @@ const std::map<std::string, int64_t> kNames = {{"private", SM_PRIVATE}, {"cow", 
     {"volatile", VM_PURGABLE_VOLATILE}, {"nonvolatile", VM_PURGABLE_NONVOLATILE}, {"empty", VM_PURGABLE_EMPTY},
     {"run", SRUN}, {"zombie", SZOMB}, {"lp64", PROC_FLAG_LP64}, {"inexit", PROC_FLAG_LP64 | PROC_FLAG_INEXIT},
     {"gone", MACH_SEND_INVALID_DEST}, {"failure", KERN_FAILURE}, {"emfile", HT_KERN_ERRNO_BASE | EMFILE},
-    {"enfile", HT_KERN_ERRNO_BASE | ENFILE}, {"eperm", EPERM}, {"fake", HTFakeRegionTag}};
+    {"enfile", HT_KERN_ERRNO_BASE | ENFILE}, {"eperm", EPERM}, {"fake", HTFakeRegionTag}, {"system", PROC_FLAG_SYSTEM}};
 // clang-format on
 
 // A number, or one of the names above.
@@ -141,6 +143,7 @@ protected:
                 target_->images.push_back(image);
             }
             if (line.kind == "gather") gather(line, out);
+            scriptKernel(*platform_, line);
         }
         return out.str();
     }
@@ -227,7 +230,10 @@ protected:
         HTFakePlatform::Process& script = *platform_->process(static_cast<int32_t>(line.number("pid", 500)));
         platform_->pageQueries.clear();
         platform_->regionLookups = platform_->basicRegionLookups = 0;
-        auto process = std::make_shared<HTScenarioProcess>(platform_, sharedCache_);
+        platform_->loadedModuleReads = platform_->kernelImageListOpens = 0;
+        const bool kernel = script.info.pbi_flags & PROC_FLAG_SYSTEM;
+        std::shared_ptr<HTProcess> process = std::make_shared<HTScenarioProcess>(platform_, sharedCache_);
+        if (kernel) process = std::make_shared<HTKernelProcess>(platform_);
         process->setSettings(settings_);
         testing::internal::CaptureStderr();
         const bool created = process->initWithBsdInfo(script.info);
@@ -240,26 +246,43 @@ protected:
         }
         const std::string told = testing::internal::GetCapturedStderr();
         out << "gather " << process->displayString() << (created ? "" : ": not created") << "\n";
-        if (created) describe(*process, out);
+        if (created) describe(*process, out, kernel);
         for (const std::string& text : HTNoticeLog::standardError().take()) out << "notice " << text << "\n";
         for (const std::string& text : HTProcess::globalErrors()) out << "global-error " << text << "\n";
         HTProcess::_clearGlobalErrors();
         std::istringstream toldLines(told);
         for (std::string text; std::getline(toldLines, text);) out << "stderr " << text << "\n";
+        if (kernel) {
+            out << "calls: " << platform_->loadedModuleReads << " module lists, " << platform_->kernelImageListOpens
+                << " symbol resolvers\n\n";
+            return;
+        }
         out << "calls: " << platform_->regionLookups << " region, " << platform_->basicRegionLookups << " basic, "
             << platform_->ledgerTemplateReads << " template; queries";
         for (const auto& [address, size] : platform_->pageQueries) out << " " << hex(address) << "+" << hex(size);
         out << "\n\n";
     }
 
-    static void describe(HTUserProcess& process, std::ostringstream& out)
+    // Auxiliary data, a nested map's keys after its own.
+    static void describeAux(const HTAuxDataMap& data, const std::string& prefix, std::ostringstream& out)
+    {
+        for (const auto& [key, value] : data) {
+            if (auto map = std::dynamic_pointer_cast<HTAuxDataMap>(value)) {
+                out << "aux " << prefix << key << " map\n";
+                describeAux(*map, prefix + key + "/", out);
+                continue;
+            }
+            auto datum = std::dynamic_pointer_cast<HTAuxData>(value);
+            out << "aux " << prefix << key << " " << datum->value() << (datum->shouldAggregate() ? "" : " alone")
+                << "\n";
+        }
+    }
+
+    // The kernel's regions tell their record's index.
+    static void describe(HTProcess& process, std::ostringstream& out, bool kernel)
     {
         out << "idle-exit " << process.idleExitStatus() << "\n";
-        if (auto data = process.auxData())
-            for (const auto& [key, value] : *data) {
-                auto datum = std::dynamic_pointer_cast<HTAuxData>(value);
-                out << "aux " << key << " " << datum->value() << (datum->shouldAggregate() ? "" : " alone") << "\n";
-            }
+        if (auto data = process.auxData()) describeAux(*data, "", out);
         if (!process.hasMemoryRegions()) out << "no regions read\n";
         for (const auto& r : process.memoryRegions()) {
             out << "region " << (r->start() == HTNoAddress ? "none" : hex(r->start())) << " size " << hex(r->size())
@@ -273,6 +296,7 @@ protected:
                                       {r->inSharedCache(), " cache"},
                                       {r->unusedSharedCacheRegion(), " unused"}})
                 if (flag) out << word;
+            if (kernel) out << " tag " << r->user_tag();
             out << "\n  dirty " << r->dirtySize() << " swapped " << r->swappedSize() << " clean "
                 << r->cleanNonSpecSize() << " reclaimable " << r->reclaimableSize() << "\n";
             if (r->subrangeList())

@@ -18,6 +18,35 @@ private:
     int32_t pid_;
 };
 
+class HTFakeSymbolResolver : public HTKernelSymbolResolver {
+public:
+    HTFakeSymbolResolver(std::map<uint64_t, std::string> symbols, std::map<uint64_t, HTSourceInfo> sources)
+        : symbols_(std::move(symbols)), sources_(std::move(sources))
+    {
+    }
+    std::optional<std::string> symbolName(uint64_t address) override { return find(symbols_, address); }
+    std::optional<HTSourceInfo> sourceInfo(uint64_t address) override { return find(sources_, address); }
+
+private:
+    template<typename Value>
+    static std::optional<Value> find(const std::map<uint64_t, Value>& map, uint64_t address)
+    {
+        auto found = map.find(address);
+        return found == map.end() ? std::nullopt : std::optional<Value>(found->second);
+    }
+
+    std::map<uint64_t, std::string> symbols_;
+    std::map<uint64_t, HTSourceInfo> sources_;
+};
+
+// Copies `text` into a fixed name field, NUL-padded, unterminated when it
+// fills the field.
+void copyName(char* field, const std::string& text)
+{
+    std::memset(field, 0, MACH_ZONE_NAME_MAX_LEN);
+    std::memcpy(field, text.data(), std::min(text.size(), MACH_ZONE_NAME_MAX_LEN));
+}
+
 // The argument area: a 32-bit argument count, the executable path, NUL
 // padding, then the arguments, each NUL-terminated.
 std::string buildProcargs(const std::string& path, const std::vector<std::string>& arguments)
@@ -434,4 +463,46 @@ std::optional<std::string> HTFakePlatform::realpath(const std::string& path)
 {
     auto found = realpaths.find(path);
     return found == realpaths.end() ? path : found->second;
+}
+
+// --- the kernel's memory -----------------------------------------------------
+
+void HTFakePlatform::addZone(const std::string& name, const mach_zone_info_t& info)
+{
+    copyName(zoneNames.emplace_back().mzn_name, name);
+    zoneInfos.push_back(info);
+}
+
+mach_memory_info_t& HTFakePlatform::addMemoryInfo(uint64_t flags, uint64_t site, uint64_t size, const std::string& name)
+{
+    mach_memory_info_t& record = memoryInfos.emplace_back();
+    record.flags = flags;
+    record.site = site;
+    record.size = size;
+    copyName(record.name, name);
+    return record;
+}
+
+kern_return_t HTFakePlatform::mach_memory_info(std::vector<mach_zone_name_t>& names,
+                                               std::vector<mach_zone_info_t>& zones,
+                                               std::vector<mach_memory_info_t>& sites)
+{
+    if (memoryInfoResult != KERN_SUCCESS) return memoryInfoResult;
+    names = zoneNames;
+    zones = zoneInfos;
+    sites = memoryInfos;
+    return KERN_SUCCESS;
+}
+
+std::vector<HTLoadedModule> HTFakePlatform::OSKextCopyLoadedKextInfo()
+{
+    ++loadedModuleReads;
+    return loadedModules;
+}
+
+std::unique_ptr<HTKernelSymbolResolver> HTFakePlatform::openKernelImageList()
+{
+    ++kernelImageListOpens;
+    if (!hasKernelSymbols) return nullptr;
+    return std::make_unique<HTFakeSymbolResolver>(kernelSymbols, kernelSourceInfos);
 }

@@ -12,6 +12,7 @@
 #include <atomic>
 #include <cstdint>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <set>
@@ -122,6 +123,26 @@ public:
     // realpath: the mapped paths; any other path resolves to itself.
     std::map<std::string, std::string> realpaths;
 
+    // --- the kernel's memory ---------------------------------------------
+    // What mach_memory_info answers, or the code it fails with.
+    std::vector<mach_zone_name_t> zoneNames;
+    std::vector<mach_zone_info_t> zoneInfos;
+    std::vector<mach_memory_info_t> memoryInfos;
+    kern_return_t memoryInfoResult = KERN_SUCCESS;
+    std::vector<HTLoadedModule> loadedModules;
+    // The kernel's symbols and source locations by exact address; without
+    // symbols openKernelImageList answers null.
+    bool hasKernelSymbols = true;
+    std::map<uint64_t, std::string> kernelSymbols;
+    std::map<uint64_t, HTSourceInfo> kernelSourceInfos;
+    // How often the modules were listed and a symbol resolver opened.
+    int loadedModuleReads = 0;
+    int kernelImageListOpens = 0;
+    // Adds a zone, its name cut to 80 bytes (unterminated when it fills them).
+    void addZone(const std::string& name, const mach_zone_info_t& info);
+    // Adds a memory-info record; `name` is cut to 80 bytes as above.
+    mach_memory_info_t& addMemoryInfo(uint64_t flags, uint64_t site, uint64_t size, const std::string& name = "");
+
     // Every page query made, as (address, bytes), in call order. The
     // records below are written from the gathering threads, under
     // recordLock.
@@ -162,6 +183,10 @@ public:
     uint32_t geteuid() override { return euid; }
     bool isatty(int fd) override { return terminals.count(fd) != 0; }
     bool stat(const char* path) override { return existingFiles.count(path) != 0; }
+    kern_return_t mach_memory_info(std::vector<mach_zone_name_t>& names, std::vector<mach_zone_info_t>& zones,
+                                   std::vector<mach_memory_info_t>& sites) override;
+    std::vector<HTLoadedModule> OSKextCopyLoadedKextInfo() override;
+    std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() override;
 
 private:
     // The scripted region at or after the address: its index, or the
