@@ -6,6 +6,8 @@
 
 #include <gtest/gtest.h>
 
+#include <fstream>
+
 #include <algorithm>
 #include <chrono>
 #include <optional>
@@ -143,6 +145,16 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     EXPECT_EQ(pages[kFileWritten], 0);
     EXPECT_EQ(platform_.realpath("/tmp/.." + filePath_), std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
+    // Mapped files are named; anonymous memory and pseudo-paths such as "[stack]" are not.
+    char name[PATH_MAX];
+    ASSERT_EQ(platform_.proc_regionfilename(*task_, at(2), name, sizeof(name)), static_cast<int>(filePath_.size()));
+    EXPECT_EQ(std::string(name, filePath_.size()), filePath_);
+    EXPECT_EQ(platform_.proc_regionfilename(*task_, at(0), name, sizeof(name)), 0);
+    std::ifstream maps("/proc/" + std::to_string(child_->pid()) + "/maps");
+    std::string line;
+    while (std::getline(maps, line) && line.find("[stack]") == std::string::npos) continue;
+    ASSERT_NE(line.find("[stack]"), std::string::npos);
+    EXPECT_EQ(platform_.proc_regionfilename(*task_, std::stoull(line, nullptr, 16), name, sizeof(name)), 0);
 
     // Page identities are asked for page-aligned ranges inside the address space only.
     uint64_t identities[2] = {7, 7};

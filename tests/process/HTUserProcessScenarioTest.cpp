@@ -15,6 +15,7 @@
 
 #include <filesystem>
 #include <map>
+#include <optional>
 #include <sstream>
 #include <string>
 #include <vector>
@@ -27,8 +28,8 @@ const std::string kScenarios = std::string(HEFT_TEST_DATA_DIR) + "/reports/proce
 // the one way to drive the shared-cache code with live-process answers.
 class HTScenarioProcess : public HTUserProcess {
 public:
-    HTScenarioProcess(std::shared_ptr<HTPlatform> platform, bool sharedCache)
-        : HTUserProcess(std::move(platform)), sharedCache_(sharedCache)
+    HTScenarioProcess(std::shared_ptr<HTPlatform> platform, std::optional<int> platformCode)
+        : HTUserProcess(std::move(platform)), platformCode_(platformCode)
     {
     }
     // What one run remembers: the ledger template, and whether running out
@@ -37,10 +38,10 @@ public:
     using HTUserProcess::_forgetOutOfDescriptors;
 
 protected:
-    int _platformCode() override { return sharedCache_ ? 3 : HTUserProcess::_platformCode(); }
+    int _platformCode() override { return platformCode_.value_or(HTUserProcess::_platformCode()); }
 
 private:
-    bool sharedCache_;
+    std::optional<int> platformCode_;
 };
 
 // clang-format off
@@ -106,7 +107,7 @@ protected:
         forgetRun();
         platform_ = std::make_shared<HTFakePlatform>();
         settings_ = HTSettings{.breakDownPhysHeft = false};
-        sharedCache_ = false;
+        platformCode_.reset();
         std::ostringstream out;
         std::istringstream lines(contentsOf(path));
         for (std::string raw; std::getline(lines, raw);) {
@@ -152,7 +153,7 @@ protected:
     {
         settings_.breakDownPhysHeft = line.number("breakdown", settings_.breakDownPhysHeft);
         settings_.sharingAnalysisDisabled = line.number("nosharing", settings_.sharingAnalysisDisabled);
-        sharedCache_ = line.number("sharedcache", sharedCache_);
+        if (line.text("platform")) platformCode_ = static_cast<int>(valueOf(*line.text("platform")));
         platform_->pageSize = line.number("pagesize", platform_->pageSize);
         platform_->uniformRuns = line.number("uniform", platform_->uniformRuns);
     }
@@ -232,7 +233,7 @@ protected:
         platform_->regionLookups = platform_->basicRegionLookups = 0;
         platform_->loadedModuleReads = platform_->kernelImageListOpens = 0;
         const bool kernel = script.info.pbi_flags & PROC_FLAG_SYSTEM;
-        std::shared_ptr<HTProcess> process = std::make_shared<HTScenarioProcess>(platform_, sharedCache_);
+        std::shared_ptr<HTProcess> process = std::make_shared<HTScenarioProcess>(platform_, platformCode_);
         if (kernel) process = std::make_shared<HTKernelProcess>(platform_);
         process->setSettings(settings_);
         testing::internal::CaptureStderr();
@@ -312,7 +313,7 @@ protected:
     std::shared_ptr<HTFakePlatform> platform_;
     HTFakePlatform::Process* target_ = nullptr;
     HTSettings settings_;
-    bool sharedCache_ = false;
+    std::optional<int> platformCode_;
 };
 
 TEST_F(HTUserProcessScenarioTest, Scenarios)
