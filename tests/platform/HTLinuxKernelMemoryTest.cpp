@@ -2,7 +2,9 @@
 #include "output/HTExpectedReport.h"
 #include "platform/linux/HTKernelSymbolTable.h"
 #include "platform/linux/HTLinuxPlatform.h"
+#include "platform/linux/HTMeminfoParser.h"
 #include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTSlabinfoParser.h"
 
 #include <gtest/gtest.h>
 
@@ -93,8 +95,8 @@ std::array<uint64_t, 4> answerFigures(const std::vector<mach_zone_info_t>& zones
 TEST(HTLinuxKernelMemory, CapturedFilesGiveZonesSitesCountersAndNames)
 {
     // Captured on Linux 6.18 as root, trimmed; modules and allocinfo written in the kernel's formats, as are the
-    // last three vmallocinfo lines (module code, an address without symbol, an area without pages) and the
-    // kallsyms lines of module code.
+    // last four vmallocinfo lines (module code, an address without symbol, an area without caller, one without
+    // pages) and the kallsyms lines of module code.
     HTLinuxKernelMemory kernel(kCaptures, 4096);
     std::vector<mach_zone_name_t> names;
     std::vector<mach_zone_info_t> zones;
@@ -106,7 +108,7 @@ TEST(HTLinuxKernelMemory, CapturedFilesGiveZonesSitesCountersAndNames)
 
     // Slab pages once, in the zones; vmalloc pages once, in the unhidden code sites; no meminfo figure of
     // either (nor one that holds them) as a tag site; stacks are vmalloc memory here, so their tag is hidden.
-    EXPECT_EQ(answerFigures(zones, sites), (std::array<uint64_t, 4>{72531968, 1886 * 4096, 1584 * 1024, 784 * 1024}));
+    EXPECT_EQ(answerFigures(zones, sites), (std::array<uint64_t, 4>{72531968, 1887 * 4096, 1584 * 1024, 784 * 1024}));
     for (const mach_memory_info_t& site : sites) {
         if ((site.flags & VM_KERN_SITE_TYPE) != VM_KERN_SITE_TAG) continue;
         for (const char* doubled : {"Slab", "SReclaimable", "SUnreclaim", "KReclaimable", "VmallocUsed"})
@@ -115,6 +117,14 @@ TEST(HTLinuxKernelMemory, CapturedFilesGiveZonesSitesCountersAndNames)
             EXPECT_TRUE(site.flags & VM_KERN_SITE_HIDE);
         }
     }
+
+    // Only the version 2 columns are known; counts without a unit stay counts (the capture's are all 0).
+    std::vector<HTSlabCache> caches;
+    EXPECT_FALSE(htParseSlabinfo("slabinfo - version: 1.1\nkmalloc-64 1 1 64 1 1\n", caches));
+    std::vector<HTMeminfoField> fields =
+        htParseMeminfo("HugePages_Total:      12\nHugepagesize:    2048 kB\nBad: 1 MB\n");
+    ASSERT_EQ(fields.size(), 2u);
+    EXPECT_EQ(fields[0].value + fields[1].value, 12u + 2048 * 1024);
 
     std::string modules;
     for (const HTLoadedModule& module : kernel.loadedModules())
@@ -133,7 +143,7 @@ TEST(HTLinuxKernelMemory, CapturedFilesGiveZonesSitesCountersAndNames)
         EXPECT_TRUE(site.site < 64 || site.site == 0xffffffffc0a0f123) << site.name;
         codeSites.insert(site.site);
     }
-    EXPECT_EQ(codeSites.size(), 11u);
+    EXPECT_EQ(codeSites.size(), 12u);
     EXPECT_EQ(HTLinuxKernelMemory(kCaptures + "none/", 4096).memoryInfo(names, zones, sites),
               HT_KERN_ERRNO_BASE | ENOENT);
 }
@@ -157,10 +167,14 @@ TEST(HTKernelSymbolTable, NamesTheCodeAtOrBelowAnAddressUnlessAddressesAreHidden
         EXPECT_EQ(table->symbolName(address), name ? std::optional<std::string>(name) : std::nullopt) << address;
 
     // One pass finds the functions wanted: the first listed of a name, not its .cold part, module code by module.
-    HTSymbolAddresses wanted{{"bpf_prog_pack_alloc", {}}, {"nft_set_alloc [nf_tables]", {}}, {"nft_set_alloc", {}}};
+    HTSymbolAddresses wanted{{"bpf_prog_pack_alloc", {}},
+                             {"cmp_range", {}},
+                             {"nft_set_alloc [nf_tables]", {}},
+                             {"nft_set_alloc", {}}};
     table->findAddresses(wanted);
     EXPECT_EQ(wanted,
               (HTSymbolAddresses{{"bpf_prog_pack_alloc", 0xffffffff814ce810},
+                                 {"cmp_range", 0xffffffff813391d0},
                                  {"nft_set_alloc [nf_tables]", 0xffffffffc0a0e010},
                                  {"nft_set_alloc", std::nullopt}}));
     // With the addresses hidden the names are there, at 0, and name nothing.

@@ -87,7 +87,7 @@ void HTKernelSymbolTable::findAddresses(HTSymbolAddresses& wanted) const
 
 std::optional<std::string> HTKernelSymbolTable::symbolName(uint64_t address) const
 {
-    if (address == 0 || hidesAddresses_) return std::nullopt;
+    if (hidesAddresses_) return std::nullopt;
     auto above = std::upper_bound(entries_.begin(), entries_.end(), address,
                                   [](uint64_t value, const Entry& entry) { return value < entry.address; });
     if (above == entries_.begin()) return std::nullopt;

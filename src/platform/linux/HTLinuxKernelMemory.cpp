@@ -163,7 +163,8 @@ HTSymbolAddresses HTLinuxKernelMemory::findAddresses(const std::vector<HTVmalloc
 void HTLinuxKernelMemory::addZones(const std::vector<HTSlabCache>& caches, std::vector<mach_zone_name_t>& names,
                                    std::vector<mach_zone_info_t>& zones) const
 {
-    // SLUB's caches, merged ones as links to the cache they share.
+    // SLUB's caches, merged ones as links to the cache they share; other
+    // allocators have none, and no cache is collectable then.
     HTFileDescriptor slabDirectory(::open(path("sys/kernel/slab").c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     HTProcBuffer buffer;
     for (const HTSlabCache& cache : caches) {
@@ -182,7 +183,7 @@ void HTLinuxKernelMemory::addZones(const std::vector<HTSlabCache>& caches, std::
         zone.mzi_alloc_size = slabBytes;
         // Objects of a cache with reclaim accounting can be freed when
         // memory is short (dentries, inodes).
-        zone.mzi_collectable = slabDirectory.isOpen() && isCollectable(slabDirectory.get(), cache.name, buffer);
+        zone.mzi_collectable = isCollectable(slabDirectory.get(), cache.name, buffer);
         zones.push_back(zone);
     }
 }

@@ -44,7 +44,7 @@ bool htParseSlabinfo(std::string_view text, std::vector<HTSlabCache>& caches)
     while (!text.empty()) {
         std::string_view line = htTakeLine(text);
         HTSlabCache cache;
-        if (!line.starts_with('#') && parseCacheLine(line, cache)) caches.push_back(cache);
+        if (parseCacheLine(line, cache)) caches.push_back(cache);
     }
     return true;
 }

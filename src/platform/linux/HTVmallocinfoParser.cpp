@@ -29,7 +29,7 @@ std::vector<HTVmallocCaller> htParseVmallocinfo(std::string_view text)
         if (caller.starts_with("pages=")) word = caller, caller = next = {};
         while (!word.empty() && !word.starts_with("pages=")) word = htTakeWord(line);
         auto pages = htNumber<uint64_t>(word.substr(word.find('=') + 1));
-        if (word.empty() || !pages) continue;
+        if (!pages) continue;
 
         std::string function = callerFunction(caller, next);
         auto [found, added] = indexes.try_emplace(function, callers.size());
