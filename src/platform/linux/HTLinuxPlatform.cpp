@@ -143,6 +143,17 @@ int HTLinuxPlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int
 
 std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path) { return paths_.realpath(path); }
 
+kern_return_t HTLinuxPlatform::mach_memory_info(std::vector<mach_zone_name_t>& names,
+                                                std::vector<mach_zone_info_t>& zones,
+                                                std::vector<mach_memory_info_t>& sites)
+{
+    return kernel_.memoryInfo(names, zones, sites);
+}
+
+std::vector<HTLoadedModule> HTLinuxPlatform::OSKextCopyLoadedKextInfo() { return kernel_.loadedModules(); }
+
+std::unique_ptr<HTKernelSymbolResolver> HTLinuxPlatform::openKernelImageList() { return kernel_.openSymbolResolver(); }
+
 void HTLinuxPlatform::populatedRuns(HTTaskPort& task, uint64_t start, uint64_t end, std::vector<HTPageRun>& runs)
 {
     pages_.populatedRuns(task, start, end, runs);

@@ -2,13 +2,14 @@
 
 // The platform calls answered from Linux's /proc. The work lives in rooms of
 // its own, which this class owns and forwards to: the process table, the
-// status figures, the address space and its page queries, and the path
-// cache. Every call may run on any thread: reads go through per-thread
+// status figures, the address space and its page queries, the path cache
+// and the kernel's memory. Every call may run on any thread: reads go through per-thread
 // buffers and the only shared state is the /proc and /proc/kpageflags
 // descriptors and the caches. A task handle is used by one thread at a
 // time.
 
 #include "platform/HTPlatform.h"
+#include "platform/linux/HTLinuxKernelMemory.h"
 #include "platform/linux/HTLinuxMappings.h"
 #include "platform/linux/HTLinuxPageQueries.h"
 #include "platform/linux/HTLinuxPathCache.h"
@@ -64,6 +65,12 @@ public:
     // The path cache (HTLinuxPathCache.h).
     std::optional<std::string> realpath(const std::string& path) override;
 
+    // The kernel's memory (HTLinuxKernelMemory.h).
+    kern_return_t mach_memory_info(std::vector<mach_zone_name_t>& names, std::vector<mach_zone_info_t>& zones,
+                                   std::vector<mach_memory_info_t>& sites) override;
+    std::vector<HTLoadedModule> OSKextCopyLoadedKextInfo() override;
+    std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() override;
+
     std::string mach_error_string(kern_return_t code) override;
     void mach_error(const char* label, kern_return_t code) override;
     int32_t getpid() override;
@@ -77,4 +84,5 @@ private:
     HTLinuxMappings mappings_;
     HTLinuxPageQueries pages_;
     HTLinuxPathCache paths_;
+    HTLinuxKernelMemory kernel_{"/", htKernelPageSize()};
 };
