@@ -282,7 +282,7 @@ std::string HTKernelProcess::_nameForWiredInfo(const mach_memory_info_t& info, c
     std::string name = ownSiteName(info, kexts, symbolicator);
     // A site inside a zone reads like VM_KERN_MEMORY_KALLOC[zone name].
     if (zoneNames != nullptr && (info.flags & VM_KERN_SITE_ZONE) && info.zone < zoneNames->size())
-        name += "[" + std::string(nameField((*zoneNames)[info.zone].mzn_name)) + "]";
+        name.append("[").append(nameField((*zoneNames)[info.zone].mzn_name)).append("]");
     return name;
 }
 
