@@ -7,6 +7,7 @@
 #include <gtest/gtest.h>
 
 #include <fstream>
+#include <tuple>
 
 #include <algorithm>
 #include <chrono>
@@ -143,6 +144,12 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     for (uint64_t i = 0; i < kFileWritten; ++i)
         EXPECT_EQ(pages[i] & (kPresent | kExternal | kReusable), kPresent | kExternal);
     EXPECT_EQ(pages[kFileWritten], 0);
+    // The written pages are one populated run, whose pages a shared file mapping leaves to be asked one by one.
+    std::vector<HTPageRun> runs;
+    platform_.populatedRuns(*task_, at(2), at(2) + kFilePages * kPage, runs);
+    ASSERT_EQ(runs.size(), 1u);
+    EXPECT_EQ(std::tuple(runs[0].start, runs[0].end, runs[0].disposition),
+              std::tuple(at(2), at(2) + kFileWritten * kPage, 0));
     EXPECT_EQ(platform_.realpath("/tmp/.." + filePath_), std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
     // Mapped files are named; anonymous memory and pseudo-paths such as "[stack]" are not.
