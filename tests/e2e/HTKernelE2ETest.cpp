@@ -2,6 +2,7 @@
 
 #include "e2e/HTE2ESupport.h"
 
+#include <algorithm>
 #include <map>
 #include <sstream>
 #include <sys/stat.h>
@@ -62,27 +63,37 @@ struct KernelReport {
 TEST(HTKernelE2ETest, ZonesAreTheSlabCachesAndSitesCountNothingTwice)
 {
     if (geteuid() != 0) GTEST_SKIP() << "the kernel's memory needs root";
-    const auto before = slabCaches();
-    const KernelReport report(before);
-    const auto after = slabCaches();
-    // Caches change all the time on a live system: the zones' total lies between the two readings, with 1% for
-    // caches that grew and shrank again in between.
-    const uint64_t zones = total(report.zones);
-    EXPECT_GE(zones, std::min(total(before), total(after)) * 99 / 100);
-    EXPECT_LE(zones, std::max(total(before), total(after)) * 101 / 100);
-    EXPECT_GT(report.zones.size(), 50u);
-    // meminfo's Slab counts the slab pages as the page allocator charged them, slabinfo by cache; they differ by a
-    // few percent (6% on the kernel this was written on).
-    const std::string meminfo = readFile("/proc/meminfo");
-    const uint64_t slab = kernelField(meminfo, "Slab");
-    EXPECT_NEAR(static_cast<double>(zones), static_cast<double>(slab), static_cast<double>(slab) / 10);
-    // Per-CPU memory is a site of its own; slab and vmalloc memory only ever come through zones and code sites.
-    EXPECT_NEAR(static_cast<double>(report.sites.at("Percpu")), static_cast<double>(kernelField(meminfo, "Percpu")),
-                static_cast<double>(kPage));
-    for (const char* counted : {"Slab", "SReclaimable", "SUnreclaim", "VmallocUsed"})
-        EXPECT_EQ(report.sites.count(counted), 0u) << counted;
-    const rapidjson::Value* maps = member(member(processIn(report.document, 0), "auxiliary"), "Maps");
-    EXPECT_EQ(number(maps, "Slab"), slab) << "the counters are meminfo's, in bytes";
+    // Caches and counters change all the time on a live system: each check holds between the files read before
+    // and after heft (the zones' total within 1%, for caches that grew and shrank again in between) in one of ten
+    // runs, where a busy machine may move a figure and bring it back meanwhile.
+    std::map<std::string, bool> held;
+    for (int run = 0;
+         run < 10 && (held.empty() || std::any_of(held.begin(), held.end(), [](auto& c) { return !c.second; }));
+         ++run) {
+        const auto before = slabCaches();
+        const std::string meminfoBefore = readFile("/proc/meminfo");
+        const KernelReport report(before);
+        const std::string meminfoAfter = readFile("/proc/meminfo");
+        const auto after = slabCaches();
+        auto check = [&](const char* name, uint64_t value, uint64_t first, uint64_t second, uint64_t slack) {
+            held[name] = held[name] || between(value, std::min(first, second) - slack, std::max(first, second) + slack);
+        };
+        const uint64_t zones = total(report.zones);
+        check("zones", zones, total(before), total(after), zones / 100);
+        check("Percpu", report.sites.at("Percpu"), kernelField(meminfoBefore, "Percpu"),
+              kernelField(meminfoAfter, "Percpu"), 0);
+        check("Slab counter", number(member(member(processIn(report.document, 0), "auxiliary"), "Maps"), "Slab"),
+              kernelField(meminfoBefore, "Slab"), kernelField(meminfoAfter, "Slab"), 0);
+        // meminfo's Slab counts the slab pages as the page allocator charged them, slabinfo by cache; they differ
+        // by a few percent (6% on the kernel this was written on).
+        const uint64_t slab = kernelField(meminfoAfter, "Slab");
+        EXPECT_NEAR(static_cast<double>(zones), static_cast<double>(slab), static_cast<double>(slab) / 10);
+        EXPECT_GT(report.zones.size(), 50u);
+        // Slab and vmalloc memory only ever come through zones and code sites.
+        for (const char* counted : {"Slab", "SReclaimable", "SUnreclaim", "VmallocUsed"})
+            EXPECT_EQ(report.sites.count(counted), 0u) << counted;
+    }
+    for (const auto& [name, ok] : held) EXPECT_TRUE(ok) << name << " never lay between the kernel's readings";
 }
 
 TEST(HTKernelE2ETest, DentriesMadeByTheTestGrowTheDentryZoneAsSlabinfoSays)

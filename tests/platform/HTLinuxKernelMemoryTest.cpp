@@ -216,17 +216,16 @@ TEST(HTLinuxKernelMemory, LiveAnswerMatchesTheProcFilesAndNeedsRoot)
     EXPECT_EQ(status, 0) << "without root the call fails with EACCES";
 
     // Slabs come and go as other processes run, stacks with their threads: the files are read before and after
-    // the call. A figure that held still in between must match exactly, and each must hold still once in 50 tries.
-    std::array<bool, 4> matched{};
-    for (int attempt = 0; attempt < 50 && matched != std::array<bool, 4>{true, true, true, true}; ++attempt) {
+    // the call, and each figure must lie between the two readings (equal them on a quiet machine) in one of 20
+    // tries: a busy machine may move a figure and bring it back in between.
+    std::array<bool, 4> held{};
+    for (int attempt = 0; attempt < 20 && held != std::array<bool, 4>{true, true, true, true}; ++attempt) {
         const auto before = procFigures(page);
         ASSERT_EQ(platform.mach_memory_info(names, zones, sites), KERN_SUCCESS);
         const auto after = procFigures(page), answer = answerFigures(zones, sites);
-        for (size_t i = 0; i < answer.size(); ++i) {
-            if (before[i] != after[i]) continue;
-            EXPECT_EQ(answer[i], before[i]) << "figure " << i;
-            matched[i] = true;
-        }
+        for (size_t i = 0; i < answer.size(); ++i)
+            held[i] =
+                held[i] || (std::min(before[i], after[i]) <= answer[i] && answer[i] <= std::max(before[i], after[i]));
     }
-    EXPECT_EQ(matched, (std::array<bool, 4>{true, true, true, true})) << "a figure never held still";
+    EXPECT_EQ(held, (std::array<bool, 4>{true, true, true, true})) << "slab, vmalloc, stacks, per-CPU";
 }
