@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <iterator>
 #include <map>
+#include <numeric>
 #include <sstream>
 #include <sys/stat.h>
 
@@ -30,9 +31,8 @@ std::map<std::string, uint64_t> slabCaches()
 
 uint64_t total(const std::map<std::string, uint64_t>& caches)
 {
-    uint64_t sum = 0;
-    for (const auto& [name, bytes] : caches) sum += bytes;
-    return sum;
+    return std::accumulate(caches.begin(), caches.end(), uint64_t{0},
+                           [](uint64_t sum, auto& c) { return sum + c.second; });
 }
 
 // The report of `heft -j FILE 0`; the zones: what each holds, dirty and reclaimable.

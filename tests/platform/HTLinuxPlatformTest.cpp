@@ -150,6 +150,13 @@ TEST_F(HTLinuxAddressSpace, WalkAndPageQueryFindTheChildsMemory)
     ASSERT_EQ(runs.size(), 1u);
     EXPECT_EQ(std::tuple(runs[0].start, runs[0].end, runs[0].disposition),
               std::tuple(at(2), at(2) + kFileWritten * kPage, 0));
+    // Runs hold populated pages only, also across the gaps between mappings.
+    const uint64_t low = std::min(at(0), at(2)), high = std::max(at(0), at(2)) + kTouched * kPage;
+    platform_.populatedRuns(*task_, low, high, runs);
+    for (const HTPageRun& run : runs) {
+        pages = dispositions(platform_, *task_, run.start, (run.end - run.start) / kPage, result);
+        EXPECT_EQ(std::count(pages.begin(), pages.end(), 0), 0) << std::hex << run.start << "-" << run.end;
+    }
     EXPECT_EQ(platform_.realpath("/tmp/.." + filePath_), std::optional<std::string>(filePath_));
     EXPECT_EQ(platform_.realpath(filePath_ + ".missing"), std::nullopt);
     // Mapped files are named; anonymous memory and pseudo-paths such as "[stack]" are not.

@@ -219,9 +219,9 @@ protected:
         for (std::string item; std::getline(list, item, ',');) {
             const size_t star = item.find('*');
             const uint64_t count = star == std::string::npos ? 1 : std::stoull(item.substr(star + 1));
+            const int32_t kind = disposition(item.substr(0, star));
             for (uint64_t i = 0; i < count; ++i, address += platform_->pageSize)
-                if (disposition(item.substr(0, star)))
-                    target_->dispositions[address] = disposition(item.substr(0, star));
+                if (kind) target_->dispositions[address] = kind;
         }
     }
 
@@ -291,12 +291,9 @@ protected:
                 << int(r->share_mode()) << " segment " << int(r->segment()) << " "
                 << std::quoted(r->name().value_or(""));
             if (r->detailedName()) out << " " << std::quoted(*r->detailedName());
-            for (auto [flag, word] : {std::pair{r->wired(), " wired"},
-                                      {r->ownedExclusivelyByParentProcess(), " owned"},
-                                      {r->isFake(), " unmapped"},
-                                      {r->inSharedCache(), " cache"},
-                                      {r->unusedSharedCacheRegion(), " unused"}})
-                if (flag) out << word;
+            out << (r->wired() ? " wired" : "") << (r->ownedExclusivelyByParentProcess() ? " owned" : "")
+                << (r->isFake() ? " unmapped" : "") << (r->inSharedCache() ? " cache" : "")
+                << (r->unusedSharedCacheRegion() ? " unused" : "");
             if (kernel) out << " tag " << r->user_tag();
             out << "\n  dirty " << r->dirtySize() << " swapped " << r->swappedSize() << " clean "
                 << r->cleanNonSpecSize() << " reclaimable " << r->reclaimableSize() << "\n";
