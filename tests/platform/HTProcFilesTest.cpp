@@ -140,7 +140,7 @@ TEST(HTProcStatParser, FieldsOfAnyCommandNameStatesAndRefusedLines)
             EXPECT_EQ(fields, row.substr(arrow + 3)) << text;
         }
     }
-    EXPECT_EQ(rows, 9);
+    EXPECT_EQ(rows, 10);
     // A capture cut anywhere before the start time is refused, never misread.
     const std::string cat = capture("proc-stat-cat.txt");
     for (size_t length = 0; length <= cat.find(" 36232") + 1; ++length)
