@@ -44,6 +44,8 @@ TEST(HTProcArgs, LaysOutCountPathPaddingAndArguments)
         {"/usr/bin/tool", "tool\0-v\0file\0"s, 3, 24, "/usr/bin/tool\0\0\0\0\0\0\0tool\0-v\0file\0"s},
         // A process that rewrote its arguments may leave the last one unterminated; the area terminates it.
         {"/bin/d", "daemon: idle", 1, 16, "/bin/d\0\0\0\0\0\0daemon: idle\0"s},
+        // 4 + 4 + NUL = 9: the NUL alone takes the header to a second 8 bytes.
+        {"/b/d", "d\0"s, 1, 16, "/b/d\0\0\0\0\0\0\0\0d\0"s},
         // No arguments at all (a process that is exiting).
         {"/bin/d", "", 0, 16, "/bin/d\0\0\0\0\0\0"s},
     };
