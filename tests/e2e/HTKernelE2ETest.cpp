@@ -58,9 +58,8 @@ struct KernelReport {
 TEST(HTKernelE2ETest, ZonesAreTheSlabCachesAndSitesCountNothingTwice)
 {
     if (geteuid() != 0) GTEST_SKIP() << "the kernel's memory needs root";
-    // Caches and counters change all the time on a live system: each check holds between the files read before
-    // and after heft (the zones' total within 1%, for caches that grew and shrank again in between) in one of ten
-    // runs, where a busy machine may move a figure and bring it back meanwhile.
+    // Caches change all the time: each figure lies between the files read before and after heft (the zones within
+    // 1%) in one of ten runs, as a busy machine may move a figure and bring it back meanwhile.
     bool zonesHeld = false, percpuHeld = false;
     for (int run = 0; run < 10 && !(zonesHeld && percpuHeld); ++run) {
         const auto before = slabCaches();
@@ -75,12 +74,10 @@ TEST(HTKernelE2ETest, ZonesAreTheSlabCachesAndSitesCountNothingTwice)
         percpuHeld = percpuHeld ||
             between(percpu, std::min(kernelField(meminfoBefore, "Percpu"), kernelField(meminfoAfter, "Percpu")),
                     std::max(kernelField(meminfoBefore, "Percpu"), kernelField(meminfoAfter, "Percpu")));
-        // meminfo's Slab counts the slab pages as the page allocator charged them, slabinfo by cache; they differ
-        // by a few percent (6% on the kernel this was written on).
+        // meminfo's Slab counts slab pages as the page allocator charged them: a few percent more (6% here).
         const uint64_t slab = kernelField(meminfoAfter, "Slab");
         EXPECT_NEAR(static_cast<double>(zones), static_cast<double>(slab), static_cast<double>(slab) / 10);
         EXPECT_GT(report.zones.size(), 50u);
-        // Slab and vmalloc memory only ever come through zones and code sites.
         for (const char* counted : {"Slab", "SReclaimable", "SUnreclaim", "VmallocUsed"})
             EXPECT_EQ(report.sites.count(counted), 0u) << counted;
     }
