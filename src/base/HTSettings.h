@@ -35,4 +35,10 @@ struct HTSettings {
     bool verbose = false;
     // Categories keyed by short names rather than full ones.
     bool summarize = true;
+
+    // Where every live user process analysed is also saved as a snapfile;
+    // empty for nowhere. The capture names the run, so that page identities
+    // are only compared between snapfiles of one run.
+    std::string snapshotDirectory;
+    std::string snapshotCapture;
 };

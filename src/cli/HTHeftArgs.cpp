@@ -24,6 +24,7 @@ enum : int {
     OptionWired = 259,
     OptionSort = 260,
     OptionUnmapped = 261,
+    OptionSnapshotDir = 262,
 };
 
 std::string stringWithFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));
@@ -112,6 +113,7 @@ std::unique_ptr<HTHeftArgs> HTHeftArgs::initWithArgc(int argc, char** argv, HTEr
         {"swapped", no_argument, nullptr, OptionSwapped},
         {"wired", no_argument, nullptr, OptionWired},
         {"unmapped", no_argument, nullptr, OptionUnmapped},
+        {"snapshot-dir", required_argument, nullptr, OptionSnapshotDir},
         {nullptr, 0, nullptr, 0},
     };
 
@@ -177,6 +179,7 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
         break;
     case OptionVmObjectDirty:
         shouldGetPhysHeftBreakdown_ = false;
+        didSetShouldGetPhysHeftBreakdown_ = true;
         break;
     case 'w':
         textOptions_ |= HTTextOptionWired | HTTextOptionSwapped | HTTextOptionWide;
@@ -189,6 +192,10 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
         break;
     case OptionUnmapped:
         searchForUnmapped_ = true;
+        break;
+    case OptionSnapshotDir:
+        if (*argument == '\0') return fail(error, HTHeftErrorCodeOption, "--snapshot-dir needs a directory");
+        snapshotDirectory_ = argument;
         break;
     default:
         // An unknown option or a missing argument: getopt_long has already
@@ -263,6 +270,7 @@ HTSettings HTHeftArgs::settings() const
     settings.textSort = textSort_;
     settings.verbose = spanlistLikeOutput_;
     settings.summarize = summarize_;
+    settings.snapshotDirectory = snapshotDirectory_;
     return settings;
 }
 
@@ -276,5 +284,7 @@ HTTargetSelection::Request HTHeftArgs::targetRequest() const
     request.targetChildren = targetChildren_;
     request.searchForUnmapped = searchForUnmapped_;
     request.skipIdleExitClean = skipIdleExitClean_;
+    request.breakDownPhysHeft = shouldGetPhysHeftBreakdown_;
+    request.modeFixed = didSetShouldGetPhysHeftBreakdown_;
     return request;
 }

@@ -58,11 +58,14 @@ private:
     bool spanlistLikeOutput_ = false;
     bool summarize_ = true;
     bool shouldGetPhysHeftBreakdown_ = true;
+    bool didSetShouldGetPhysHeftBreakdown_ = false;
     bool searchForUnmapped_ = false;
     int64_t summaryFormat_ = HTTextFormatFormatted;
     int64_t textOptions_ = 0;
     std::string textSort_ = defaultSortColumn();
     std::optional<std::string> JSONOutputFile_;
+    // --snapshot-dir: empty when not given.
+    std::string snapshotDirectory_;
     HTProcess::PidDescriptionMap targetPids_;
     HTOrderedStringSet potentialTargetProcesses_;
     HTOrderedStringSet excludedPidsOrProcesses_;

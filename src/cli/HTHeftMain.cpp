@@ -2,6 +2,7 @@
 
 #include "analysis/HTHeft.h"
 #include "base/HTNoticeLog.h"
+#include "base/HTOutputFile.h"
 #include "cli/HTCancelHandler.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
@@ -11,6 +12,7 @@
 #include "process/HTTargetSelection.h"
 
 #include <cerrno>
+#include <chrono>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -68,6 +70,24 @@ void gather(HTHeft& heft, HTPlatform& platform)
     tellNotices();
 }
 
+// Checks that snapfiles can be written where --snapshot-dir says, and names
+// the capture they will share.
+bool prepareSnapshots(HTSettings& settings, HTPlatform& platform)
+{
+    if (auto problem = HTOutputFile::directoryProblem(settings.snapshotDirectory)) {
+        std::fprintf(stderr, "Unable to save snapfiles in %s: %s\n", settings.snapshotDirectory.c_str(),
+                     problem->c_str());
+        return false;
+    }
+    const auto now = std::chrono::system_clock::now().time_since_epoch();
+    char capture[64];
+    std::snprintf(capture, sizeof(capture), "%llx-%d",
+                  static_cast<unsigned long long>(std::chrono::duration_cast<std::chrono::nanoseconds>(now).count()),
+                  platform.getpid());
+    settings.snapshotCapture = capture;
+    return true;
+}
+
 // The run itself; `stage` says what it is doing, for a message if memory
 // runs out.
 int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone, const char*& stage)
@@ -77,12 +97,13 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
     std::unique_ptr<HTHeftArgs> args = HTHeftArgs::initWithArgc(argc, argv, &error);
     if (!args) return reportArgumentError(error);
 
-    const HTSettings settings = args->settings();
+    HTSettings settings = args->settings();
 
     if (needsRoot(*args) && platform->geteuid() != 0) {
         std::fprintf(stderr, "Must run as root.\n");
         return 1;
     }
+    if (!settings.snapshotDirectory.empty() && !prepareSnapshots(settings, *platform)) return 1;
 
     stage = "listing the processes";
     HTTargetSelection selection(platform, settings, args->targetRequest());
@@ -100,6 +121,8 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
         return 1;
     }
 
+    // Snapfiles read fix the analysis mode.
+    settings.breakDownPhysHeft = selection.breakDownPhysHeft();
     auto jsonFormatter = openJSONFormatter(*args, settings, *platform);
     // A report that could not be written whole ends the run in failure.
     int status = args->JSONOutputFile() && !jsonFormatter ? 1 : 0;

@@ -77,11 +77,6 @@ public:
     // nothing (null).
     void JSONForAuxData(const HTAuxDataType* value);
 
-    // The text as it goes into the document: unchanged when it is valid
-    // UTF-8, otherwise a copy in `scratch` with every byte that belongs to
-    // no well-formed sequence replaced by U+FFFD.
-    static std::string_view validUTF8(std::string_view text, std::string& scratch);
-
 private:
     struct Writer;
 

@@ -187,6 +187,10 @@ public:
     virtual std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() { return nullptr; }
 
     // --- the calling program -------------------------------------------
+    // The system and its architecture, as a snapfile names them ("Linux
+    // 6.1.0-26-amd64 x86_64").
+    virtual std::string systemDescription() { return "unknown"; }
+
     virtual int32_t getpid() = 0;
     virtual uint32_t geteuid() = 0;
     virtual bool isatty(int fd) = 0;

@@ -66,55 +66,53 @@ kern_return_t HTPageRunWalker::enumerateDispositionChunks(uint64_t start, uint64
     return KERN_SUCCESS;
 }
 
-kern_return_t HTPageRunWalker::walkPages(const HTMemoryRegion& region, const PageTargets& targets,
-                                         int32_t purgeState) const
+kern_return_t HTPageRunWalker::readPages(uint64_t start, uint64_t pages, bool identify,
+                                         const PageChunkCallback& chunk) const
 {
-    const uint64_t page = pageSize_;
+    uint64_t identities[kDispositionChunkPages];
+    return enumerateDispositionChunks(
+        start, pages, true, [&](const int32_t* dispositions, int32_t uniform, uint64_t filled, uint64_t first) {
+            const bool named = identify && dispositions != nullptr &&
+                platform_.sharedPageIdentities(task_, start + first * pageSize_, filled, identities) == KERN_SUCCESS;
+            chunk(PageChunk{dispositions, uniform, filled, first, named ? identities : nullptr});
+        });
+}
+
+kern_return_t HTPageRunWalker::walkPages(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState,
+                                         uint64_t page, const PageReader& reader)
+{
     const uint64_t from = htRoundDown(region.start(), page);
     const uint64_t pages = (htRoundUp(region.end(), page) - from) / page;
     HTSharedPageList* list = targets.identify && targets.pages ? &targets.pages->makeSharedPageList() : nullptr;
     HTSubrangeBuilder runs(list ? nullptr : targets.pages, page);
     HTSubrangeBuilder fileRuns(targets.filePages, page);
     const bool separateCopies = targets.filePages != nullptr || targets.copiesOnly;
-    uint64_t identities[kDispositionChunkPages];
-    // A run of pages of one disposition, which the kernel knows to hold no
-    // page another process maps privately.
-    auto addUniformRun = [&](uint64_t first, uint64_t count, int32_t disposition) {
+    // Hands one page, or a run of pages of one disposition, to its target.
+    // A uniform run is one the reader knows to hold no page another process
+    // maps privately: its pages have no identity.
+    auto addRun = [&](uint64_t first, uint64_t count, int32_t disposition, const uint64_t* identity) {
         const HTPageKind kind = pageKind(disposition, purgeState);
         if (kind == HTPageKind::None) return;
+        // In a private file mapping the file's own pages and the mapping's
+        // copies belong to different objects.
         if (separateCopies && (disposition & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
             fileRuns.addRun(targets.filePages ? targets.filePages->offset() + first * page : 0, count * page, kind);
         } else if (list) {
             for (uint64_t index = first; index < first + count; ++index)
-                list->addPage(static_cast<uint32_t>(index), kind, 0);
+                list->addPage(static_cast<uint32_t>(index), kind, identity ? *identity : 0);
         } else {
             runs.addRun(targets.pages->offset() + first * page, count * page, kind);
         }
     };
 
-    return enumerateDispositionChunks(
-        from, pages, true, [&](const int32_t* dispositions, int32_t uniform, uint64_t filled, uint64_t first) {
-            if (dispositions == nullptr) {
-                addUniformRun(first, filled, uniform);
-                return;
-            }
-            const bool named =
-                list && platform_.sharedPageIdentities(task_, from + first * page, filled, identities) == KERN_SUCCESS;
-            for (uint64_t i = 0; i < filled; ++i) {
-                const HTPageKind kind = pageKind(dispositions[i], purgeState);
-                if (kind == HTPageKind::None) continue;
-                // In a private file mapping the file's own pages and the
-                // mapping's copies belong to different objects.
-                const uint64_t index = first + i;
-                if (separateCopies && (dispositions[i] & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
-                    fileRuns.add(targets.filePages ? targets.filePages->offset() + index * page : 0, kind);
-                } else if (list) {
-                    list->addPage(static_cast<uint32_t>(index), kind, named ? identities[i] : 0);
-                } else {
-                    runs.add(targets.pages->offset() + index * page, kind);
-                }
-            }
-        });
+    return reader(from, pages, list != nullptr, [&](const PageChunk& chunk) {
+        if (chunk.dispositions == nullptr) {
+            addRun(chunk.firstPage, chunk.count, chunk.uniform, nullptr);
+            return;
+        }
+        for (uint64_t i = 0; i < chunk.count; ++i)
+            addRun(chunk.firstPage + i, 1, chunk.dispositions[i], chunk.identities ? &chunk.identities[i] : nullptr);
+    });
 }
 
 uint64_t HTPageRunWalker::fileSegmentIdentity(uint64_t objectId, uint64_t offset)

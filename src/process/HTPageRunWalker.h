@@ -24,6 +24,25 @@ public:
     using DispositionChunkCallback =
         std::function<void(const int32_t* dispositions, int32_t uniform, uint64_t count, uint64_t firstPage)>;
 
+    // One stretch of pages as a page query answers it: a disposition per
+    // page (null when every page has the disposition `uniform`) and, when
+    // asked for, an identity per page (null when none could be had).
+    struct PageChunk {
+        const int32_t* dispositions;
+        int32_t uniform;
+        uint64_t count;
+        // The index of the first page in the pages asked for.
+        uint64_t firstPage;
+        const uint64_t* identities;
+    };
+    using PageChunkCallback = std::function<void(const PageChunk&)>;
+    // Reads `pages` pages from the page-aligned `start` in chunks, with
+    // identities when `identify`; KERN_SUCCESS, or the code of the query
+    // that failed (the chunks before it were handed on). Stretches known to
+    // hold nothing may be left out.
+    using PageReader =
+        std::function<kern_return_t(uint64_t start, uint64_t pages, bool identify, const PageChunkCallback&)>;
+
     // Page dispositions are queried in chunks of at most this many pages.
     static constexpr uint64_t kDispositionChunkPages = 4096;
 
@@ -56,10 +75,14 @@ public:
     kern_return_t enumerateDispositionChunks(uint64_t start, uint64_t pages, bool populatedOnly,
                                              const DispositionChunkCallback& block) const;
 
-    // Queries the dispositions of every page of the region and hands each
-    // populated page to its target; the runs found before a failed query
-    // stay.
-    kern_return_t walkPages(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState) const;
+    // The live process's pages, read through its task port.
+    kern_return_t readPages(uint64_t start, uint64_t pages, bool identify, const PageChunkCallback& chunk) const;
+
+    // Reads the dispositions of every page of the region with `reader` and
+    // hands each populated page to its target; the runs found before a
+    // failed query stay.
+    static kern_return_t walkPages(const HTMemoryRegion& region, const PageTargets& targets, int32_t purgeState,
+                                   uint64_t pageSize, const PageReader& reader);
 
     // The kind a page of this disposition counts as, in memory of this
     // purgeable state.

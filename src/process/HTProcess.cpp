@@ -37,7 +37,7 @@ bool HTProcess::initWithBsdInfo(const proc_bsdinfo& info)
     is64bit_ = (info.pbi_flags & PROC_FLAG_LP64) != 0;
     // Named first, so that a process that cannot be opened is named in what
     // is said about it.
-    name_ = _nameForBsdInfo(*platform_, info);
+    name_ = _nameForProcess(info);
     char display[512];
     std::snprintf(display, sizeof(display), "%s [%d]", name_.c_str(), pid_);
     displayString_ = display;
@@ -45,6 +45,8 @@ bool HTProcess::initWithBsdInfo(const proc_bsdinfo& info)
     pageSize_ = _gatherPageSize();
     return true;
 }
+
+std::string HTProcess::_nameForProcess(const proc_bsdinfo& info) { return _nameForBsdInfo(*platform_, info); }
 
 bool HTProcess::_populateTask() { return false; }
 

@@ -42,6 +42,8 @@ public:
     virtual bool initWithBsdInfo(const proc_bsdinfo& info);
 
     // --- overridable behaviour -----------------------------------------
+    // The name the process is known by; from its record for a live one.
+    virtual std::string _nameForProcess(const proc_bsdinfo& info);
     virtual bool _populateTask();
     virtual uint64_t _gatherPageSize();
     virtual void gatherData();

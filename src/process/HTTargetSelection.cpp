@@ -1,10 +1,13 @@
 #include "process/HTTargetSelection.h"
 
+#include <algorithm>
 #include <cstdio>
 
 HTTargetSelection::HTTargetSelection(std::shared_ptr<HTPlatform> platform, const HTSettings& settings, Request request)
-    : platform_(std::move(platform)), discovery_(platform_, settings), request_(std::move(request))
+    : platform_(std::move(platform)), settings_(settings), discovery_(platform_, settings), request_(std::move(request))
 {
+    // Until something fixes it, the mode is the run's.
+    if (!request_.modeFixed) request_.breakDownPhysHeft = settings_.breakDownPhysHeft;
 }
 
 std::optional<HTTargetSelection::ProcessList> HTTargetSelection::targetProcessesAndError(HTError* error)
@@ -12,11 +15,13 @@ std::optional<HTTargetSelection::ProcessList> HTTargetSelection::targetProcesses
     if (error) *error = HTError();
     HTProcess::ProcessMap result;
 
-    // Snapfile pass: operands that name existing files are opened as
-    // snapfiles before anything else, and their processes enter `result`.
-    // Until heft reads snapfiles, every operand goes on to process discovery.
-
-    if (request_.targetPids.empty() && request_.potentialTargetProcesses.empty() && result.empty() &&
+    if (!_openSnapfiles(error)) return std::nullopt;
+    // Live processes are read in the mode the snapfiles were gathered in.
+    if (settings_.breakDownPhysHeft != request_.breakDownPhysHeft) {
+        settings_.breakDownPhysHeft = request_.breakDownPhysHeft;
+        discovery_ = HTProcessDiscovery(platform_, settings_);
+    }
+    if (request_.targetPids.empty() && request_.potentialTargetProcesses.empty() && snapfiles_.empty() &&
         !request_.targetAll) {
         if (error)
             *error =
@@ -35,8 +40,10 @@ std::optional<HTTargetSelection::ProcessList> HTTargetSelection::targetProcesses
         // After the exclusions on purpose: -t reaches every descendant, even
         // an excluded one.
         if (request_.targetChildren) _addDescendantsOfTargets();
+        // The search for unmapped memory reads live processes only.
         if (request_.searchForUnmapped) result = _hiddenProcessesForUnmapped(excluded);
         _addTargetProcesses(result);
+        if (!request_.searchForUnmapped) _addSnapfileProcesses(result);
     }
     if (request_.skipIdleExitClean) result = HTProcessDiscovery::removeIdleExitCleanProcessesFrom(result);
 
@@ -44,6 +51,76 @@ std::optional<HTTargetSelection::ProcessList> HTTargetSelection::targetProcesses
     processes.reserve(result.size());
     for (const auto& entry : result) processes.push_back(entry.second);
     return processes;
+}
+
+// Operands that name existing files are opened as snapfiles before anything
+// else; a file that is no snapfile may still be a process's name.
+bool HTTargetSelection::_openSnapfiles(HTError* error)
+{
+    std::vector<std::string> remaining;
+    for (const std::string& operand : request_.potentialTargetProcesses) {
+        if (!platform_->stat(operand.c_str())) {
+            remaining.push_back(operand);
+            continue;
+        }
+        HTError snapfileError;
+        auto process = HTSnapfileProcess::processWithSnapfile(platform_, settings_, operand, &snapfileError);
+        if (process) {
+            if (request_.modeFixed && request_.breakDownPhysHeft != process->breakDownPhysHeft()) {
+                if (error)
+                    *error = HTError(HTHeftErrorDomain, HTHeftErrorCodeSnapfileMode,
+                                     "Snapfile was gathered with an analysis mode that conflicts with other "
+                                     "snapfiles or command line arguments: " +
+                                         operand);
+                return false;
+            }
+            request_.breakDownPhysHeft = process->breakDownPhysHeft();
+            request_.modeFixed = true;
+            snapfiles_.emplace_back(operand, std::move(process));
+            continue;
+        }
+        auto pids = discovery_.pidsForStringDescriptions({operand}, nullptr);
+        if (!pids || pids->empty()) {
+            if (error)
+                *error = HTError(HTHeftErrorDomain, HTHeftErrorCodeSnapfileOpen,
+                                 "Error opening snapfile " + operand + ": " + snapfileError.description.value_or(""));
+            return false;
+        }
+        const auto& [pid, name] = *pids->begin();
+        request_.targetPids.set(pid, name);
+    }
+    request_.potentialTargetProcesses = std::move(remaining);
+    return true;
+}
+
+// Snapfiles join the live targets. The analysis knows a process by its pid:
+// a snapfile whose pid another target has already is left out, and pages
+// shared after a fork are matched only between snapfiles of one capture.
+void HTTargetSelection::_addSnapfileProcesses(HTProcess::ProcessMap& result) const
+{
+    std::set<std::string> captures;
+    for (const auto& entry : snapfiles_) captures.insert(entry.second->capture());
+    if (captures.size() > 1)
+        std::fprintf(stderr,
+                     "The snapfiles come from %zu captures: pages shared after a fork are told apart only "
+                     "within one, and counted as each process's own\n",
+                     captures.size());
+    // In the order of their pids, as a run over every live process takes
+    // them (a shell's glob sorts "a.10000" before "a.9999").
+    auto sorted = snapfiles_;
+    std::stable_sort(sorted.begin(), sorted.end(),
+                     [](const auto& a, const auto& b) { return a.second->pid() < b.second->pid(); });
+    for (const auto& [path, process] : sorted) {
+        if (const auto* other = result.find(process->pid())) {
+            std::fprintf(stderr,
+                         "Leaving out snapfile %s: its process has pid %d, as %s has; analyse them in "
+                         "separate runs\n",
+                         path.c_str(), process->pid(), (*other)->displayString().c_str());
+            continue;
+        }
+        process->setIgnoresPageIdentities(captures.size() > 1);
+        result.set(process->pid(), process);
+    }
 }
 
 std::set<int32_t> HTTargetSelection::_excludedPids() const

@@ -5,12 +5,14 @@
 #include "platform/HTPlatform.h"
 #include "process/HTProcess.h"
 #include "process/HTProcessDiscovery.h"
+#include "process/HTSnapfileProcess.h"
 
 #include <cstdint>
 #include <memory>
 #include <optional>
 #include <set>
 #include <string>
+#include <utility>
 #include <vector>
 
 // Turns the pids, names and exclusions a command line gives into the
@@ -32,6 +34,10 @@ public:
         bool searchForUnmapped = false;
         bool skipIdleExitClean = false;
         bool excludeSelf = true;
+        // The analysis mode, and whether the command line or a snapfile has
+        // fixed it: every snapfile must then have been gathered in it.
+        bool breakDownPhysHeft = true;
+        bool modeFixed = false;
     };
 
     HTTargetSelection(std::shared_ptr<HTPlatform> platform, const HTSettings& settings, Request request);
@@ -44,16 +50,24 @@ public:
     // The pids named, after the names were resolved, the exclusions taken
     // out and the descendants added.
     const HTProcess::PidDescriptionMap& targetPids() const { return request_.targetPids; }
+    // The analysis mode once the snapfiles are open: theirs, if any fixed
+    // it.
+    bool breakDownPhysHeft() const { return request_.breakDownPhysHeft; }
 
 private:
     // Target selection, in the order it runs.
+    bool _openSnapfiles(HTError* error);
     std::set<int32_t> _excludedPids() const;
     void _resolvePotentialTargets();
     void _addDescendantsOfTargets();
     HTProcess::ProcessMap _hiddenProcessesForUnmapped(const std::set<int32_t>& excluded) const;
     void _addTargetProcesses(HTProcess::ProcessMap& result) const;
+    void _addSnapfileProcesses(HTProcess::ProcessMap& result) const;
 
     std::shared_ptr<HTPlatform> platform_;
+    HTSettings settings_;
     HTProcessDiscovery discovery_;
     Request request_;
+    // The snapfiles opened, in the order given, with their paths.
+    std::vector<std::pair<std::string, std::shared_ptr<HTSnapfileProcess>>> snapfiles_;
 };

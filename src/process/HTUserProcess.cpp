@@ -5,8 +5,10 @@
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
+#include "platform/HTSnapshotGraphWriter.h"
 #include "process/HTImage.h"
 #include "process/HTImageEnumerator.h"
+#include "process/HTSnapshotRecorder.h"
 
 #include <algorithm>
 #include <atomic>
@@ -393,11 +395,28 @@ bool HTUserProcess::_populateMemoryRegionWithPageQueries(const std::shared_ptr<H
     return _checkPageQuery(sharedCache_->measurePiece(region, HTPageRunWalker(platform(), *task_, pageSize())));
 }
 
+kern_return_t HTUserProcess::_readPages(uint64_t start, uint64_t pages, bool identify,
+                                        const HTPageRunWalker::PageChunkCallback& chunk)
+{
+    HT_ASSERT(kModule, task_ != nullptr, "task_ != nullptr");
+    const HTPageRunWalker walker(platform(), *task_, pageSize());
+    if (!recorder_) return walker.readPages(start, pages, identify, chunk);
+    return walker.readPages(start, pages, identify, [&](const HTPageRunWalker::PageChunk& pageChunk) {
+        recorder_->addPages(pageChunk);
+        chunk(pageChunk);
+    });
+}
+
+bool HTUserProcess::_canIdentifySharedPages() { return platform().canIdentifySharedPages(); }
+
 void HTUserProcess::_walkPagesOfRegion(const HTMemoryRegion& region, const HTPageRunWalker::PageTargets& targets,
                                        int32_t purgeState)
 {
-    HT_ASSERT(kModule, task_ != nullptr, "task_ != nullptr");
-    _checkPageQuery(HTPageRunWalker(platform(), *task_, pageSize()).walkPages(region, targets, purgeState));
+    _checkPageQuery(HTPageRunWalker::walkPages(
+        region, targets, purgeState, pageSize(),
+        [this](uint64_t start, uint64_t pages, bool identify, const HTPageRunWalker::PageChunkCallback& chunk) {
+            return _readPages(start, pages, identify, chunk);
+        }));
 }
 
 void HTUserProcess::_addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState)
@@ -417,8 +436,10 @@ void HTUserProcess::_measurePages(HTMemoryRegion& region, HTMemoryRegion* copies
     // named page by page so that the analysis counts each page once.
     const bool mayShare = !sharingDisabled && !hidden && info.ref_count > 1 && info.share_mode == SM_COW &&
         (copies != nullptr || info.external_pager == 0) && region.size() / page < HTSharedPageList::kNoIdentity;
-    const bool identify = mayShare && platform().canIdentifySharedPages();
+    const bool walkable = _canWalkPages();
+    const bool identify = mayShare && walkable && _canIdentifySharedPages();
     if (mayShare && !identify) sharedPagesUnidentified_ = true;
+    if (!walkable) return;
 
     if (copies == nullptr && !identify) {
         if (subranges && region.eligibleForSubrangesUsingPageSize(page)) _addSubrangesForRegion(region, purgeState);
@@ -441,10 +462,42 @@ void HTUserProcess::gatherData()
         _gatherImageData();
         _gatherPhysHeft();
         ownedVmObjects_ = _gatherOwnedVmObjects();
+        if (!settings().snapshotDirectory.empty() && _isAlive())
+            recorder_ = std::make_unique<HTSnapshotRecorder>(pageSize());
     }
     _gatherMemoryData();
     images_.clear();
     images_.shrink_to_fit();
+    if (recorder_) _saveSnapshot();
+}
+
+void HTUserProcess::_saveSnapshot()
+{
+    const std::unique_ptr<HTSnapshotRecorder> recorder = std::move(recorder_);
+    const std::string path = settings().snapshotDirectory + "/" + HTSnapshotRecorder::fileName(name(), pid());
+    // A process that went away or could not be read whole is not saved: a
+    // snapfile holds a whole address space or nothing.
+    if (!errors().empty() || !warnings().empty()) {
+        HTNoticeLog::standardError().add("%s: not saved as a snapfile, as it was not read whole", pid(),
+                                         displayString());
+        return;
+    }
+    HTSnapshotGraph& graph = recorder->graph();
+    graph.snapshotIs64Bit = is64bit();
+    graph.snapshotPid = pid();
+    graph.snapshotProcessName = name();
+    graph.snapshotProcessDescription = platform().systemDescription();
+    graph.snapshotPageSize = static_cast<uint32_t>(pageSize());
+    graph.snapshotPhysHeft = phys_heft_;
+    graph.snapshotPhysHeftPeak = phys_heft_peak_;
+    graph.snapshotShowsPhysHeft = breakDownPhysHeft();
+    graph.snapshotIdentifiesSharedPages = _canIdentifySharedPages();
+    graph.snapshotPageTableSize = ledgers_[0];
+    graph.snapshotCapture = settings().snapshotCapture;
+    std::string errorText;
+    if (!HTSnapshotGraphWriter::writeToPath(graph, path, &errorText))
+        HTNoticeLog::standardError().add("%s: not saved as a snapfile: " + path + ": " + errorText, pid(),
+                                         displayString());
 }
 
 void HTUserProcess::_gatherMemoryData()
@@ -465,7 +518,7 @@ void HTUserProcess::_gatherMemoryData()
 
     enumerateRegions([&](uint64_t start, uint64_t size, const vm_region_submap_info_64& info, int32_t purgeState,
                          const std::optional<std::string>& path) -> bool {
-        if (start >= sharedRegionBase_ && start - sharedRegionBase_ < sharedRegionSize_) {
+        if (_isInSharedRegion(start)) {
             if (hidden) return false;
             if (!sharedCache_->addRegions(regions, start, size, info, enumerator, measurePiece)) {
                 // The failed page query has told of a process that went
@@ -532,6 +585,10 @@ void HTUserProcess::_gatherMemoryData()
             region->setName(HTMemoryRegion::categoryNameForTag(info.user_tag));
             if (breakDown) owned.chargeAnonymousRegion(*region, info, purgeState);
         }
+
+        if (recorder_)
+            recorder_->addRegion(start, size, info, purgeState, region->detailedName().value_or(""),
+                                 region->name().value_or(""));
 
         std::shared_ptr<HTMemoryRegion> copies;
         if (linux && info.external_pager != 0 && info.inheritance != VM_INHERIT_SHARE &&

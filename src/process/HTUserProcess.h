@@ -16,6 +16,7 @@
 class HTImage;
 class HTImageEnumerator;
 class HTMemoryRegion;
+class HTSnapshotRecorder;
 
 // A live user-space process, read through its task port. Creation opens the
 // port and reads the first figures (physical heft, page-table ledger,
@@ -72,6 +73,13 @@ protected:
 
     // The platform code whose shared region the process maps.
     virtual int _platformCode();
+    // Whether `address` lies in the shared region.
+    bool _isInSharedRegion(uint64_t address) const
+    {
+        return address >= sharedRegionBase_ && address - sharedRegionBase_ < sharedRegionSize_;
+    }
+    // Whether the pages of the region being walked can be read.
+    virtual bool _canWalkPages() { return true; }
     // Sets the shared region from the platform code; false, with a message
     // on standard error, for a code it does not know.
     bool _setSharedRegionFromPlatform(int platformCode);
@@ -83,6 +91,12 @@ protected:
                                                       const vm_region_submap_info_64& info);
     // Breaks the region into runs of pages of one kind.
     virtual void _addSubrangesForRegion(HTMemoryRegion& region, int32_t purgeState);
+    // Reads the dispositions of `pages` pages from `start` (see
+    // HTPageRunWalker::PageReader); a live process asks its task port.
+    virtual kern_return_t _readPages(uint64_t start, uint64_t pages, bool identify,
+                                     const HTPageRunWalker::PageChunkCallback& chunk);
+    // Whether the pages that processes share after a fork can be named.
+    virtual bool _canIdentifySharedPages();
     // Measures the region's pages where the kernel's counts do not say
     // enough: runs of one kind, the file's pages apart from the copies of a
     // private file mapping, and the identities of pages shared after a fork.
@@ -120,6 +134,15 @@ protected:
     // Builds memoryRegions from the walk, the owned objects and the ledger.
     void _gatherMemoryData();
 
+    // For subclasses that read the figures elsewhere.
+    void _setPhysHeft(uint64_t heft, uint64_t peak)
+    {
+        phys_heft_ = heft;
+        phys_heft_peak_ = peak;
+    }
+    void _setPageTableSize(uint64_t bytes) { ledgers_[0] = bytes; }
+    std::vector<std::shared_ptr<HTImage>>& _images() { return images_; }
+
 private:
     // Reports a failed region look-up and ends the walk's data there.
     void _bailOutOfWalk(kern_return_t code);
@@ -129,6 +152,8 @@ private:
                             int32_t purgeState);
     // Records a failed page query; returns false for one, true for success.
     bool _checkPageQuery(kern_return_t result);
+    // Writes the snapfile of what was gathered, unless the gathering failed.
+    void _saveSnapshot();
 
     std::shared_ptr<HTTaskPort> task_;
     uint64_t sharedRegionBase_ = 0;
@@ -142,4 +167,6 @@ private:
     // Made when the page size is known, at the start of a gathering.
     std::optional<HTSharedCacheSlicer> sharedCache_;
     bool sharedPagesUnidentified_ = false;
+    // Set while a gathering is being saved as a snapfile.
+    std::unique_ptr<HTSnapshotRecorder> recorder_;
 };

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <cstring>
 #include <sys/stat.h>
+#include <sys/utsname.h>
 #include <unistd.h>
 
 int HTLinuxPlatform::proc_listallpids(int32_t* buffer, int bufferSize)
@@ -114,6 +115,13 @@ kern_return_t HTLinuxPlatform::mach_vm_page_range_query(HTTaskPort& task, uint64
 }
 
 bool HTLinuxPlatform::canIdentifySharedPages() { return pages_.canIdentifySharedPages(); }
+
+std::string HTLinuxPlatform::systemDescription()
+{
+    struct utsname names {};
+    if (::uname(&names) != 0) return "Linux";
+    return std::string(names.sysname) + " " + names.release + " " + names.machine;
+}
 
 kern_return_t HTLinuxPlatform::sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
                                                     uint64_t* identities)

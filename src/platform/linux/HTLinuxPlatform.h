@@ -50,6 +50,7 @@ public:
     kern_return_t mach_vm_page_range_query(HTTaskPort& task, uint64_t address, uint64_t size, int32_t* dispositions,
                                            uint64_t* count) override;
     bool canIdentifySharedPages() override;
+    std::string systemDescription() override;
     kern_return_t sharedPageIdentities(HTTaskPort& task, uint64_t address, uint64_t pages,
                                        uint64_t* identities) override;
     int proc_regionfilename(HTTaskPort& task, uint64_t address, char* buffer, uint32_t bufferSize) override;

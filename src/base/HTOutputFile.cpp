@@ -1,5 +1,6 @@
-#include "output/HTOutputFile.h"
+#include "base/HTOutputFile.h"
 
+#include <atomic>
 #include <cerrno>
 #include <csignal>
 #include <cstdlib>
@@ -13,13 +14,18 @@ namespace {
 
 std::string errorFor(int error) { return std::strerror(error); }
 
-// The temporary file being written, for a signal that ends the program to
-// remove; empty when there is none. One report file is written at a time.
-char pendingTemporary[4096];
+// The temporary files being written, for a signal that ends the program to
+// remove. Reports are written one at a time, snapfiles one per gathering
+// thread: a slot is taken while a file is open and freed when it is done.
+constexpr int kPendingSlots = 64;
+constexpr size_t kPendingPathLength = 4096;
+char pendingTemporaries[kPendingSlots][kPendingPathLength];
+std::atomic<bool> slotTaken[kPendingSlots];
 
 void removePendingAndDie(int signal)
 {
-    if (pendingTemporary[0] != '\0') ::unlink(pendingTemporary);
+    for (auto& pending : pendingTemporaries)
+        if (pending[0] != '\0') ::unlink(pending);
     ::signal(signal, SIG_DFL);
     ::raise(signal);
 }
@@ -41,13 +47,20 @@ void removeTemporaryOnFatalSignals()
     }
 }
 
-void forgetTemporary() { pendingTemporary[0] = '\0'; }
+void forgetTemporary(int slot)
+{
+    if (slot < 0) return;
+    pendingTemporaries[slot][0] = '\0';
+    slotTaken[slot].store(false);
+}
 
 // Creates the temporary file from `pattern` with those signals held back,
 // so that none can end the program between the file's creation and its
-// name being recorded for removal.
-int createTemporary(std::string& pattern)
+// name being recorded for removal; `slot` is where it was recorded (-1
+// when every slot was taken or the name is too long).
+int createTemporary(std::string& pattern, int& slot)
 {
+    slot = -1;
     removeTemporaryOnFatalSignals();
     sigset_t fatal;
     sigset_t previous;
@@ -55,8 +68,12 @@ int createTemporary(std::string& pattern)
     for (int signal : kFatalSignals) ::sigaddset(&fatal, signal);
     ::pthread_sigmask(SIG_BLOCK, &fatal, &previous);
     int fd = ::mkostemp(pattern.data(), O_CLOEXEC);
-    if (fd >= 0 && pattern.size() < sizeof(pendingTemporary))
-        std::memcpy(pendingTemporary, pattern.c_str(), pattern.size() + 1);
+    for (int i = 0; fd >= 0 && pattern.size() < kPendingPathLength && i < kPendingSlots; ++i) {
+        if (slotTaken[i].exchange(true)) continue;
+        std::memcpy(pendingTemporaries[i], pattern.c_str(), pattern.size() + 1);
+        slot = i;
+        break;
+    }
     const int error = errno;
     ::pthread_sigmask(SIG_SETMASK, &previous, nullptr);
     errno = error;
@@ -73,8 +90,8 @@ mode_t newFileMode()
 
 }  // namespace
 
-HTOutputFile::HTOutputFile(std::string path, std::string temporaryPath, std::FILE* stream)
-    : path_(std::move(path)), temporaryPath_(std::move(temporaryPath)), stream_(stream)
+HTOutputFile::HTOutputFile(std::string path, std::string temporaryPath, std::FILE* stream, int slot)
+    : path_(std::move(path)), temporaryPath_(std::move(temporaryPath)), stream_(stream), slot_(slot)
 {
 }
 
@@ -92,7 +109,7 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
             *errorText = errorFor(errno);
             return nullptr;
         }
-        return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, "", stream));
+        return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, "", stream, -1));
     }
     // A file heft may not write keeps its content, as a plain open would.
     if (exists && ::access(path.c_str(), W_OK) != 0) {
@@ -100,7 +117,8 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
         return nullptr;
     }
     std::string temporary = path + ".XXXXXX";
-    int fd = createTemporary(temporary);
+    int slot = -1;
+    int fd = createTemporary(temporary, slot);
     if (fd < 0) {
         *errorText = errorFor(errno);
         return nullptr;
@@ -111,10 +129,19 @@ std::unique_ptr<HTOutputFile> HTOutputFile::open(const std::string& path, std::s
         *errorText = errorFor(errno);
         ::close(fd);
         ::unlink(temporary.c_str());
-        forgetTemporary();
+        forgetTemporary(slot);
         return nullptr;
     }
-    return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, std::move(temporary), stream));
+    return std::unique_ptr<HTOutputFile>(new HTOutputFile(path, std::move(temporary), stream, slot));
+}
+
+std::optional<std::string> HTOutputFile::directoryProblem(const std::string& directory)
+{
+    struct stat status {};
+    if (::stat(directory.c_str(), &status) != 0) return errorFor(errno);
+    if (!S_ISDIR(status.st_mode)) return errorFor(ENOTDIR);
+    if (::access(directory.c_str(), W_OK | X_OK) != 0) return errorFor(errno);
+    return std::nullopt;
 }
 
 HTOutputFile::~HTOutputFile()
@@ -122,7 +149,7 @@ HTOutputFile::~HTOutputFile()
     if (stream_ == nullptr) return;
     std::fclose(stream_);
     if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
-    forgetTemporary();
+    forgetTemporary(slot_);
 }
 
 bool HTOutputFile::commit(std::string* errorText)
@@ -145,6 +172,6 @@ bool HTOutputFile::commit(std::string* errorText)
         if (!temporaryPath_.empty()) ::unlink(temporaryPath_.c_str());
         *errorText = errorFor(error);
     }
-    forgetTemporary();
+    forgetTemporary(slot_);
     return ok;
 }
