@@ -9,6 +9,7 @@
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTKernelProcess.h"
 #include "process/HTKernelScript.h"
+#include "process/HTSnapfileProcess.h"
 #include "process/HTUserProcess.h"
 
 #include <gtest/gtest.h>
@@ -144,6 +145,7 @@ protected:
                 target_->images.push_back(image);
             }
             if (line.kind == "gather") gather(line, out);
+            if (line.kind == "snapfile") readSnapfile(line.argument, out);
             scriptKernel(*platform_, line);
         }
         return out.str();
@@ -245,14 +247,9 @@ protected:
             process->gatherData();
             script.exited = exited;
         }
-        const std::string told = testing::internal::GetCapturedStderr();
         out << "gather " << process->displayString() << (created ? "" : ": not created") << "\n";
         if (created) describe(*process, out, kernel);
-        for (const std::string& text : HTNoticeLog::standardError().take()) out << "notice " << text << "\n";
-        for (const std::string& text : HTProcess::globalErrors()) out << "global-error " << text << "\n";
-        HTProcess::_clearGlobalErrors();
-        std::istringstream toldLines(told);
-        for (std::string text; std::getline(toldLines, text);) out << "stderr " << text << "\n";
+        describeMessages(out);
         if (kernel) {
             out << "calls: " << platform_->loadedModuleReads << " module lists, " << platform_->kernelImageListOpens
                 << " symbol resolvers\n\n";
@@ -262,6 +259,35 @@ protected:
             << platform_->ledgerTemplateReads << " template; queries";
         for (const auto& [address, size] : platform_->pageQueries) out << " " << hex(address) << "+" << hex(size);
         out << "\n\n";
+    }
+
+    // A snapfile of tests/data/snapfiles, read as a process.
+    void readSnapfile(const std::string& name, std::ostringstream& out)
+    {
+        HTError error;
+        testing::internal::CaptureStderr();
+        auto process = HTSnapfileProcess::processWithSnapfile(
+            platform_, settings_, std::string(HEFT_TEST_DATA_DIR) + "/snapfiles/" + name, &error);
+        if (process) process->gatherData();
+        out << "snapfile " << name << ": "
+            << (process ? process->displayString()
+                        : "not created: " + error.domain + " " + std::to_string(error.code) + " " +
+                        error.description.value_or(""))
+            << "\n";
+        if (process) describe(*process, out, false);
+        describeMessages(out);
+        out << "\n";
+    }
+
+    // What was said on the side, since capturing standard error began.
+    static void describeMessages(std::ostringstream& out)
+    {
+        const std::string told = testing::internal::GetCapturedStderr();
+        for (const std::string& text : HTNoticeLog::standardError().take()) out << "notice " << text << "\n";
+        for (const std::string& text : HTProcess::globalErrors()) out << "global-error " << text << "\n";
+        HTProcess::_clearGlobalErrors();
+        std::istringstream toldLines(told);
+        for (std::string text; std::getline(toldLines, text);) out << "stderr " << text << "\n";
     }
 
     // Auxiliary data, a nested map's keys after its own.
@@ -302,6 +328,10 @@ protected:
                     out << "  run " << hex(n->start) << "+" << hex(n->size) << " dirty " << n->dirty << " swapped "
                         << n->swapped << " clean " << n->clean << " reclaimable " << n->reclaimable << " wired "
                         << n->wired << "\n";
+            if (const HTSharedPageList* list = r->sharedPageList())
+                for (const HTSharedPageList::Run& run : list->runs())
+                    out << "  pages " << run.firstPage << "+" << run.count << " kind " << int(run.kind) << " identity "
+                        << (run.firstIdentity == HTSharedPageList::kNoIdentity ? 0 : list->identity(run, 0)) << "\n";
         }
         for (const std::string& text : process.warnings()) out << "warning " << text << "\n";
         for (const std::string& text : process.errors()) out << "error " << text << "\n";
@@ -323,6 +353,15 @@ TEST_F(HTUserProcessScenarioTest, Scenarios)
         SCOPED_TRACE(name);
         expectReport("processes/" + name + ".txt", run(kScenarios + name + ".scenario"));
     }
+}
+
+TEST(HTSnapfileProcessTest, PlatformCodeFromTheDescription)
+{
+    const std::pair<const char*, int> rows[] = {
+        {"Linux 6.1.0 x86_64", 5}, {"Linux ARM64", 5}, {"X86-64 (X86)", 1}, {"X86", 0},   {"ARM64", 3},
+        {"ARM64-32", 4},           {"ARM64e", 3},      {"ARM64-3", 3},      {"ARMv7", 2}, {"PDP-11", -1}};
+    for (const auto& [description, code] : rows)
+        EXPECT_EQ(HTSnapfileProcess::platformCodeForDescription(description), code) << description;
 }
 
 }  // namespace
