@@ -95,6 +95,20 @@ smaps_ns=$(best_of read_smaps)
 heft_ns=$(best_of timeout 600 "$heft" -a)
 peak_kib=$(/usr/bin/time -f %M "$heft" -a 2>&1 > /dev/null | tail -n 1)
 
+# The same run saving every process as a snapfile, each time into a new
+# directory; then the snapfiles of the last one read back.
+save_all() {
+    local saved
+    saved=$(mktemp -d "$work/snaps.XXXXXX")
+    echo "$saved" > "$work/last-snaps"
+    timeout 600 "$heft" -a --snapshot-dir "$saved"
+}
+read_saved() { "$heft" "$(cat "$work/last-snaps")"/*.heftsnap; }
+save_ns=$(best_of save_all)
+read_ns=$(best_of read_saved)
+saved=$(cat "$work/last-snaps")
+snap_bytes=$(du -sb "$saved" | cut -f1)
+
 # The summary against the kernel's own count of what the processes cost
 # together: the sum over them of Pss_Dirty + SwapPss + VmPTE (each shared
 # page divided among its mappers adds up to the page once).
@@ -108,5 +122,7 @@ echo "cat /proc/*/smaps: $(ms "$smaps_ns") (best of $runs)"
 echo "heft -a:           $(ms "$heft_ns") (best of $runs)"
 echo "ratio:             $(awk -v h="$heft_ns" -v s="$smaps_ns" 'BEGIN { printf "%.2f", h / s }')"
 echo "heft peak RSS:     $peak_kib KiB"
+echo "heft -a, saving:   $(ms "$save_ns") (best of $runs; $(ls "$saved" | wc -l) snapfiles, $snap_bytes bytes)"
+echo "heft snapfiles:    $(ms "$read_ns") (best of $runs)"
 echo "summary:           $summary B; kernel (Pss_Dirty + SwapPss + VmPTE): $kernel B"
 echo "summary/kernel:    $(awk -v h="$summary" -v k="$kernel" 'BEGIN { printf "%.4f", h / k }')"
