@@ -262,15 +262,17 @@ bool readRegions(const rapidjson::Value& list, HTSnapshotGraph& graph, std::stri
         problem = format("\"regions\" must be an array, not %s", typeName(list));
         return false;
     }
-    graph.regions.resize(list.Size());
     uint64_t previousEnd = 0;
     uint64_t identified = 0;
     uint64_t covered = 0;
+    // Grown one checked region at a time: a list of empty objects costs
+    // no more than its text.
     for (rapidjson::SizeType i = 0; i < list.Size(); ++i) {
-        HTSnapshotRegion& region = graph.regions[i];
+        HTSnapshotRegion region;
         if (!readRegion(list[i], i, graph.snapshotPageSize, previousEnd, region, identified, covered, problem))
             return false;
         previousEnd = region.address + region.length;
+        graph.regions.push_back(std::move(region));
     }
     return true;
 }
