@@ -39,6 +39,6 @@ struct HTSettings {
     // Where every live user process analysed is also saved as a snapfile;
     // empty for nowhere. The capture names the run, so that page identities
     // are only compared between snapfiles of one run.
-    std::string snapshotDirectory;
-    std::string snapshotCapture;
+    std::string snapshotDirectory{};
+    std::string snapshotCapture{};
 };
