@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cinttypes>
+#include <cmath>
 #include <cstdarg>
 #include <cstdio>
 #include <cstring>
@@ -39,6 +40,9 @@ std::string format(const char* pattern, ...)
     return text;
 }
 
+// The ending of a noun counted `count` times.
+const char* plural(uint64_t count) { return count == 1 ? "" : "s"; }
+
 const char* typeName(const rapidjson::Value& value)
 {
     if (value.IsNull()) return "null";
@@ -47,7 +51,11 @@ const char* typeName(const rapidjson::Value& value)
     if (value.IsArray()) return "an array";
     if (value.IsObject()) return "an object";
     if (value.IsInt64() || value.IsUint64()) return "a whole number";
-    return "a fraction";
+    // The parser holds whole numbers beyond 64 bits, and numbers written
+    // with a point or an exponent, as doubles.
+    const double number = value.GetDouble();
+    if (std::fabs(number) >= 0x1p63) return "a number too large";
+    return number == std::trunc(number) ? "a number written with a point or exponent" : "a fraction";
 }
 
 // Reads the members of one JSON object, each checked for its type and
@@ -67,13 +75,22 @@ public:
         if (problem_.empty()) problem_ = where_.empty() ? text : where_ + ": " + text;
     }
 
-    const rapidjson::Value* member(const char* name)
+    // The member `name`, which must be there unless `optional` (then null
+    // when absent), and there once: readers differ on which of two members
+    // of one name counts.
+    const rapidjson::Value* member(const char* name, bool optional = false)
     {
         if (!ok()) return nullptr;
         auto found = object_.FindMember(name);
         if (found == object_.MemberEnd()) {
-            fail(format("\"%s\" is missing", name));
+            if (!optional) fail(format("\"%s\" is missing", name));
             return nullptr;
+        }
+        for (auto other = found + 1; other != object_.MemberEnd(); ++other) {
+            if (other->name == found->name) {
+                fail(format("\"%s\" appears more than once", name));
+                return nullptr;
+            }
         }
         return &found->value;
     }
@@ -172,10 +189,20 @@ bool readPageRuns(const rapidjson::Value& list, FieldReader& fields, uint64_t re
         const uint64_t count = list[i + 1].GetUint64();
         const uint64_t disposition = list[i + 2].GetUint64();
         const uint64_t identity = list[i + 3].GetUint64();
-        if (count == 0 || first < end || first > regionPages || count > regionPages - first) {
-            fields.fail(format("page run %u of \"pages\" (pages %" PRIu64 " and %" PRIu64
-                               " on) overlaps the run before it or lies outside the region's %" PRIu64 " pages",
-                               run, first, count, regionPages));
+        if (count == 0) {
+            fields.fail(format("page run %u of \"pages\" holds no pages", run));
+            return false;
+        }
+        if (first < end) {
+            fields.fail(format("page run %u of \"pages\" starts at page %" PRIu64 ", before page %" PRIu64
+                               ", the end of the run before it: runs must ascend without overlapping",
+                               run, first, end));
+            return false;
+        }
+        if (first > regionPages || count > regionPages - first) {
+            fields.fail(format("page run %u of \"pages\" (%" PRIu64 " page%s from page %" PRIu64
+                               ") runs past page %" PRIu64 ", the end of the region",
+                               run, count, plural(count), first, regionPages));
             return false;
         }
         if (disposition == 0 || (disposition & ~static_cast<uint64_t>(kDispositionBits)) != 0) {
@@ -184,16 +211,17 @@ bool readPageRuns(const rapidjson::Value& list, FieldReader& fields, uint64_t re
             return false;
         }
         if (identity != 0 && (identity >= kIdentityLimit || count > kIdentityLimit - identity)) {
-            fields.fail(format("page run %u of \"pages\" has identities from %" PRIu64 " on, above the largest", run,
-                               identity));
+            fields.fail(format("page run %u of \"pages\" gives its %" PRIu64 " page%s identities from %" PRIu64
+                               " on: the largest a page may have is %" PRIu64,
+                               run, count, plural(count), identity, kIdentityLimit - 1));
             return false;
         }
         covered += count;
         if (identity != 0) identified += count;
         if (covered > HTSnapshotGraph::kMaxRunPages || identified > HTSnapshotGraph::kMaxIdentifiedPages) {
-            fields.fail(format("its page runs cover more than the %" PRIu64 " pages (%" PRIu64
-                               " with identities) a snapfile may hold",
-                               HTSnapshotGraph::kMaxRunPages, HTSnapshotGraph::kMaxIdentifiedPages));
+            fields.fail(format("page run %u of \"pages\" takes the snapfile's page runs past the %" PRIu64
+                               " pages (%" PRIu64 " with identities) a snapfile may hold",
+                               run, HTSnapshotGraph::kMaxRunPages, HTSnapshotGraph::kMaxIdentifiedPages));
             return false;
         }
         end = first + count;
@@ -220,7 +248,7 @@ bool readRegion(const rapidjson::Value& value, size_t index, uint64_t pageSize, 
     region.length = fields.number("length", 1, kMaxU64);
     if (!fields.ok()) return false;
     if (region.length > kMaxU64 - region.address) {
-        fields.fail(format("its %" PRIu64 " bytes run past the end of the address space", region.length));
+        fields.fail(format("its length, %" PRIu64 ", runs past the end of the address space", region.length));
         return false;
     }
     if (region.address < previousEnd) {
@@ -249,11 +277,11 @@ bool readRegion(const rapidjson::Value& value, size_t index, uint64_t pageSize, 
     region.inheritance = static_cast<uint32_t>(fields.number("inheritance", 0, 2));
     region.user_wired_count = static_cast<uint16_t>(fields.number("user_wired_count", 0, kMaxU16));
     if (!fields.ok()) return false;
-    auto pages = value.FindMember("pages");
-    if (pages == value.MemberEnd()) return true;
+    const rapidjson::Value* pages = fields.member("pages", true);
+    if (pages == nullptr) return fields.ok();
     const uint64_t regionPages = region.length / pageSize + (region.length % pageSize != 0 ? 1 : 0);
     region.pages.emplace();
-    return readPageRuns(pages->value, fields, regionPages, *region.pages, identified, covered);
+    return readPageRuns(*pages, fields, regionPages, *region.pages, identified, covered);
 }
 
 bool readRegions(const rapidjson::Value& list, HTSnapshotGraph& graph, std::string& problem)
@@ -283,13 +311,13 @@ bool readGraph(const rapidjson::Document& document, HTSnapshotGraph& graph, std:
         problem = format("not a heft snapfile: the document is %s, not an object", typeName(document));
         return false;
     }
-    auto formatName = document.FindMember("format");
-    if (formatName == document.MemberEnd() || !formatName->value.IsString() ||
-        std::strcmp(formatName->value.GetString(), HTSnapshotGraph::kFormat) != 0) {
-        problem = format("not a heft snapfile: it has no \"format\": \"%s\" member", HTSnapshotGraph::kFormat);
-        return false;
-    }
     FieldReader fields(document, "", problem);
+    const rapidjson::Value* formatName = fields.member("format", true);
+    if (fields.ok() &&
+        (formatName == nullptr || !formatName->IsString() ||
+         std::string_view(formatName->GetString(), formatName->GetStringLength()) != HTSnapshotGraph::kFormat)) {
+        problem = format("not a heft snapfile: it has no \"format\": \"%s\" member", HTSnapshotGraph::kFormat);
+    }
     const uint64_t version = fields.number("version", 0, kMaxU64);
     if (fields.ok() && version != HTSnapshotGraph::kVersion) {
         fields.fail(format("it is of version %" PRIu64 "; this heft reads version %" PRIu64, version,
@@ -330,6 +358,12 @@ std::unique_ptr<HTSnapshotGraph> HTSnapshotGraph::openSnapshotGraph(std::string_
         if (error) *error = formatError("the file is empty");
         return nullptr;
     }
+    // The parser takes a NUL byte for the end of the text, and would read
+    // no further: JSON text holds none.
+    if (const size_t nul = contents.find('\0'); nul != std::string_view::npos) {
+        if (error) *error = formatError(format("not a heft snapfile: bad JSON at byte %zu (a NUL byte)", nul));
+        return nullptr;
+    }
     rapidjson::Document document;
     // Iterative parsing: nesting depth costs heap, not stack.
     document.Parse<rapidjson::kParseIterativeFlag>(contents.data(), contents.size());
@@ -338,7 +372,7 @@ std::unique_ptr<HTSnapshotGraph> HTSnapshotGraph::openSnapshotGraph(std::string_
         const char* reason = rapidjson::GetParseError_En(document.GetParseError());
         if (error)
             *error = formatError(offset >= contents.size()
-                                     ? format("the file ends early, at byte %zu: it is cut short (%s)", offset, reason)
+                                     ? format("the file ends early, at byte %zu: it is cut short", offset)
                                      : format("not a heft snapfile: bad JSON at byte %zu (%s)", offset, reason));
         return nullptr;
     }
