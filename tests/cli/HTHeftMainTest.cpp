@@ -2,6 +2,7 @@
 
 #include "base/HTNoticeLog.h"
 #include "output/HTExpectedReport.h"
+#include "platform/HTSnapfileEdit.h"
 #include "platform/fake/HTFakePlatform.h"
 #include "process/HTProcess.h"
 
@@ -9,7 +10,9 @@
 
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
 #include <iterator>
+#include <regex>
 #include <sstream>
 #include <string>
 #include <unistd.h>
@@ -49,6 +52,11 @@ protected:
 TEST_F(HTHeftMainTest, Runs)
 {
     const std::string name = "cli/main";
+    char pattern[] = "/tmp/heft-main-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    // Snapfiles are written to a directory of the test's own, named DIR in
+    // the runs and in what they say.
+    const std::string directory = pattern;
     std::istringstream lines(contentsOf(std::string(HEFT_TEST_DATA_DIR) + "/reports/" + name + ".scenario"));
     std::string said;
     for (std::string text; std::getline(lines, text);) {
@@ -59,15 +67,20 @@ TEST_F(HTHeftMainTest, Runs)
             zombie.info.pbi_status = SZOMB;
             zombie.regionFailureIndex = 0;
         }
+        if (line.kind == "snapfile") {
+            std::ofstream(directory + "/" + line.argument) << editedSnapfile(line.text("edit").value_or(""));
+            platform_->existingFiles.insert(directory + "/" + line.argument);
+        }
         if (line.kind != "run") continue;
-        std::istringstream words(text.substr(4));
+        std::istringstream words(std::regex_replace(text.substr(4), std::regex("DIR"), directory));
         std::vector<std::string> arguments{std::istream_iterator<std::string>(words), {}};
         platform_->ownedVmObjectQueries = 0;
         auto [status, out, error] = run(arguments);
         said += text + "\n  status " + std::to_string(status) + ", " + std::to_string(platform_->ownedVmObjectQueries) +
             " owned-object queries\n" + out + (error.empty() ? "" : "standard error:\n" + error) + "\n";
     }
-    expectReport(name + ".txt", said);
+    std::filesystem::remove_all(directory);
+    expectReport(name + ".txt", std::regex_replace(said, std::regex(directory), "DIR"));
 }
 
 TEST_F(HTHeftMainTest, TheJSONFileIsOpenedFirstAndGoneWhenTheRunFails)

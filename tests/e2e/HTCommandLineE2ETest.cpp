@@ -41,6 +41,8 @@ TEST(HTCommandLineE2ETest, RunsThatEndBeforeTheAnalysisPrintTheirMessages)
                 {{"1", "-j"}, 1, complaint("'j'"), usage},
                 {{"-f", "bad", "1"}, 1, AllOf(StartsWith("Unrecognized argument"), EndsWith(".\n")), usage},
                 {{"-y"}, 1, noTarget, usage},
+                // A file that is no snapfile, and no process's name.
+                {{"/dev/null"}, 1, "Error opening snapfile /dev/null: it is not a regular file\n", usage},
                 {{"heft-e2e-no-such-process"}, 1, noSuchProcess + kNoProcesses, ""}},
                runHeft);
 }
