@@ -69,7 +69,8 @@ bool HTSnapfileProcess::_initWithGraph(std::unique_ptr<HTSnapshotGraph> graph, H
     // The shared region follows from the platform: without one, the
     // process cannot be walked.
     if (!_setSharedRegionFromPlatform(_platformCode())) {
-        if (error) *error = HTError(HeftErrorDomain, 2, "its process description names no platform heft knows");
+        if (error)
+            *error = HTError(HeftErrorDomain, 2, "Unable to determine platform from memory graph process description");
         return false;
     }
     proc_bsdinfo info{};
