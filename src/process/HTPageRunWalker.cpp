@@ -101,7 +101,8 @@ kern_return_t HTPageRunWalker::walkPages(const HTMemoryRegion& region, const Pag
             for (uint64_t index = first; index < first + count; ++index)
                 list->addPage(static_cast<uint32_t>(index), kind, identity ? *identity : 0);
         } else {
-            runs.addRun(targets.pages->offset() + first * page, count * page, kind);
+            // Pages whose target is null are left out, as the file's are above.
+            runs.addRun(targets.pages ? targets.pages->offset() + first * page : 0, count * page, kind);
         }
     };
 
