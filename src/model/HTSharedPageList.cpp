@@ -46,3 +46,18 @@ void HTSharedPageList::addPage(uint32_t page, HTPageKind kind, uint64_t identity
     }
     runs_.push_back(run);
 }
+
+void HTSharedPageList::addUnidentifiedPages(uint32_t page, uint32_t count, HTPageKind kind)
+{
+    HT_ASSERT("HTSharedPageList", kind != HTPageKind::None, "kind != HTPageKind::None");
+    if (count == 0) return;
+    if (!runs_.empty()) {
+        Run& last = runs_.back();
+        HT_ASSERT("HTSharedPageList", page >= last.firstPage + last.count, "pages ascend");
+        if (page == last.firstPage + last.count && last.kind == kind && last.firstIdentity == kNoIdentity) {
+            last.count += count;
+            return;
+        }
+    }
+    runs_.push_back(Run{page, count, kNoIdentity, kind});
+}

@@ -33,6 +33,9 @@ public:
 
     // Appends page `page` (indexes must ascend) of a kind other than None.
     void addPage(uint32_t page, HTPageKind kind, uint64_t identity);
+    // Appends `count` pages from `page` that no identity names, as many
+    // calls of addPage would, in one step.
+    void addUnidentifiedPages(uint32_t page, uint32_t count, HTPageKind kind);
 
     const std::vector<Run>& runs() const { return runs_; }
     // The identity of the run's `i`-th page; the run must be identified.

@@ -97,9 +97,12 @@ kern_return_t HTPageRunWalker::walkPages(const HTMemoryRegion& region, const Pag
         // copies belong to different objects.
         if (separateCopies && (disposition & VM_PAGE_QUERY_PAGE_COPIED) == 0) {
             fileRuns.addRun(targets.filePages ? targets.filePages->offset() + first * page : 0, count * page, kind);
+        } else if (list && identity == nullptr) {
+            // A run without identities goes in whole, however many pages.
+            list->addUnidentifiedPages(static_cast<uint32_t>(first), static_cast<uint32_t>(count), kind);
         } else if (list) {
             for (uint64_t index = first; index < first + count; ++index)
-                list->addPage(static_cast<uint32_t>(index), kind, identity ? *identity : 0);
+                list->addPage(static_cast<uint32_t>(index), kind, *identity);
         } else {
             // Pages whose target is null are left out, as the file's are above.
             runs.addRun(targets.pages ? targets.pages->offset() + first * page : 0, count * page, kind);

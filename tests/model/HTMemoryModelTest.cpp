@@ -1,6 +1,7 @@
 #include "model/HTMemoryCategory.h"
 #include "model/HTMemoryObject.h"
 #include "model/HTMemoryRegion.h"
+#include "model/HTSharedPageList.h"
 
 #include <gtest/gtest.h>
 
@@ -284,4 +285,29 @@ TEST(HTMemoryRegion, Eligibility)
     EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setDirtySize(0); }), Both(true, false));
     EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setSize(kPage); }), Both(true, false));
     EXPECT_EQ(eligibility([](HTMemoryRegion& r) { r.setOwnedExclusivelyByParentProcess(true); }), Both(true, false));
+}
+
+// Unidentified pages added a run at a time make the runs that adding them
+// page by page makes.
+TEST(HTSharedPageList, UnidentifiedRunsJoinAsSinglePagesWould)
+{
+    using Spec = std::array<uint32_t, 4>;  // {first page, count, identity (0 for none), kind}
+    const std::vector<Spec> adds = {{0, 3, 0, 1}, {3, 2, 0, 1},  {5, 1, 42, 1},
+                                    {6, 4, 0, 1}, {10, 1, 0, 4}, {12, 2, 0, 4}};
+    HTSharedPageList whole, single;
+    for (auto [first, count, identity, kind] : adds) {
+        if (identity == 0) whole.addUnidentifiedPages(first, count, HTPageKind(kind));
+        for (uint32_t page = first; page < first + count; ++page) {
+            if (identity != 0) whole.addPage(page, HTPageKind(kind), identity);
+            single.addPage(page, HTPageKind(kind), identity);
+        }
+    }
+    auto specs = [](const HTSharedPageList& list) {
+        std::vector<Spec> found;
+        for (const auto& run : list.runs())
+            found.push_back({run.firstPage, run.count, run.firstIdentity, uint32_t(run.kind)});
+        return found;
+    };
+    EXPECT_EQ(specs(whole), specs(single));
+    EXPECT_EQ(specs(whole).size(), 5u);
 }
