@@ -109,10 +109,11 @@ read_ns=$(best_of read_saved)
 saved=$(cat "$work/last-snaps")
 snap_bytes=$(du -sb "$saved" | cut -f1)
 
-# The summary against the kernel's own count of what the processes cost
-# together: the sum over them of Pss_Dirty + SwapPss + VmPTE (each shared
-# page divided among its mappers adds up to the page once).
-summary=$({ "$heft" -a -f bytes 2> /dev/null || true; } | sed -n 's/^Summary Heft: \([0-9]*\) B.*/\1/p')
+# The summary of the user processes (the kernel, pid 0, left out) against
+# the kernel's own count of what they cost together: the sum over them of
+# Pss_Dirty + SwapPss + VmPTE (each shared page divided among its mappers
+# adds up to the page once).
+summary=$({ "$heft" -a -x 0 -f bytes 2> /dev/null || true; } | sed -n 's/^Summary Heft: \([0-9]*\) B.*/\1/p')
 # Processes heft may not read (pid 1 in some containers) are left out of both.
 kernel=$({ cat /proc/[0-9]*/smaps_rollup /proc/[0-9]*/status 2> /dev/null || true; } |
     awk '$1 == "Pss_Dirty:" || $1 == "SwapPss:" || $1 == "VmPTE:" { total += $2 } END { printf "%.0f", total * 1024 }')
