@@ -52,7 +52,7 @@ fuzz-build: setup
 		-DHEFT_BUILD_FUZZ=ON -DHEFT_WERROR=ON
 	cmake --build $(FUZZ_DIR) -j $(JOBS) --target heft_fuzz_snapfile
 	mkdir -p $(FUZZ_DIR)/corpus $(FUZZ_DIR)/findings
-	cp tests/data/snapfiles/*.heftsnap tests/data/snapfiles/corpus/*.heftsnap $(FUZZ_DIR)/corpus/
+	cp tests/data/snapfiles/*.heftsnap tests/data/snapfiles/corpus/* $(FUZZ_DIR)/corpus/
 
 # Each input may take 10 seconds and the fuzzer 2 GB. The reader bounds
 # what a snapfile may name, and the target leaves out the few snapfiles

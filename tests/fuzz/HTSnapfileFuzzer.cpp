@@ -1,6 +1,6 @@
-// Arbitrary bytes read as a snapfile; whatever opens is gathered and
-// reported, with -v, as a run over that one snapfile would. No input may
-// crash, hang, assert or exhaust memory on the way.
+// Arbitrary bytes read as a snapfile, or two parted by a NUL (which no
+// snapfile holds), gathered and reported with -v as a run over them would:
+// no input may crash, hang, assert or exhaust memory on the way.
 #include "analysis/HTHeft.h"
 #include "base/HTNoticeLog.h"
 #include "output/HTOutputFormatterText.h"
@@ -10,9 +10,8 @@
 #include <cstdio>
 #include <cstdlib>
 
-// Pages with identities are analysed one by one, in time and memory in
-// proportion to them up to the reader's bound (gigabytes): past 2^20 of
-// them the fuzzer would only spend its time on sheer size.
+// Identified pages cost time and memory one by one, up to the reader's
+// bound (gigabytes); past 2^20 the fuzzer would only spend its time on size.
 static uint64_t identifiedPages(const HTSnapshotGraph& graph)
 {
     uint64_t pages = 0;
@@ -22,28 +21,35 @@ static uint64_t identifiedPages(const HTSnapshotGraph& graph)
     return pages;
 }
 
-extern "C" int LLVMFuzzerInitialize(int*, char***)
-{
-    // The report goes nowhere; libFuzzer speaks on standard error.
-    if (std::freopen("/dev/null", "w", stdout) == nullptr) std::abort();
-    return 0;
-}
-
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
 {
     static const auto platform = std::make_shared<HTLinuxPlatform>();
-    HTError error;
-    auto graph = HTSnapshotGraph::openSnapshotGraph({reinterpret_cast<const char*>(data), size}, &error);
-    if (!graph || identifiedPages(*graph) > (uint64_t{1} << 20)) return 0;
+    static FILE* const sink = std::fopen("/dev/null", "w");  // for the report
+    if (sink == nullptr) std::abort();
+    const std::string_view input(reinterpret_cast<const char*>(data), size);
+    const size_t nul = std::min(input.find('\0'), size);
     HTSettings settings;
-    auto process = HTSnapfileProcess::processWithGraph(platform, settings, std::move(graph), &error);
-    if (!process) return 0;
-    // The snapfile's analysis mode is the run's, as in a run from the command line.
-    settings.breakDownPhysHeft = process->breakDownPhysHeft();
+    std::vector<std::shared_ptr<HTSnapfileProcess>> read;
+    for (std::string_view part : {input.substr(0, nul), input.substr(std::min(nul + 1, size))}) {
+        HTError error;
+        auto graph = HTSnapshotGraph::openSnapshotGraph(part, &error);
+        if (!graph || identifiedPages(*graph) > (uint64_t{1} << 20)) continue;
+        auto process = HTSnapfileProcess::processWithGraph(platform, settings, std::move(graph), &error);
+        // As on the command line: one analysis mode, and one process a pid.
+        if (process &&
+            (read.empty() ||
+             (process->breakDownPhysHeft() == read[0]->breakDownPhysHeft() && process->pid() != read[0]->pid())))
+            read.push_back(process);
+    }
+    if (read.empty()) return 0;
+    // As a run takes them: by pid, matching pages only within one capture.
+    if (read.back()->pid() < read[0]->pid()) std::swap(read.front(), read.back());
+    for (const auto& process : read) process->setIgnoresPageIdentities(read.back()->capture() != read[0]->capture());
+    settings.breakDownPhysHeft = read[0]->breakDownPhysHeft();
     settings.verbose = true;
-    HTHeft heft({process}, settings);
+    HTHeft heft(HTHeft::ProcessList(read.begin(), read.end()), settings);
     heft.gatherData();
-    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings));
+    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings, sink));
     heft.printOutputVerbose(settings.verbose, settings.summarize);
     // The notices a run would print at its end are dropped, not kept.
     HTNoticeLog::standardError().take();
