@@ -66,9 +66,9 @@ public:
     // The largest snapfile read: enough for a process of a million regions.
     static constexpr uint64_t kMaxFileSize = uint64_t{1} << 30;
     // The most pages a snapfile may name with identities, and the most its
-    // page runs may cover: each identified page costs memory when the
-    // snapfile is analysed.
-    static constexpr uint64_t kMaxIdentifiedPages = uint64_t{1} << 26;
+    // page runs may cover: each identified page costs about 40 bytes when
+    // the snapfile is analysed, 64 GiB of such pages (of 4 KiB) some 650 MB.
+    static constexpr uint64_t kMaxIdentifiedPages = uint64_t{1} << 24;
     static constexpr uint64_t kMaxRunPages = uint64_t{1} << 28;
     // Error domain and codes of the reader.
     static constexpr const char* kErrorDomain = "HTSnapshotGraph";
