@@ -1,12 +1,12 @@
 #include "cli/HTHeftArgs.h"
 
+#include "base/HTStringFormat.h"
 #include "process/HTProcessDiscovery.h"
 
 #include <getopt.h>
 #include <strings.h>
 
 #include <cctype>
-#include <cstdarg>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
@@ -26,22 +26,6 @@ enum : int {
     OptionUnmapped = 261,
     OptionSnapshotDir = 262,
 };
-
-std::string stringWithFormat(const char* format, ...) __attribute__((format(printf, 1, 2)));
-
-std::string stringWithFormat(const char* format, ...)
-{
-    va_list arguments;
-    va_start(arguments, format);
-    va_list copy;
-    va_copy(copy, arguments);
-    int length = std::vsnprintf(nullptr, 0, format, copy);
-    va_end(copy);
-    std::string text(length > 0 ? static_cast<size_t>(length) : 0, '\0');
-    if (length > 0) std::vsnprintf(text.data(), text.size() + 1, format, arguments);
-    va_end(arguments);
-    return text;
-}
 
 // Fills the caller's error slot, if any, and reports failure.
 bool fail(HTError* error, int64_t code, std::optional<std::string> description = std::nullopt)
@@ -212,9 +196,9 @@ bool HTHeftArgs::_applyPid(const char* argument, HTError* error)
     std::optional<int32_t> pid = HTProcessDiscovery::pidForText(argument);
     if (!pid)
         return fail(error, HTHeftErrorCodePid,
-                    stringWithFormat("'%s' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
-                                     "specify a process name.",
-                                     argument));
+                    htStringWithFormat("'%s' is not a valid integer for --pid.\n\nUse -p / --proc if you meant to "
+                                       "specify a process name.",
+                                       argument));
     targetPids_.set(*pid, std::nullopt);
     return true;
 }
@@ -228,8 +212,8 @@ bool HTHeftArgs::_applySort(const char* argument, HTError* error)
         }
     }
     return fail(error, HTHeftErrorCodeSort,
-                stringWithFormat("Unrecognized argument '%s' to --sort.\nAccepted arguments: %s", argument,
-                                 lowerCaseSortColumnList().c_str()));
+                htStringWithFormat("Unrecognized argument '%s' to --sort.\nAccepted arguments: %s", argument,
+                                   lowerCaseSortColumnList().c_str()));
 }
 
 bool HTHeftArgs::_applyFormat(const char* argument, HTError* error)

@@ -1,5 +1,6 @@
 #include "platform/HTSnapshotGraph.h"
 
+#include "base/HTStringFormat.h"
 #include "platform/linux/HTFileDescriptor.h"
 #include "platform/linux/HTPreadFully.h"
 
@@ -9,7 +10,6 @@
 #include <cerrno>
 #include <cinttypes>
 #include <cmath>
-#include <cstdarg>
 #include <cstdio>
 #include <cstring>
 #include <fcntl.h>
@@ -27,18 +27,6 @@ constexpr int64_t kDispositionBits = 0x1 | 0x2 | 0x4 | 0x8 | 0x10 | 0x20 | 0x40 
 // Identities lie below this (the platform's bound for shared pages).
 constexpr uint64_t kIdentityLimit = uint64_t{1} << 58;
 constexpr uint32_t kProtectionBits = 7;
-
-std::string format(const char* pattern, ...) __attribute__((format(printf, 1, 2)));
-
-std::string format(const char* pattern, ...)
-{
-    char text[512];
-    va_list arguments;
-    va_start(arguments, pattern);
-    std::vsnprintf(text, sizeof(text), pattern, arguments);
-    va_end(arguments);
-    return text;
-}
 
 // The ending of a noun counted `count` times.
 const char* plural(uint64_t count) { return count == 1 ? "" : "s"; }
@@ -83,12 +71,12 @@ public:
         if (!ok()) return nullptr;
         auto found = object_.FindMember(name);
         if (found == object_.MemberEnd()) {
-            if (!optional) fail(format("\"%s\" is missing", name));
+            if (!optional) fail(htStringWithFormat("\"%s\" is missing", name));
             return nullptr;
         }
         for (auto other = found + 1; other != object_.MemberEnd(); ++other) {
             if (other->name == found->name) {
-                fail(format("\"%s\" appears more than once", name));
+                fail(htStringWithFormat("\"%s\" appears more than once", name));
                 return nullptr;
             }
         }
@@ -100,30 +88,14 @@ public:
         const rapidjson::Value* value = member(name);
         if (value == nullptr) return lowest;
         if (!value->IsUint64()) {
-            fail(format("\"%s\" must be a whole number from %" PRIu64 " to %" PRIu64 ", not %s", name, lowest, highest,
-                        value->IsInt64() ? "a negative number" : typeName(*value)));
+            fail(htStringWithFormat("\"%s\" must be a whole number from %" PRIu64 " to %" PRIu64 ", not %s", name,
+                                    lowest, highest, value->IsInt64() ? "a negative number" : typeName(*value)));
             return lowest;
         }
         const uint64_t found = value->GetUint64();
         if (found < lowest || found > highest) {
-            fail(format("\"%s\" is %" PRIu64 ", outside %" PRIu64 " to %" PRIu64, name, found, lowest, highest));
-            return lowest;
-        }
-        return found;
-    }
-
-    int64_t signedNumber(const char* name, int64_t lowest, int64_t highest)
-    {
-        const rapidjson::Value* value = member(name);
-        if (value == nullptr) return lowest;
-        if (!value->IsInt64()) {
-            fail(format("\"%s\" must be a whole number from %" PRId64 " to %" PRId64 ", not %s", name, lowest, highest,
-                        value->IsUint64() ? "a larger number" : typeName(*value)));
-            return lowest;
-        }
-        const int64_t found = value->GetInt64();
-        if (found < lowest || found > highest) {
-            fail(format("\"%s\" is %" PRId64 ", outside %" PRId64 " to %" PRId64, name, found, lowest, highest));
+            fail(htStringWithFormat("\"%s\" is %" PRIu64 ", outside %" PRIu64 " to %" PRIu64, name, found, lowest,
+                                    highest));
             return lowest;
         }
         return found;
@@ -134,7 +106,7 @@ public:
         const rapidjson::Value* value = member(name);
         if (value == nullptr) return false;
         if (!value->IsBool()) {
-            fail(format("\"%s\" must be true or false, not %s", name, typeName(*value)));
+            fail(htStringWithFormat("\"%s\" must be true or false, not %s", name, typeName(*value)));
             return false;
         }
         return value->GetBool();
@@ -145,7 +117,7 @@ public:
         const rapidjson::Value* value = member(name);
         if (value == nullptr) return {};
         if (!value->IsString()) {
-            fail(format("\"%s\" must be a string, not %s", name, typeName(*value)));
+            fail(htStringWithFormat("\"%s\" must be a string, not %s", name, typeName(*value)));
             return {};
         }
         return std::string(value->GetString(), value->GetStringLength());
@@ -159,7 +131,7 @@ private:
 
 std::string regionPlace(size_t index, uint64_t address)
 {
-    return format("region %zu (at 0x%" PRIx64 ")", index, address);
+    return htStringWithFormat("region %zu (at 0x%" PRIx64 ")", index, address);
 }
 
 // The page runs of one region, checked against it: [firstPage, count,
@@ -168,11 +140,11 @@ bool readPageRuns(const rapidjson::Value& list, FieldReader& fields, uint64_t re
                   std::vector<HTSnapshotPageRun>& runs, uint64_t& identified, uint64_t& covered)
 {
     if (!list.IsArray()) {
-        fields.fail(format("\"pages\" must be an array, not %s", typeName(list)));
+        fields.fail(htStringWithFormat("\"pages\" must be an array, not %s", typeName(list)));
         return false;
     }
     if (list.Size() % 4 != 0) {
-        fields.fail(format("\"pages\" holds %u numbers, not four to a run", list.Size()));
+        fields.fail(htStringWithFormat("\"pages\" holds %u numbers, not four to a run", list.Size()));
         return false;
     }
     uint64_t end = 0;
@@ -181,7 +153,8 @@ bool readPageRuns(const rapidjson::Value& list, FieldReader& fields, uint64_t re
         const unsigned run = i / 4;
         for (rapidjson::SizeType j = i; j < i + 4; ++j) {
             if (!list[j].IsUint64()) {
-                fields.fail(format("page run %u of \"pages\" must hold whole numbers, not %s", run, typeName(list[j])));
+                fields.fail(htStringWithFormat("page run %u of \"pages\" must hold whole numbers, not %s", run,
+                                               typeName(list[j])));
                 return false;
             }
         }
@@ -190,38 +163,39 @@ bool readPageRuns(const rapidjson::Value& list, FieldReader& fields, uint64_t re
         const uint64_t disposition = list[i + 2].GetUint64();
         const uint64_t identity = list[i + 3].GetUint64();
         if (count == 0) {
-            fields.fail(format("page run %u of \"pages\" holds no pages", run));
+            fields.fail(htStringWithFormat("page run %u of \"pages\" holds no pages", run));
             return false;
         }
         if (first < end) {
-            fields.fail(format("page run %u of \"pages\" starts at page %" PRIu64 ", before page %" PRIu64
-                               ", the end of the run before it: runs must ascend without overlapping",
-                               run, first, end));
+            fields.fail(htStringWithFormat("page run %u of \"pages\" starts at page %" PRIu64 ", before page %" PRIu64
+                                           ", the end of the run before it: runs must ascend without overlapping",
+                                           run, first, end));
             return false;
         }
         if (first > regionPages || count > regionPages - first) {
-            fields.fail(format("page run %u of \"pages\" (%" PRIu64 " page%s from page %" PRIu64
-                               ") runs past page %" PRIu64 ", the end of the region",
-                               run, count, plural(count), first, regionPages));
+            fields.fail(htStringWithFormat("page run %u of \"pages\" (%" PRIu64 " page%s from page %" PRIu64
+                                           ") runs past page %" PRIu64 ", the end of the region",
+                                           run, count, plural(count), first, regionPages));
             return false;
         }
         if (disposition == 0 || (disposition & ~static_cast<uint64_t>(kDispositionBits)) != 0) {
-            fields.fail(format("page run %u of \"pages\" has disposition 0x%" PRIx64 ", which no page query gives", run,
-                               disposition));
+            fields.fail(htStringWithFormat(
+                "page run %u of \"pages\" has disposition 0x%" PRIx64 ", which no page query gives", run, disposition));
             return false;
         }
         if (identity != 0 && (identity >= kIdentityLimit || count > kIdentityLimit - identity)) {
-            fields.fail(format("page run %u of \"pages\" gives its %" PRIu64 " page%s identities from %" PRIu64
-                               " on: the largest a page may have is %" PRIu64,
-                               run, count, plural(count), identity, kIdentityLimit - 1));
+            fields.fail(htStringWithFormat("page run %u of \"pages\" gives its %" PRIu64
+                                           " page%s identities from %" PRIu64
+                                           " on: the largest a page may have is %" PRIu64,
+                                           run, count, plural(count), identity, kIdentityLimit - 1));
             return false;
         }
         covered += count;
         if (identity != 0) identified += count;
         if (covered > HTSnapshotGraph::kMaxRunPages || identified > HTSnapshotGraph::kMaxIdentifiedPages) {
-            fields.fail(format("page run %u of \"pages\" takes the snapfile's page runs past the %" PRIu64
-                               " pages (%" PRIu64 " with identities) a snapfile may hold",
-                               run, HTSnapshotGraph::kMaxRunPages, HTSnapshotGraph::kMaxIdentifiedPages));
+            fields.fail(htStringWithFormat("page run %u of \"pages\" takes the snapfile's page runs past the %" PRIu64
+                                           " pages (%" PRIu64 " with identities) a snapfile may hold",
+                                           run, HTSnapshotGraph::kMaxRunPages, HTSnapshotGraph::kMaxIdentifiedPages));
             return false;
         }
         end = first + count;
@@ -235,11 +209,11 @@ bool readRegion(const rapidjson::Value& value, size_t index, uint64_t pageSize, 
                 HTSnapshotRegion& region, uint64_t& identified, uint64_t& covered, std::string& problem)
 {
     if (!value.IsObject()) {
-        problem = format("region %zu must be an object, not %s", index, typeName(value));
+        problem = htStringWithFormat("region %zu must be an object, not %s", index, typeName(value));
         return false;
     }
     // The place is known once the address is.
-    std::string place = format("region %zu", index);
+    std::string place = htStringWithFormat("region %zu", index);
     auto address = value.FindMember("address");
     if (address != value.MemberEnd() && address->value.IsUint64())
         place = regionPlace(index, address->value.GetUint64());
@@ -248,13 +222,15 @@ bool readRegion(const rapidjson::Value& value, size_t index, uint64_t pageSize, 
     region.length = fields.number("length", 1, kMaxU64);
     if (!fields.ok()) return false;
     if (region.length > kMaxU64 - region.address) {
-        fields.fail(format("its length, %" PRIu64 ", runs past the end of the address space", region.length));
+        fields.fail(
+            htStringWithFormat("its length, %" PRIu64 ", runs past the end of the address space", region.length));
         return false;
     }
     if (region.address < previousEnd) {
-        fields.fail(format("it starts below 0x%" PRIx64 ", the end of the region before it: regions must ascend "
-                           "without overlapping",
-                           previousEnd));
+        fields.fail(htStringWithFormat("it starts below 0x%" PRIx64
+                                       ", the end of the region before it: regions must ascend "
+                                       "without overlapping",
+                                       previousEnd));
         return false;
     }
     region.type = fields.string("type");
@@ -287,7 +263,7 @@ bool readRegion(const rapidjson::Value& value, size_t index, uint64_t pageSize, 
 bool readRegions(const rapidjson::Value& list, HTSnapshotGraph& graph, std::string& problem)
 {
     if (!list.IsArray()) {
-        problem = format("\"regions\" must be an array, not %s", typeName(list));
+        problem = htStringWithFormat("\"regions\" must be an array, not %s", typeName(list));
         return false;
     }
     uint64_t previousEnd = 0;
@@ -308,7 +284,7 @@ bool readRegions(const rapidjson::Value& list, HTSnapshotGraph& graph, std::stri
 bool readGraph(const rapidjson::Document& document, HTSnapshotGraph& graph, std::string& problem)
 {
     if (!document.IsObject()) {
-        problem = format("not a heft snapfile: the document is %s, not an object", typeName(document));
+        problem = htStringWithFormat("not a heft snapfile: the document is %s, not an object", typeName(document));
         return false;
     }
     FieldReader fields(document, "", problem);
@@ -316,12 +292,13 @@ bool readGraph(const rapidjson::Document& document, HTSnapshotGraph& graph, std:
     if (fields.ok() &&
         (formatName == nullptr || !formatName->IsString() ||
          std::string_view(formatName->GetString(), formatName->GetStringLength()) != HTSnapshotGraph::kFormat)) {
-        problem = format("not a heft snapfile: it has no \"format\": \"%s\" member", HTSnapshotGraph::kFormat);
+        problem =
+            htStringWithFormat("not a heft snapfile: it has no \"format\": \"%s\" member", HTSnapshotGraph::kFormat);
     }
     const uint64_t version = fields.number("version", 0, kMaxU64);
     if (fields.ok() && version != HTSnapshotGraph::kVersion) {
-        fields.fail(format("it is of version %" PRIu64 "; this heft reads version %" PRIu64, version,
-                           HTSnapshotGraph::kVersion));
+        fields.fail(htStringWithFormat("it is of version %" PRIu64 "; this heft reads version %" PRIu64, version,
+                                       HTSnapshotGraph::kVersion));
     }
     graph.snapshotPid = static_cast<int32_t>(fields.number("pid", 1, kMaxPid));
     graph.snapshotProcessName = fields.string("name");
@@ -329,7 +306,7 @@ bool readGraph(const rapidjson::Document& document, HTSnapshotGraph& graph, std:
     graph.snapshotIs64Bit = fields.boolean("is64Bit");
     graph.snapshotPageSize = static_cast<uint32_t>(fields.number("pageSize", 512, uint64_t{1} << 30));
     if (fields.ok() && (graph.snapshotPageSize & (graph.snapshotPageSize - 1)) != 0)
-        fields.fail(format("\"pageSize\" is %u, not a power of two", graph.snapshotPageSize));
+        fields.fail(htStringWithFormat("\"pageSize\" is %u, not a power of two", graph.snapshotPageSize));
     graph.snapshotPhysHeft = fields.number("physHeft", 0, kMaxU64);
     graph.snapshotPhysHeftPeak = fields.number("physHeftPeak", 0, kMaxU64);
     graph.snapshotShowsPhysHeft = fields.boolean("showsPhysHeft");
@@ -361,7 +338,8 @@ std::unique_ptr<HTSnapshotGraph> HTSnapshotGraph::openSnapshotGraph(std::string_
     // The parser takes a NUL byte for the end of the text, and would read
     // no further: JSON text holds none.
     if (const size_t nul = contents.find('\0'); nul != std::string_view::npos) {
-        if (error) *error = formatError(format("not a heft snapfile: bad JSON at byte %zu (a NUL byte)", nul));
+        if (error)
+            *error = formatError(htStringWithFormat("not a heft snapfile: bad JSON at byte %zu (a NUL byte)", nul));
         return nullptr;
     }
     rapidjson::Document document;
@@ -371,9 +349,10 @@ std::unique_ptr<HTSnapshotGraph> HTSnapshotGraph::openSnapshotGraph(std::string_
         const size_t offset = document.GetErrorOffset();
         const char* reason = rapidjson::GetParseError_En(document.GetParseError());
         if (error)
-            *error = formatError(offset >= contents.size()
-                                     ? format("the file ends early, at byte %zu: it is cut short", offset)
-                                     : format("not a heft snapfile: bad JSON at byte %zu (%s)", offset, reason));
+            *error =
+                formatError(offset >= contents.size()
+                                ? htStringWithFormat("the file ends early, at byte %zu: it is cut short", offset)
+                                : htStringWithFormat("not a heft snapfile: bad JSON at byte %zu (%s)", offset, reason));
         return nullptr;
     }
     auto graph = std::make_unique<HTSnapshotGraph>();
@@ -405,7 +384,7 @@ std::unique_ptr<HTSnapshotGraph> HTSnapshotGraph::openSnapshotFile(const std::st
     const uint64_t size = static_cast<uint64_t>(status.st_size);
     if (size > kMaxFileSize) {
         if (error)
-            *error = formatError(format(
+            *error = formatError(htStringWithFormat(
                 "the file holds %" PRIu64 " bytes, more than the %" PRIu64 " a snapfile may hold", size, kMaxFileSize));
         return nullptr;
     }

@@ -1,6 +1,7 @@
 #include "process/HTKernelProcess.h"
 
 #include "base/HTNoticeLog.h"
+#include "base/HTStringFormat.h"
 #include "model/HTAuxData.h"
 #include "model/HTAuxDataMap.h"
 #include "model/HTMemoryRegion.h"
@@ -8,7 +9,6 @@
 #include <algorithm>
 #include <array>
 #include <cerrno>
-#include <cstdarg>
 #include <cstdio>
 #include <cstring>
 #include <string_view>
@@ -67,17 +67,6 @@ constexpr std::array<const char*, 11> kCounterNames = {
 // The text of a fixed 80-byte name field, which need not be terminated.
 std::string_view nameField(const char* field) { return {field, strnlen(field, MACH_ZONE_NAME_MAX_LEN)}; }
 
-// Site names are short: a format, numbers and at most one name field.
-[[gnu::format(printf, 1, 2)]] std::string formatted(const char* format, ...)
-{
-    char text[256];
-    va_list arguments;
-    va_start(arguments, format);
-    std::vsnprintf(text, sizeof(text), format, arguments);
-    va_end(arguments);
-    return text;
-}
-
 uint64_t siteType(const mach_memory_info_t& info) { return info.flags & VM_KERN_SITE_TYPE; }
 
 // The name a site has by itself, before a zone's name is added. Every site
@@ -93,22 +82,22 @@ std::string ownSiteName(const mach_memory_info_t& info, const HTKernelProcess::K
     switch (siteType(info)) {
     case VM_KERN_SITE_TAG:
         if (site < kTagNames.size() && kTagNames[site] != nullptr) return kTagNames[site];
-        return formatted("VM_KERN_MEMORY_%llu", static_cast<unsigned long long>(site));
+        return htStringWithFormat("VM_KERN_MEMORY_%llu", static_cast<unsigned long long>(site));
     case VM_KERN_SITE_KMOD: {
         auto module = kexts.find(site);
         if (module != kexts.end() && !module->second.empty()) return module->second;
-        return formatted("unloaded kmod %llu", static_cast<unsigned long long>(site));
+        return htStringWithFormat("unloaded kmod %llu", static_cast<unsigned long long>(site));
     }
     case VM_KERN_SITE_KERNEL:
         if (site != 0 && symbolicator != nullptr)
             if (auto symbol = symbolicator->symbolName(site); symbol && !symbol->empty()) return *symbol;
-        return formatted("site 0x%llx", static_cast<unsigned long long>(site));
+        return htStringWithFormat("site 0x%llx", static_cast<unsigned long long>(site));
     case VM_KERN_SITE_COUNTER:
         if (site < kCounterNames.size()) return kCounterNames[site];
-        return formatted("VM_KERN_COUNT_%llu", static_cast<unsigned long long>(site));
+        return htStringWithFormat("VM_KERN_COUNT_%llu", static_cast<unsigned long long>(site));
     default:
-        return formatted("unknown site (0x%x, 0x%llx)", static_cast<unsigned>(siteType(info)),
-                         static_cast<unsigned long long>(site));
+        return htStringWithFormat("unknown site (0x%x, 0x%llx)", static_cast<unsigned>(siteType(info)),
+                                  static_cast<unsigned long long>(site));
     }
 }
 
