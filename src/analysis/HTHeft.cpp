@@ -68,7 +68,11 @@ void HTHeft::gatherData()
     }
 
     if (earlyExit()) HTProcess::_addGlobalError(kEarlyExitError);
+    analyzeGatheredData();
+}
 
+void HTHeft::analyzeGatheredData()
+{
     // Pages that processes share after a fork become objects of their own
     // before anything is routed.
     HTSharedPageResolver(processes_).resolve();

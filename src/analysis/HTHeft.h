@@ -78,6 +78,10 @@ public:
     // routes the regions, finalises the objects and computes the hefts.
     // Called once.
     void gatherData();
+    // The steps after the gathering, for processes gathered one by one
+    // beforehand (each at its own exit). Called once, instead of
+    // gatherData.
+    void analyzeGatheredData();
     // Finalises every memory object once.
     void finalizeObjects();
 

@@ -25,7 +25,21 @@ enum : int {
     OptionSort = 260,
     OptionUnmapped = 261,
     OptionSnapshotDir = 262,
+    OptionExec = 263,
 };
+
+constexpr const char* kExecUsage = "heft [options] --exec -- PROGRAM [ARGS...]";
+
+// Where "--exec" stands among the arguments, before any "--" that ends
+// heft's options; argc when it does not.
+int execOptionIndex(int argc, char** argv)
+{
+    for (int i = 1; i < argc; ++i) {
+        if (std::strcmp(argv[i], "--") == 0) break;
+        if (std::strcmp(argv[i], "--exec") == 0) return i;
+    }
+    return argc;
+}
 
 // Fills the caller's error slot, if any, and reports failure.
 bool fail(HTError* error, int64_t code, std::optional<std::string> description = std::nullopt)
@@ -98,8 +112,20 @@ std::unique_ptr<HTHeftArgs> HTHeftArgs::initWithArgc(int argc, char** argv, HTEr
         {"wired", no_argument, nullptr, OptionWired},
         {"unmapped", no_argument, nullptr, OptionUnmapped},
         {"snapshot-dir", required_argument, nullptr, OptionSnapshotDir},
+        {"exec", no_argument, nullptr, OptionExec},
         {nullptr, 0, nullptr, 0},
     };
+
+    // What follows --exec is the program's command line, options and all:
+    // heft parses only what comes before it.
+    const int execIndex = execOptionIndex(argc, argv);
+    if (execIndex < argc) {
+        args->runsProgram_ = true;
+        int first = execIndex + 1;
+        if (first < argc && std::strcmp(argv[first], "--") == 0) ++first;
+        args->programArguments_.assign(argv + first, argv + argc);
+        argc = execIndex;
+    }
 
     resetOptionParser();
     int option;
@@ -120,7 +146,23 @@ std::unique_ptr<HTHeftArgs> HTHeftArgs::initWithArgc(int argc, char** argv, HTEr
 
     // Operands are told apart (pid, name, snapfile) only at target selection.
     for (int i = optind; i < argc; ++i) args->potentialTargetProcesses_.add(argv[i]);
+    if (args->runsProgram_ && !args->_checkProgramRun(error)) return nullptr;
     return args;
+}
+
+bool HTHeftArgs::_checkProgramRun(HTError* error) const
+{
+    if (programArguments_.empty())
+        return fail(error, HTHeftErrorCodeOption, htStringWithFormat("--exec needs a program to run: %s", kExecUsage));
+    const bool otherTargets = targetAll_ || searchForUnmapped_ || !targetPids_.empty() ||
+        !potentialTargetProcesses_.empty() || !excludedPidsOrProcesses_.empty();
+    if (otherTargets)
+        return fail(error, HTHeftErrorCodeOption,
+                    "--exec reports the program it runs (and with -t the processes it starts): it takes no "
+                    "-a, -p, --pid, -x, --unmapped or other targets");
+    if (!snapshotDirectory_.empty())
+        return fail(error, HTHeftErrorCodeOption, "--snapshot-dir saves live processes: it cannot be used with --exec");
+    return true;
 }
 
 bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
@@ -177,6 +219,10 @@ bool HTHeftArgs::_applyOption(int option, const char* argument, HTError* error)
     case OptionUnmapped:
         searchForUnmapped_ = true;
         break;
+    case OptionExec:
+        // Only an abbreviation reaches here: the full word was split off.
+        return fail(error, HTHeftErrorCodeOption,
+                    htStringWithFormat("--exec is written out in full, after heft's own options: %s", kExecUsage));
     case OptionSnapshotDir:
         if (*argument == '\0') return fail(error, HTHeftErrorCodeOption, "--snapshot-dir needs a directory");
         snapshotDirectory_ = argument;

@@ -41,6 +41,10 @@ public:
     bool targetAll() const { return targetAll_; }
     bool searchForUnmapped() const { return searchForUnmapped_; }
     const std::optional<std::string>& JSONOutputFile() const { return JSONOutputFile_; }
+    bool targetChildren() const { return targetChildren_; }
+    // --exec: the program to run and report at its exit, with its arguments.
+    bool runsProgram() const { return runsProgram_; }
+    const std::vector<std::string>& programArguments() const { return programArguments_; }
 
 private:
     // One option as getopt_long reported it; false with *error filled when
@@ -51,6 +55,8 @@ private:
     bool _applyFormat(const char* argument, HTError* error);
     // Resolves the conflicts of --unmapped with the other modes.
     void _settleUnmapped();
+    // A program run takes no other targets; false with *error filled.
+    bool _checkProgramRun(HTError* error) const;
 
     bool targetChildren_ = false;
     bool targetAll_ = false;
@@ -66,6 +72,8 @@ private:
     std::optional<std::string> JSONOutputFile_;
     // --snapshot-dir: empty when not given.
     std::string snapshotDirectory_;
+    bool runsProgram_ = false;
+    std::vector<std::string> programArguments_;
     HTProcess::PidDescriptionMap targetPids_;
     HTOrderedStringSet potentialTargetProcesses_;
     HTOrderedStringSet excludedPidsOrProcesses_;

@@ -4,6 +4,7 @@
 #include "base/HTNoticeLog.h"
 #include "base/HTOutputFile.h"
 #include "cli/HTCancelHandler.h"
+#include "cli/HTExecRun.h"
 #include "cli/HTHeftArgs.h"
 #include "cli/HTUsage.h"
 #include "output/HTOutputFormatterJSON.h"
@@ -88,6 +89,64 @@ bool prepareSnapshots(HTSettings& settings, HTPlatform& platform)
     return true;
 }
 
+// Prints the report of what was gathered and returns `status`, or 1 when
+// the report could not be written whole.
+int printReport(HTHeft& heft, const HTSettings& settings, const std::shared_ptr<HTOutputFormatterJSON>& jsonFormatter,
+                int status)
+{
+    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings));
+    if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
+    heft.printOutputVerbose(settings.verbose, settings.summarize);
+    if (jsonFormatter && jsonFormatter->writeError()) {
+        std::fprintf(stderr, "%s\n", jsonFormatter->writeError()->c_str());
+        status = 1;
+    }
+    // The error of a failed write of the report is still in errno: after
+    // it, the report is only written to, and every later write fails alike.
+    if (std::fflush(stdout) != 0 || std::ferror(stdout)) {
+        std::fprintf(stderr, "Unable to write the report: %s\n", std::strerror(errno != 0 ? errno : EIO));
+        status = 1;
+    }
+    return status;
+}
+
+// Ends the run with `status`, when it is to end at once: the formatters
+// finish their files, and nothing else is freed.
+int finish(HTHeft& heft, std::shared_ptr<HTOutputFormatterJSON> jsonFormatter, int status, bool exitWhenDone)
+{
+    if (exitWhenDone) {
+        heft.finishOutput();
+        jsonFormatter.reset();
+        std::fflush(nullptr);
+        std::_Exit(status);
+    }
+    return status;
+}
+
+// heft --exec: runs the program, reports it as it was at its exit, and
+// exits with its status, whatever became of the report.
+int runProgram(const HTHeftArgs& args, const HTSettings& settings, const std::shared_ptr<HTPlatform>& platform,
+               bool exitWhenDone, const char*& stage)
+{
+    auto jsonFormatter = openJSONFormatter(args, settings, *platform);
+    stage = "running the program";
+    HTExecRun execRun(platform, settings, args.targetRequest().skipIdleExitClean);
+    const HTProgramEnd end = execRun.run(args.programArguments(), args.targetChildren());
+    const int status = HTExecRun::exitStatus(end);
+    tellNotices();
+    const std::string problem = HTExecRun::problem(end, args.programArguments().front());
+    if (!problem.empty()) std::fprintf(stderr, "%s\n", problem.c_str());
+    if (end.leftRunning > 0)
+        std::fprintf(stderr, "heft: %d process%s started by the program %s still running at its end; not reported\n",
+                     end.leftRunning, end.leftRunning == 1 ? "" : "es", end.leftRunning == 1 ? "was" : "were");
+    if (execRun.corpses().empty()) return status;
+    stage = "writing the report";
+    HTHeft heft(execRun.corpses(), settings);
+    heft.analyzeGatheredData();
+    printReport(heft, settings, jsonFormatter, status);
+    return finish(heft, std::move(jsonFormatter), status, exitWhenDone);
+}
+
 // The run itself; `stage` says what it is doing, for a message if memory
 // runs out.
 int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, bool exitWhenDone, const char*& stage)
@@ -104,6 +163,7 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
         return 1;
     }
     if (!settings.snapshotDirectory.empty() && !prepareSnapshots(settings, *platform)) return 1;
+    if (args->runsProgram()) return runProgram(*args, settings, platform, exitWhenDone, stage);
 
     stage = "listing the processes";
     HTTargetSelection selection(platform, settings, args->targetRequest());
@@ -131,26 +191,8 @@ int runHeft(int argc, char** argv, const std::shared_ptr<HTPlatform>& platform, 
     gather(heft, *platform);
     stage = "writing the report";
 
-    heft.addOutputFormatter(std::make_shared<HTOutputFormatterText>(settings));
-    if (jsonFormatter) heft.addOutputFormatter(jsonFormatter);
-    heft.printOutputVerbose(settings.verbose, settings.summarize);
-    if (jsonFormatter && jsonFormatter->writeError()) {
-        std::fprintf(stderr, "%s\n", jsonFormatter->writeError()->c_str());
-        status = 1;
-    }
-    // The error of a failed write of the report is still in errno: after
-    // it, the report is only written to, and every later write fails alike.
-    if (std::fflush(stdout) != 0 || std::ferror(stdout)) {
-        std::fprintf(stderr, "Unable to write the report: %s\n", std::strerror(errno != 0 ? errno : EIO));
-        status = 1;
-    }
-    if (exitWhenDone) {
-        heft.finishOutput();
-        jsonFormatter.reset();
-        std::fflush(nullptr);
-        std::_Exit(status);
-    }
-    return status;
+    status = printReport(heft, settings, jsonFormatter, status);
+    return finish(heft, std::move(jsonFormatter), status, exitWhenDone);
 }
 
 }  // namespace

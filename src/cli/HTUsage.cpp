@@ -28,6 +28,7 @@ void printUsage()
         "\t--vmObjectDirty\t\t\tinterpret dirty memory as viewed by VM objects in the kernel",
         "\t--unmapped\t\t\t\tsearch all processes for unmapped memory owned by the target processes",
         "\t--snapshot-dir <dir>\t\t\talso save each process analysed as a snapfile NAME.PID.heftsnap in <dir>",
+        "\t--exec -- <program> [args]\t\trun the program and report its memory as it exits (last option)",
     };
 
     for (const char* line : linesBeforeSort) std::fprintf(stdout, "%s\n", line);

@@ -21,17 +21,32 @@ namespace {
 // step a system call of its own (thousands of them in a run over every
 // process); more would raise heft's peak memory for little gain. A user's
 // own choice is kept, and where heft cannot restart it runs on as it is.
+// The restarted heft puts the caller's environment back, so that a program
+// it runs (--exec) inherits what the caller had: glibc has read the
+// tunable by then.
 void restartWithHugePageHeaps(char** argv)
 {
     constexpr const char* kName = "GLIBC_TUNABLES";
     constexpr const char* kTunable = "glibc.malloc.hugetlb";
     constexpr const char* kSettings = "glibc.malloc.hugetlb=1:glibc.malloc.top_pad=8388608";
+    // The caller's value, "=" and the value, or "" when it had none.
+    constexpr const char* kCallersValue = "HEFT_CALLERS_GLIBC_TUNABLES";
+    if (const char* callers = std::getenv(kCallersValue)) {
+        if (*callers == '=')
+            ::setenv(kName, callers + 1, 1);
+        else
+            ::unsetenv(kName);
+        ::unsetenv(kCallersValue);
+        return;
+    }
     const char* current = std::getenv(kName);
     if (current != nullptr && std::strstr(current, kTunable) != nullptr) return;
     const std::string previous = current != nullptr ? current : "";
     const std::string value = (previous.empty() ? "" : previous + ":") + kSettings;
-    if (::setenv(kName, value.c_str(), 1) != 0) return;
+    const std::string callers = current != nullptr ? "=" + previous : "";
+    if (::setenv(kName, value.c_str(), 1) != 0 || ::setenv(kCallersValue, callers.c_str(), 1) != 0) return;
     ::execv("/proc/self/exe", argv);
+    ::unsetenv(kCallersValue);
     if (current != nullptr)
         ::setenv(kName, previous.c_str(), 1);
     else

@@ -10,6 +10,7 @@
 // set on failure, kernel return codes from the task calls.
 
 #include "platform/HTPlatformTypes.h"
+#include "platform/HTProgramRun.h"
 #include "platform/HTTaskPort.h"
 
 #include <cerrno>
@@ -185,6 +186,21 @@ public:
     virtual std::vector<HTLoadedModule> OSKextCopyLoadedKextInfo() { return {}; }
     // A symbol resolver for the running kernel; null when there is none.
     virtual std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() { return nullptr; }
+
+    // --- a program run to its exit ----------------------------------------
+    // Starts `arguments` (a program, looked up in PATH, and its arguments)
+    // as a child with the caller's standard streams, holds it at its exit
+    // and calls `atExit` while it is held; with `followChildren`, the same
+    // for every process it starts, each at its own exit. Returns when the
+    // program has ended. While it runs, the keyboard's interrupt and quit
+    // reach the program alone.
+    virtual HTProgramEnd runProgram(const std::vector<std::string>& arguments, bool followChildren,
+                                    const std::function<void(const HTHeldExit&)>& atExit)
+    {
+        HTProgramEnd end;
+        end.startError = ENOSYS;
+        return end;
+    }
 
     // --- the calling program -------------------------------------------
     // The system and its architecture, as a snapfile names them ("Linux

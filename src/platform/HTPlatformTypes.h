@@ -26,6 +26,19 @@ inline constexpr uint32_t PROC_FLAG_SYSTEM = 0x1;
 // Exiting: the process is on its way out and its memory is being freed.
 inline constexpr uint32_t PROC_FLAG_INEXIT = 0x4;
 inline constexpr uint32_t PROC_FLAG_LP64 = 0x10;
+inline constexpr uint32_t PROC_FLAG_CONTROLT = 0x80;
+inline constexpr uint32_t PROC_FLAG_THCWD = 0x100;
+inline constexpr uint32_t PROC_FLAG_PSUGID = 0x2000;
+inline constexpr uint32_t PROC_FLAG_EXEC = 0x4000;
+
+// The kernel's own process flags, which a process held at its exit is
+// described by.
+inline constexpr uint32_t P_CONTROLT = 0x2;      // has a controlling terminal
+inline constexpr uint32_t P_LP64 = 0x4;          // 64-bit
+inline constexpr uint32_t P_SUGID = 0x100;       // changed its user or group id
+inline constexpr uint32_t P_SYSTEM = 0x200;      // a system process
+inline constexpr uint32_t P_EXEC = 0x4000;       // has run a program since it began
+inline constexpr uint32_t P_THCWD = 0x01000000;  // a thread has a working directory of its own
 
 // pbi_status / pbsi_status values.
 inline constexpr uint32_t SIDL = 1;

@@ -141,6 +141,8 @@ protected:
         phys_heft_peak_ = peak;
     }
     void _setPageTableSize(uint64_t bytes) { ledgers_[0] = bytes; }
+    // For subclasses handed a task port rather than opening one.
+    void _setTask(std::shared_ptr<HTTaskPort> task) { task_ = std::move(task); }
     std::vector<std::shared_ptr<HTImage>>& _images() { return images_; }
 
 private:

@@ -58,6 +58,7 @@ std::string parsed(const std::string& line, std::string* standardError)
     for (const auto& [pid, name] : request.targetPids) pids.push_back(std::to_string(pid) + (name ? "?" : ""));
     if (!pids.empty()) text += " p=" + joined(pids);
     if (!request.excludedPidsOrProcesses.empty()) text += " x=" + joined(request.excludedPidsOrProcesses);
+    if (args->runsProgram()) text += " exec=" + joined(args->programArguments());
     // -a and --unmapped are what need root.
     EXPECT_EQ(args->targetAll(), request.targetAll);
     EXPECT_EQ(args->searchForUnmapped(), request.searchForUnmapped);

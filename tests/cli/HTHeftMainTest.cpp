@@ -71,6 +71,16 @@ TEST_F(HTHeftMainTest, Runs)
             std::ofstream(directory + "/" + line.argument) << editedSnapfile(line.text("edit").value_or(""));
             platform_->existingFiles.insert(directory + "/" + line.argument);
         }
+        if (line.kind == "program") {
+            platform_->programExits.clear();
+            std::istringstream pids(line.text("exits").value_or(""));
+            for (int32_t pid; pids >> pid;)
+                platform_->programExits.push_back(
+                    {pid, nullptr, P_LP64, static_cast<uint32_t>(line.number("dirty")), line.number("pagetable")});
+            platform_->programEnd = {static_cast<int>(line.number("start-error")),
+                                     static_cast<int>(line.number("trace-error")),
+                                     static_cast<int>(line.number("status")), static_cast<int>(line.number("left"))};
+        }
         if (line.kind != "run") continue;
         std::istringstream words(std::regex_replace(text.substr(4), std::regex("DIR"), directory));
         std::vector<std::string> arguments{std::istream_iterator<std::string>(words), {}};

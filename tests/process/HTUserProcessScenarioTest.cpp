@@ -7,6 +7,7 @@
 #include "model/HTMemoryRegion.h"
 #include "output/HTExpectedReport.h"
 #include "platform/fake/HTFakePlatform.h"
+#include "process/HTCorpseProcess.h"
 #include "process/HTKernelProcess.h"
 #include "process/HTKernelScript.h"
 #include "process/HTSnapfileProcess.h"
@@ -237,9 +238,11 @@ protected:
         const bool kernel = script.info.pbi_flags & PROC_FLAG_SYSTEM;
         std::shared_ptr<HTProcess> process = std::make_shared<HTScenarioProcess>(platform_, platformCode_);
         if (kernel) process = std::make_shared<HTKernelProcess>(platform_);
+        const int ownedQueries = platform_->ownedVmObjectQueries;
         process->setSettings(settings_);
         testing::internal::CaptureStderr();
-        const bool created = process->initWithBsdInfo(script.info);
+        const bool created =
+            line.text("corpse") ? createCorpse(process, line, script, out) : process->initWithBsdInfo(script.info);
         if (created) {
             process->setHiddenFromDisplay(line.number("hidden"));
             const bool exited = script.exited;
@@ -256,9 +259,31 @@ protected:
             return;
         }
         out << "calls: " << platform_->regionLookups << " region, " << platform_->basicRegionLookups << " basic, "
-            << platform_->ledgerTemplateReads << " template; queries";
+            << platform_->ledgerTemplateReads << " template, " << platform_->ownedVmObjectQueries - ownedQueries
+            << " owned; queries";
         for (const auto& [address, size] : platform_->pageQueries) out << " " << hex(address) << "+" << hex(size);
         out << "\n\n";
+    }
+
+    // `gather corpse NAME procflags F dirty D ledgers A,B port 0`: the
+    // scripted process read as a corpse, with the identity given.
+    bool createCorpse(std::shared_ptr<HTProcess>& process, const HTScenarioLine& line, HTFakePlatform::Process& script,
+                      std::ostringstream& out)
+    {
+        auto corpse = std::make_shared<HTCorpseProcess>(platform_);
+        corpse->setSettings(process->settings());
+        process = corpse;
+        const auto flags = static_cast<uint32_t>(line.number("procflags"));
+        out << "corpse record flags " << hex(HTCorpseProcess::recordFlagsForProcFlags(flags)) << "\n";
+        const int32_t pid = static_cast<int32_t>(script.info.pbi_pid);
+        if (!corpse->initWithCorpse(line.number("port", 1) ? platform_->corpsePort(pid) : nullptr, pid,
+                                    *line.text("corpse"), static_cast<uint32_t>(line.number("dirty")), flags))
+            return false;
+        out << "corpse " << (corpse->is64bit() ? "64" : "32") << "-bit\n";
+        const std::vector<int64_t> ledgers = listOf(line.text("ledgers").value_or(""));
+        const std::vector<uint64_t> values(ledgers.begin(), ledgers.end());
+        corpse->addLedgerData(values.data(), values.size());
+        return true;
     }
 
     // A snapfile of tests/data/snapfiles, read as a process.

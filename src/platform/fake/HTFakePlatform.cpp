@@ -186,6 +186,26 @@ kern_return_t HTFakePlatform::task_for_pid(int32_t pid, std::shared_ptr<HTTaskPo
     return KERN_SUCCESS;
 }
 
+std::shared_ptr<HTTaskPort> HTFakePlatform::corpsePort(int32_t pid)
+{
+    if (process(pid) == nullptr) return nullptr;
+    return std::make_shared<HTFakeTaskPort>(pid);
+}
+
+HTProgramEnd HTFakePlatform::runProgram(const std::vector<std::string>& arguments, bool followChildren,
+                                        const std::function<void(const HTHeldExit&)>& atExit)
+{
+    programArguments = arguments;
+    programFollowedChildren = followChildren;
+    if (programEnd.startError != 0 || programEnd.traceError != 0) return programEnd;
+    for (size_t i = 0; i < programExits.size() && (i == 0 || followChildren); ++i) {
+        HTHeldExit held = programExits[i];
+        if (!held.corpse) held.corpse = corpsePort(held.pid);
+        atExit(held);
+    }
+    return programEnd;
+}
+
 std::string HTFakePlatform::mach_error_string(kern_return_t code) { return htMachErrorString(code); }
 
 void HTFakePlatform::mach_error(const char* label, kern_return_t code)

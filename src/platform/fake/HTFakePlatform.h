@@ -97,6 +97,21 @@ public:
     void removeProcess(int32_t pid);
     Process* process(int32_t pid);
 
+    // A task port on the scripted process as a corpse: given whatever
+    // task_for_pid would answer; null for a pid not scripted.
+    std::shared_ptr<HTTaskPort> corpsePort(int32_t pid);
+
+    // --- a program run to its exit ------------------------------------------
+    // The exits runProgram reports, in order, each with the corpse port of
+    // its pid unless one is scripted: the program's, then those of the
+    // processes it started, which only a run that follows children sees.
+    // Then it ends as programEnd says.
+    std::vector<HTHeldExit> programExits;
+    HTProgramEnd programEnd;
+    // What the last runProgram was asked to run.
+    std::vector<std::string> programArguments;
+    bool programFollowedChildren = false;
+
     // Scripted state, public for tests to set.
     int listErrno = 0;            // non-zero: proc_listallpids fails with it
     int32_t argmax = 256 * 1024;  // KERN_ARGMAX
@@ -187,6 +202,8 @@ public:
                                    std::vector<mach_memory_info_t>& sites) override;
     std::vector<HTLoadedModule> OSKextCopyLoadedKextInfo() override;
     std::unique_ptr<HTKernelSymbolResolver> openKernelImageList() override;
+    HTProgramEnd runProgram(const std::vector<std::string>& arguments, bool followChildren,
+                            const std::function<void(const HTHeldExit&)>& atExit) override;
 
 private:
     // The scripted region at or after the address: its index, or the

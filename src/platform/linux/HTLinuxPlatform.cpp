@@ -1,6 +1,9 @@
 #include "platform/linux/HTLinuxPlatform.h"
 
 #include "platform/HTMachErrorText.h"
+#include "platform/linux/HTLinuxProgramRunner.h"
+#include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTProcStatParser.h"
 
 #include <cerrno>
 #include <cstdio>
@@ -147,6 +150,36 @@ int HTLinuxPlatform::ledger_template(ledger_template_info* entries, int* count)
 int HTLinuxPlatform::ledger_entries(int32_t pid, ledger_entry_info* entries, int* count)
 {
     return status_.ledgerEntries(pid, entries, count);
+}
+
+HTProgramEnd HTLinuxPlatform::runProgram(const std::vector<std::string>& arguments, bool followChildren,
+                                         const std::function<void(const HTHeldExit&)>& atExit)
+{
+    HTLinuxProgramRunner runner;
+    return runner.run(arguments, followChildren, [&](pid_t pid, bool didExec) { atExit(heldExit(pid, didExec)); });
+}
+
+HTHeldExit HTLinuxPlatform::heldExit(int32_t pid, bool didExec)
+{
+    HTHeldExit held;
+    held.pid = pid;
+    if (task_for_pid(pid, &held.corpse) != KERN_SUCCESS) held.corpse.reset();
+    // The flags Linux can tell: whether it is 64-bit, has a terminal and
+    // ran a program. It keeps no record of changed ids or of threads'
+    // own working directories.
+    proc_bsdinfo info{};
+    if (processes_.readBsdInfo(pid, info) && (info.pbi_flags & PROC_FLAG_LP64)) held.procFlags |= P_LP64;
+    thread_local HTProcBuffer buffer;
+    if (processes_.readProcessFile(pid, "/stat", buffer)) {
+        std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
+        if (stat && stat->tty_nr != 0) held.procFlags |= P_CONTROLT;
+    }
+    if (didExec) held.procFlags |= P_EXEC;
+    ledger_entry_info pageTable{};
+    int count = 1;
+    if (status_.ledgerEntries(pid, &pageTable, &count) == 0 && count == 1)
+        held.pageTableBytes = static_cast<uint64_t>(pageTable.lei_balance);
+    return held;
 }
 
 std::optional<std::string> HTLinuxPlatform::realpath(const std::string& path) { return paths_.realpath(path); }

@@ -63,6 +63,10 @@ public:
     int ledger_template(ledger_template_info* entries, int* count) override;
     int ledger_entries(int32_t pid, ledger_entry_info* entries, int* count) override;
 
+    // A program held at each exit (HTLinuxProgramRunner.h).
+    HTProgramEnd runProgram(const std::vector<std::string>& arguments, bool followChildren,
+                            const std::function<void(const HTHeldExit&)>& atExit) override;
+
     // The path cache (HTLinuxPathCache.h).
     std::optional<std::string> realpath(const std::string& path) override;
 
@@ -80,6 +84,9 @@ public:
     bool stat(const char* path) override;
 
 private:
+    // What heft learns of a process held at its exit.
+    HTHeldExit heldExit(int32_t pid, bool didExec);
+
     HTLinuxProcessTable processes_;
     HTLinuxStatusReader status_{processes_};
     HTLinuxMappings mappings_;
