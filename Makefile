@@ -1,6 +1,9 @@
 # The two commands a new user runs: `make run` and `make test`.
 JOBS ?= $(shell nproc)
 BUILD_DIR ?= build
+# Where `make install` puts heft and its manual page; DESTDIR is prefixed to
+# it for staged installs.
+PREFIX ?= /usr/local
 TEST_DIR ?= build-asan
 TSAN_DIR ?= build-tsan
 CLANG_DIR ?= build-clang
@@ -11,7 +14,7 @@ FUZZ_TIME ?=
 # The tests that run threads of the gathering.
 TSAN_TESTS ?= HTHeftGather*
 
-.PHONY: all setup build run test fuzz fuzz-build bench format lint clean
+.PHONY: all setup build install run test fuzz fuzz-build bench format lint clean
 
 all: build
 
@@ -21,6 +24,12 @@ setup:
 build: setup
 	cmake -S . -B $(BUILD_DIR) -DCMAKE_BUILD_TYPE=Release -DHEFT_BUILD_TESTS=OFF
 	cmake --build $(BUILD_DIR) -j $(JOBS)
+
+# Installs heft in $(PREFIX)/bin and its manual page in
+# $(PREFIX)/share/man/man1.
+install: build
+	install -D -m 755 $(BUILD_DIR)/heft $(DESTDIR)$(PREFIX)/bin/heft
+	install -D -m 644 docs/heft.1 $(DESTDIR)$(PREFIX)/share/man/man1/heft.1
 
 # Builds heft and reports on every process of this machine.
 run: build

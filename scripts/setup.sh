@@ -1,7 +1,7 @@
 #!/bin/sh
 # Installs the Debian packages heft needs to build and test, when any is missing.
 set -e
-packages="cmake g++ clang clang-format clang-tidy make rapidjson-dev libgtest-dev libgmock-dev libbenchmark-dev libclang-rt-dev"
+packages="cmake g++ clang clang-format clang-tidy make rapidjson-dev libgtest-dev libgmock-dev libbenchmark-dev libclang-rt-dev groff-base"
 missing=""
 for p in $packages; do
   dpkg-query -W -f='${Status}' "$p" 2>/dev/null | grep -q "install ok installed" || missing="$missing $p"
