@@ -81,18 +81,6 @@ TEST_F(HTExecE2ETest, StatusesAndStreamsAreTheProgramsOwn)
     EXPECT_EQ(run.standardOutput.substr(0, data.size()), data);
     EXPECT_THAT(run.standardOutput.substr(data.size()), StartsWith(header));
 
-    // With -t the processes it starts are reported too, each at its own exit; without, the program alone.
-    const std::vector<std::string> family = {"--exec", "sh", "-c", "sh -c 'exit 0'; exit 0"};
-    auto corpses = [](const Outcome& outcome) {
-        size_t count = 0;
-        for (size_t at = 0; (at = outcome.standardOutput.find("(corpse): ", at)) != std::string::npos; ++at) ++count;
-        return count;
-    };
-    EXPECT_EQ(corpses(runHeft(family)), 1u);
-    std::vector<std::string> withChildren = family;
-    withChildren.insert(withChildren.begin(), "-t");
-    EXPECT_EQ(corpses(runHeft(withChildren)), 2u);
-
     // Ctrl-C reaches the program, not heft: heft leads a process group of its own, and the program interrupts it.
     if (access("/usr/bin/setsid", X_OK) != 0) GTEST_SKIP() << "/usr/bin/setsid is needed for a process group";
     run = runProgram("/bin/sh",
@@ -102,6 +90,29 @@ TEST_F(HTExecE2ETest, StatusesAndStreamsAreTheProgramsOwn)
                       kHeftBinary});
     EXPECT_EQ(run.status, 7) << run.standardError;
     EXPECT_THAT(run.standardOutput, HasSubstr("] (corpse): "));
+}
+
+TEST_F(HTExecE2ETest, ChildrenAndStopsAreFollowed)
+{
+    // With -t the processes it starts are reported too, each at its own exit; without, the program alone. Those
+    // still running when it ends are let go, and said to be.
+    const std::vector<std::string> family = {"--exec", "sh", "-c", "sh -c 'exit 0'; sleep 1 & exit 0"};
+    auto corpses = [](const Outcome& outcome) {
+        size_t count = 0;
+        for (size_t at = 0; (at = outcome.standardOutput.find("(corpse): ", at)) != std::string::npos; ++at) ++count;
+        return count;
+    };
+    EXPECT_EQ(corpses(runHeft(family)), 1u);
+    std::vector<std::string> withChildren = family;
+    withChildren.insert(withChildren.begin(), "-t");
+    const Outcome run = runHeft(withChildren);
+    EXPECT_EQ(corpses(run), 2u);
+    EXPECT_THAT(run.standardError, HasSubstr("1 process started by the program was still running at its end"));
+
+    // A stop signal stops the program until it is continued, here by a child of its own after a while.
+    const Outcome stopped = runHeft(
+        {"--exec", "sh", "-c", "(sleep 0.3; echo continued; kill -CONT $$) & kill -STOP $$; echo resumed; wait"});
+    EXPECT_THAT(stopped.standardOutput, StartsWith("continued\nresumed\n"));
 }
 
 }  // namespace

@@ -205,10 +205,15 @@ void HTLinuxProgramRunner::handleStop(pid_t pid, int status, bool followChildren
         // A signal on its way to the process: delivered as it was sent.
         ptrace(PTRACE_CONT, pid, nullptr, signal);
         return;
-    default:
-        // A new process or thread is starting; it is traced already.
+    default: {
+        // A new process or thread is starting, traced already; it is known
+        // from now on, so that it is let go at the end even when its first
+        // stop has not yet been seen.
+        unsigned long child = 0;
+        if (ptrace(PTRACE_GETEVENTMSG, pid, nullptr, &child) == 0) tracees_.try_emplace(static_cast<pid_t>(child));
         ptrace(PTRACE_CONT, pid, nullptr, 0);
         return;
+    }
     }
 }
 
