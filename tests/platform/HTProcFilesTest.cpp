@@ -6,6 +6,7 @@
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
 #include "platform/linux/HTProcStatusParser.h"
+#include "platform/linux/HTShmemParsers.h"
 
 #include <gtest/gtest.h>
 
@@ -164,4 +165,35 @@ TEST(HTProcStatusParser, MemoryFiguresOfLiveAndZombieProcesses)
     // A zombie's address space is gone, and with it the memory lines.
     EXPECT_FALSE(htParseProcStatus(capture("proc-status-zombie.txt")).hasMemoryFigures());
     EXPECT_FALSE(htParseProcStatus("VmPTE:\n").vmPTE.has_value());
+}
+
+TEST(HTShmemParsers, SystemVSegmentsAndTmpfsMounts)
+{
+    // The heading, a segment, a line cut short, a line with a word for a number, and a last line without its end.
+    const char* shm =
+        "       key      shmid perms                  size  cpid  lpid nattch   uid   gid  cuid  cgid      "
+        "atime      dtime      ctime                   rss                  swap\n"
+        "         0          3   600               8388608  4242  4243      0     0     0     0     0 "
+        "1700000000 1700000001 1700000002               4194304               4194304\n"
+        "         0          4   600 8388608 4242\n"
+        "         0          x   600 1 2 3 0 0 0 0 0 0 0 0 0 0\n"
+        "  1 0 600 4096 1 1 2 0 0 0 0 0 0 0 4096 0";
+    const std::vector<HTSysvSegment> segments = htParseSysvShm(shm);
+    ASSERT_EQ(segments.size(), 2u);
+    EXPECT_EQ(segments[0].shmid, 3);
+    EXPECT_EQ(segments[0].size, 8388608u);
+    EXPECT_EQ(segments[0].cpid, 4242);
+    EXPECT_EQ(segments[0].nattch, 0u);
+    EXPECT_EQ(segments[0].rss, 4194304u);
+    EXPECT_EQ(segments[0].swap, 4194304u);
+    EXPECT_EQ(segments[1].shmid, 0);
+    EXPECT_EQ(segments[1].nattch, 2u);
+    EXPECT_EQ(segments[1].rss, 4096u);
+
+    // The type follows the separator, after optional tags; a device that is no pair of numbers is skipped.
+    const char* mounts = "24 27 0:6 / /dev rw,relatime - devtmpfs devtmpfs rw\n"
+                         "25 24 0:23 / /dev/shm rw,relatime shared:4 - tmpfs tmpfs rw\n"
+                         "26 24 0:x / /run rw - tmpfs tmpfs rw\n"
+                         "27 24 259:1 / /tmp rw master:1 - tmpfs none rw";
+    EXPECT_EQ(htParseTmpfsDevices(mounts), (std::vector<std::pair<uint32_t, uint32_t>>{{0, 23}, {259, 1}}));
 }

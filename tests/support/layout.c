@@ -13,7 +13,10 @@
  *   tree                a child with two, the first with one: FIRST SECOND GRANDCHILD
  *   churn               children that write memory and exit, for ever: 0
  *   exit                exits at once, with status 0
- *   exit-main           the main thread exits; a worker prints its id once it is a zombie */
+ *   exit-main           the main thread exits; a worker prints its id once it is a zombie
+ *   memfd SIZE OUT      a memfd of SIZE written bytes, the first OUT paged out, then unmapped and held: FD
+ *   sysv SIZE           a System V segment of SIZE written bytes, then detached: SHMID
+ *   tmpfile PATH SIZE   PATH created with SIZE bytes written, then deleted and held open: FD */
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
@@ -24,6 +27,7 @@
 #include <string.h>
 #include <sys/mman.h>
 #include <sys/prctl.h>
+#include <sys/shm.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -141,6 +145,17 @@ static void* worker(void* unused)
     return unused;
 }
 
+/* SIZE bytes of the file written through a shared mapping, the first OUT of them paged out; left unmapped. */
+static void writeMapped(int fd, size_t size, size_t out)
+{
+    need(ftruncate(fd, (off_t)size) == 0, "ftruncate");
+    char* pages = mmap(NULL, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
+    need(pages != MAP_FAILED, "mmap");
+    touch(pages, size, 1);
+    if (out > 0) need(madvise(pages, out, MADV_PAGEOUT) == 0, "madvise");
+    munmap(pages, size);
+}
+
 /* Whether argv[i] is the directive `name` with its `count` arguments, to be skipped; its argument `k`. */
 #define IS(name, count) (strcmp(argv[i], name) == 0 && i + (count) < argc && (skip = (count), 1))
 #define NUMBER(k) ((size_t)strtoull(argv[i + (k)], NULL, 10))
@@ -186,6 +201,24 @@ int main(int argc, char** argv)
             printf("%lu\n", (unsigned long)pages);
         } else if (IS("fork", 3) && first != NULL) {
             forkFamily((int)NUMBER(1), NUMBER(2), NUMBER(3), first, firstSize);
+        } else if (IS("memfd", 2)) {
+            int fd = memfd_create("heft-layout", 0);
+            need(fd >= 0, "memfd_create");
+            writeMapped(fd, NUMBER(1), NUMBER(2));
+            printf("%d\n", fd);
+        } else if (IS("sysv", 1)) {
+            int id = shmget(IPC_PRIVATE, NUMBER(1), IPC_CREAT | 0600);
+            need(id >= 0, "shmget");
+            char* segment = shmat(id, NULL, 0);
+            need(segment != (void*)-1, "shmat");
+            touch(segment, NUMBER(1), 1);
+            shmdt(segment);
+            printf("%d\n", id);
+        } else if (IS("tmpfile", 2)) {
+            int fd = open(argv[i + 1], O_RDWR | O_CREAT | O_EXCL, 0600);
+            need(fd >= 0 && unlink(argv[i + 1]) == 0, argv[i + 1]);
+            writeMapped(fd, NUMBER(2), 0);
+            printf("%d\n", fd);
         } else if (IS("tree", 0)) {
             tree();
         } else if (IS("churn", 0)) {

@@ -74,10 +74,15 @@ int HTLinuxPlatform::sysctl(const int* name, unsigned nameLength, void* oldp, si
     return HTLinuxProcessTable::readArgMax(oldp, oldlenp);
 }
 
-int HTLinuxPlatform::sysctlbyname(const char*, void*, size_t*, const void*, size_t)
+int HTLinuxPlatform::sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen)
 {
-    errno = ENOENT;
-    return -1;
+    int32_t pid = 0;
+    if (std::strcmp(name, "vm.get_owned_vmobjects") != 0 || newp == nullptr || newlen != sizeof(pid)) {
+        errno = ENOENT;
+        return -1;
+    }
+    std::memcpy(&pid, newp, sizeof(pid));
+    return owned_.ownedObjects(pid, oldp, oldlenp);
 }
 
 uint64_t HTLinuxPlatform::vm_kernel_page_size() { return htKernelPageSize(); }

@@ -11,6 +11,7 @@
 #include "platform/HTPlatform.h"
 #include "platform/linux/HTLinuxKernelMemory.h"
 #include "platform/linux/HTLinuxMappings.h"
+#include "platform/linux/HTLinuxOwnedObjects.h"
 #include "platform/linux/HTLinuxPageQueries.h"
 #include "platform/linux/HTLinuxPathCache.h"
 #include "platform/linux/HTLinuxProcessTable.h"
@@ -34,7 +35,8 @@ public:
     // KERN_ARGMAX and KERN_PROCARGS2, from the process table.
     int sysctl(const int* name, unsigned nameLength, void* oldp, size_t* oldlenp, const void* newp,
                size_t newlen) override;
-    // No setting by name exists on Linux: always ENOENT.
+    // "vm.get_owned_vmobjects" alone, from the owned objects
+    // (HTLinuxOwnedObjects.h); any other name is ENOENT.
     int sysctlbyname(const char* name, void* oldp, size_t* oldlenp, const void* newp, size_t newlen) override;
 
     // The address space (HTLinuxMappings.h, HTLinuxPageQueries.h).
@@ -89,6 +91,7 @@ private:
 
     HTLinuxProcessTable processes_;
     HTLinuxStatusReader status_{processes_};
+    HTLinuxOwnedObjects owned_{processes_};
     HTLinuxMappings mappings_;
     HTLinuxPageQueries pages_;
     HTLinuxPathCache paths_;

@@ -56,15 +56,18 @@ uint32_t htRegionTag(const HTSmapsEntry& entry)
     return HT_VM_TAG_UNTAGGED;
 }
 
+uint64_t htFileObjectId(uint32_t devMajor, uint32_t devMinor, uint64_t inode)
+{
+    // The inode may be 0 (the first System V segment has id 0): the device
+    // and the top bit still keep the identity apart from 0.
+    uint64_t device = (uint64_t{devMajor} << 32) | devMinor;
+    uint64_t id = htMix(htMix(device) ^ inode) | kTopBit;
+    return id == ~uint64_t{0} ? id ^ 1 : id;
+}
+
 uint64_t htRegionObjectId(const HTSmapsEntry& entry, int32_t pid)
 {
-    if (entry.hasBackingObject()) {
-        // The inode may be 0 (the first System V segment has id 0): the
-        // device and the top bit still keep the identity apart from 0.
-        uint64_t device = (uint64_t{entry.devMajor} << 32) | entry.devMinor;
-        uint64_t id = htMix(htMix(device) ^ entry.inode) | kTopBit;
-        return id == ~uint64_t{0} ? id ^ 1 : id;
-    }
+    if (entry.hasBackingObject()) return htFileObjectId(entry.devMajor, entry.devMinor, entry.inode);
     uint64_t id = htMix(htMix(static_cast<uint32_t>(pid)) ^ entry.start);
     return (id & ~kTopTwoBits) | kAnonymousMark;
 }

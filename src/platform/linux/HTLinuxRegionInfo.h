@@ -18,6 +18,9 @@ uint32_t htRegionTag(const HTSmapsEntry& entry);
 // anonymous memory by (pid, start) with the top bits 01, one object a
 // mapping.
 uint64_t htRegionObjectId(const HTSmapsEntry& entry, int32_t pid);
+// The object id of the file (or shared-memory object) with that device and
+// inode, as the mappings of it are given.
+uint64_t htFileObjectId(uint32_t devMajor, uint32_t devMinor, uint64_t inode);
 
 // The full record of the walk. Page counts are in units of pageSize.
 vm_region_submap_info_64 htSubmapInfo(const HTSmapsEntry& entry, int32_t pid, uint64_t pageSize);

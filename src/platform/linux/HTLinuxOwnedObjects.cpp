@@ -1,0 +1,203 @@
+#include "platform/linux/HTLinuxOwnedObjects.h"
+
+#include "platform/linux/HTFileDescriptor.h"
+#include "platform/linux/HTLinuxProcessTable.h"
+#include "platform/linux/HTLinuxRegionInfo.h"
+#include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTProcStatParser.h"
+#include "platform/linux/HTShmemParsers.h"
+
+#include <dirent.h>
+#include <fcntl.h>
+#include <sys/mman.h>
+#include <sys/stat.h>
+#include <sys/syscall.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <charconv>
+#include <cstdio>
+#include <cstring>
+#include <limits>
+#include <optional>
+
+#ifndef __NR_cachestat
+#define __NR_cachestat 451
+#endif
+
+namespace {
+
+struct CachestatRange {
+    uint64_t offset;
+    uint64_t length;
+};
+struct Cachestat {
+    uint64_t cached;
+    uint64_t dirty;
+    uint64_t writeback;
+    uint64_t evicted;
+    uint64_t recentlyEvicted;
+};
+
+uint64_t pageUp(uint64_t bytes, uint64_t pageSize) { return (bytes + pageSize - 1) / pageSize * pageSize; }
+
+// The device of the kernel's own tmpfs, which holds memfd files, System V
+// segments and shared anonymous memory: that of a memfd of heft's own.
+std::pair<uint32_t, uint32_t> internalShmemDevice()
+{
+    HTFileDescriptor probe(static_cast<int>(syscall(SYS_memfd_create, "heft-probe", MFD_CLOEXEC)));
+    struct stat status {};
+    if (!probe.isOpen() || fstat(probe.get(), &status) != 0) return {0, 1};
+    return {major(status.st_dev), minor(status.st_dev)};
+}
+
+// The resident and swapped bytes of the tmpfs file open as `fd`, of `size`
+// bytes and `blocks` blocks of 512 bytes allocated in memory or swap.
+void measureFile(int fd, uint64_t size, uint64_t blocks, uint64_t pageSize, vm_owned_object& record)
+{
+    CachestatRange range{0, 0};
+    Cachestat stat{};
+    if (syscall(__NR_cachestat, fd, &range, &stat, 0) == 0) {
+        // A tmpfs file's evicted pages are the ones in swap.
+        record.resident_size = stat.cached * pageSize;
+        record.compressed_size = stat.evicted * pageSize;
+        return;
+    }
+    const uint64_t allocated = blocks * 512;
+    record.resident_size = allocated;
+    if (size == 0) return;
+    void* mapping = mmap(nullptr, size, PROT_READ, MAP_SHARED, fd, 0);
+    if (mapping == MAP_FAILED) return;
+    std::vector<unsigned char> pages(pageUp(size, pageSize) / pageSize);
+    if (mincore(mapping, size, pages.data()) == 0) {
+        const uint64_t resident = static_cast<uint64_t>(
+            std::count_if(pages.begin(), pages.end(), [](unsigned char page) { return page & 1; }));
+        record.resident_size = resident * pageSize;
+        record.compressed_size = allocated > record.resident_size ? allocated - record.resident_size : 0;
+    }
+    munmap(mapping, size);
+}
+
+}  // namespace
+
+int HTLinuxOwnedObjects::ownedObjects(int32_t pid, void* oldp, size_t* oldlenp)
+{
+    if (oldlenp == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
+    std::call_once(gathered_, [this] { gather(); });
+    static const std::vector<vm_owned_object> none;
+    auto found = byOwner_.find(pid);
+    const std::vector<vm_owned_object>& records = found != byOwner_.end() ? found->second : none;
+    const uint64_t count = records.size();
+    const size_t length = sizeof(count) + records.size() * sizeof(vm_owned_object);
+    if (oldp == nullptr) {
+        *oldlenp = length;
+        return 0;
+    }
+    if (*oldlenp < length) {
+        errno = ENOMEM;
+        return -1;
+    }
+    std::memcpy(oldp, &count, sizeof(count));
+    if (!records.empty())
+        std::memcpy(static_cast<char*>(oldp) + sizeof(count), records.data(), records.size() * sizeof(vm_owned_object));
+    *oldlenp = length;
+    return 0;
+}
+
+void HTLinuxOwnedObjects::gather()
+{
+    const uint64_t pageSize = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
+    const Device shmDevice = internalShmemDevice();
+    std::vector<Device> devices = {shmDevice};
+    HTProcBuffer mountinfo;
+    if (mountinfo.readFile(AT_FDCWD, "/proc/self/mountinfo"))
+        for (const Device& device : htParseTmpfsDevices(mountinfo.view())) devices.push_back(device);
+
+    // Every process, kernel threads too: theirs are empty.
+    if (DIR* proc = opendir("/proc")) {
+        while (dirent* entry = readdir(proc)) {
+            int32_t pid = 0;
+            const char* end = entry->d_name + std::strlen(entry->d_name);
+            auto [stop, error] = std::from_chars(entry->d_name, end, pid);
+            if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices);
+        }
+        closedir(proc);
+    }
+    addHeldFiles(pageSize);
+    addSysvSegments(shmDevice, pageSize);
+}
+
+void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>& devices)
+{
+    char path[64];
+    std::snprintf(path, sizeof(path), "/proc/%d/fd", pid);
+    HTFileDescriptor directory(open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!directory.isOpen()) return;
+    DIR* entries = fdopendir(dup(directory.get()));
+    if (entries == nullptr) return;
+    std::optional<uint64_t> started;
+    while (dirent* entry = readdir(entries)) {
+        if (entry->d_name[0] < '0' || entry->d_name[0] > '9') continue;
+        struct stat status {};
+        // The descriptor's link leads to the open file itself.
+        if (fstatat(directory.get(), entry->d_name, &status, 0) != 0 || !S_ISREG(status.st_mode)) continue;
+        const Device device{major(status.st_dev), minor(status.st_dev)};
+        if (std::find(devices.begin(), devices.end(), device) == devices.end()) continue;
+        if (!started) started = startTime(pid);
+        HeldFile& file = heldFiles_[{device, status.st_ino}];
+        if (file.ownerFd >= 0 && std::make_pair(file.ownerStart, file.owner) <= std::make_pair(*started, pid)) continue;
+        int fd = -1;
+        std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), fd);
+        file =
+            HeldFile{pid, *started, fd, static_cast<uint64_t>(status.st_size), static_cast<uint64_t>(status.st_blocks)};
+    }
+    closedir(entries);
+}
+
+uint64_t HTLinuxOwnedObjects::startTime(int32_t pid)
+{
+    thread_local HTProcBuffer buffer;
+    if (!processes_.readProcessFile(pid, "/stat", buffer)) return std::numeric_limits<uint64_t>::max();
+    std::optional<HTProcStat> stat = htParseProcStat(buffer.view());
+    return stat ? stat->starttime : std::numeric_limits<uint64_t>::max();
+}
+
+void HTLinuxOwnedObjects::addHeldFiles(uint64_t pageSize)
+{
+    for (const auto& [key, file] : heldFiles_) {
+        vm_owned_object record{};
+        record.object_id = htFileObjectId(key.first.first, key.first.second, key.second);
+        record.virtual_size = pageUp(file.size, pageSize);
+        char path[64];
+        std::snprintf(path, sizeof(path), "/proc/%d/fd/%d", file.owner, file.ownerFd);
+        HTFileDescriptor fd(open(path, O_RDONLY | O_CLOEXEC));
+        if (fd.isOpen())
+            measureFile(fd.get(), file.size, file.blocks, pageSize, record);
+        else
+            record.resident_size = file.blocks * 512;
+        byOwner_[file.owner].push_back(record);
+    }
+    heldFiles_.clear();
+}
+
+void HTLinuxOwnedObjects::addSysvSegments(const Device& shmDevice, uint64_t pageSize)
+{
+    HTProcBuffer text;
+    if (!text.readFile(AT_FDCWD, "/proc/sysvipc/shm")) return;
+    for (const HTSysvSegment& segment : htParseSysvShm(text.view())) {
+        // A segment whose creator is gone belongs to nobody.
+        proc_bsdinfo info{};
+        if (segment.cpid <= 0 || !processes_.readBsdInfo(segment.cpid, info)) continue;
+        vm_owned_object record{};
+        record.object_id = htFileObjectId(shmDevice.first, shmDevice.second, static_cast<uint64_t>(segment.shmid));
+        record.virtual_size = pageUp(segment.size, pageSize);
+        record.resident_size = segment.rss;
+        record.compressed_size = segment.swap;
+        byOwner_[segment.cpid].push_back(record);
+    }
+}

@@ -1,0 +1,82 @@
+// Shared memory that processes hold without mapping it: charged to its owner, counted once.
+
+#include "e2e/HTE2ESupport.h"
+
+#include <sys/shm.h>
+#include <sys/vfs.h>
+
+namespace {
+
+using namespace heft_e2e;
+
+using HTOwnedMemoryE2ETest = HTE2EReportTest;
+
+constexpr const char* kOwned = "Owned physical heft (unmapped)";
+constexpr long kTmpfsMagic = 0x01021994;
+
+// The System V segment `shmid`, removed with this object.
+struct SegmentRemoval {
+    ~SegmentRemoval()
+    {
+        if (shmid >= 0) shmctl(shmid, IPC_RMID, nullptr);
+    }
+    int shmid = -1;
+};
+
+TEST_F(HTOwnedMemoryE2ETest, MemoryHeldButNotMappedIsItsHoldersOwn)
+{
+    SwapArea swap;  // without one the paged-out pages stay in memory, dirty
+    struct statfs shm {};
+    const bool shmIsTmpfs = statfs("/dev/shm", &shm) == 0 && shm.f_type == kTmpfsMagic;
+    const std::string held = "/dev/shm/heft-e2e-held-" + std::to_string(getpid());
+    // A memfd of 64 MiB with 16 paged out, a System V segment of 8 MiB, a deleted tmpfs file of 4 MiB: none mapped.
+    ASSERT_TRUE(
+        layOutAndMeasure({"memfd", n(64 * kMiB), n(16 * kMiB), "sysv", n(8 * kMiB), "tmpfile", held, n(4 * kMiB)}));
+    SegmentRemoval segment{static_cast<int>(child_->value(1))};
+    const rapidjson::Value* process = processIn(report_, child_->pid());
+    ASSERT_NE(process, nullptr);
+
+    const uint64_t files = 72 * kMiB + (shmIsTmpfs ? 4 * kMiB : 0);
+    // Dirty holds the swapped part too.
+    EXPECT_EQ(figure(process, kOwned, "dirty"), files);
+    EXPECT_EQ(figure(process, kOwned, "regions"), shmIsTmpfs ? 3u : 2u);
+    // MADV_PAGEOUT may leave a few pages in memory (one under reclaim at the moment), so half is the bound.
+    if (swap.available) {
+        EXPECT_GE(figure(process, kOwned, "swapped"), 8 * kMiB);
+    }
+    EXPECT_GE(number(process, "heft"), files);
+    if (!shmIsTmpfs) GTEST_SKIP() << "/dev/shm is no tmpfs here; its file was not checked";
+}
+
+TEST_F(HTOwnedMemoryE2ETest, MemoryMappedByAnotherCountsOnceAndIsChargedToItsOwner)
+{
+    ASSERT_TRUE(layOutAndMeasure({"memfd", n(32 * kMiB), "0"}));
+    const pid_t owner = child_->pid();
+    // Another process maps the owner's memfd and writes it all.
+    HTLayoutChild mapper({"file", "/proc/" + n(owner) + "/fd/" + n(child_->value(0)), n(32 * kMiB), n(32 * kMiB)});
+    ASSERT_TRUE(mapper.ready());
+    const std::string path = directory_.file("both.json");
+    const Outcome run = runHeft({"-f", "bytes", "-j", path, n(owner), mapper.pidString()});
+    ASSERT_EQ(run.status, 0) << run.standardError;
+    ASSERT_TRUE(loadReport(path, report_));
+
+    // The table of what the two share holds the memfd dirty, as its owner sees it; the mapper's own view of it
+    // clean; the run's total counts it once.
+    const rapidjson::Value* shared = sharedBy(report_, {owner, mapper.pid()});
+    ASSERT_NE(shared, nullptr);
+    EXPECT_EQ(figure(shared, "shared memory", "dirty"), 32 * kMiB);
+    const rapidjson::Value* mapperView = nullptr;
+    for (const auto& view : arrayIn(&report_, "shared"))
+        if (number(&view, "specific_to_pid") == static_cast<uint64_t>(mapper.pid())) mapperView = &view;
+    EXPECT_EQ(figure(mapperView, "shared memory", "dirty"), 0u);
+    EXPECT_EQ(figure(mapperView, "shared memory", "clean"), 32 * kMiB);
+    EXPECT_LT(number(&report_, "total heft"), 48 * kMiB);
+
+    // With --unmapped, the owner alone is reported, charged with the memfd that only the other maps.
+    const Outcome unmapped = runHeft({"-f", "bytes", "-j", path, "--unmapped", n(owner)});
+    ASSERT_EQ(unmapped.status, 0) << unmapped.standardError;
+    ASSERT_TRUE(loadReport(path, report_));
+    EXPECT_GE(number(processIn(report_, owner), "heft"), 32 * kMiB);
+}
+
+}  // namespace
