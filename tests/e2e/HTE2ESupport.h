@@ -4,6 +4,7 @@
 
 #include "support/HTLayoutChild.h"
 
+#include <sys/file.h>
 #include <sys/mman.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
@@ -110,9 +111,11 @@ struct TempDir {
 };
 
 // The system's swap if any (listed after the heading of /proc/swaps), else a swap file that goes with this object.
+// Tests that use swap take turns (a lock on a file): one test's swapoff would bring another's pages back.
 struct SwapArea {
     SwapArea()
     {
+        if (lock_ >= 0) flock(lock_, LOCK_EX);
         std::string swaps = readFile("/proc/swaps");
         if ((available = swaps.find('\n') + 1 < swaps.size())) return;
         Outcome made = runProgram("/bin/sh",
@@ -127,8 +130,10 @@ struct SwapArea {
     {
         if (enabled_ && swapoff(path_.c_str()) != 0) ADD_FAILURE() << "swapoff " << path_ << ": " << strerror(errno);
         if (!path_.empty()) unlink(path_.c_str());
+        if (lock_ >= 0) close(lock_);
     }
 
+    int lock_ = open("/tmp/heft-e2e-swap.lock", O_RDWR | O_CREAT | O_CLOEXEC, 0600);
     std::string path_, reason;
     bool enabled_ = false, available = false;
 };

@@ -22,6 +22,8 @@
 #include <cstring>
 #include <limits>
 #include <optional>
+#include <string>
+#include <string_view>
 
 #ifndef __NR_cachestat
 #define __NR_cachestat 451
@@ -40,6 +42,22 @@ struct Cachestat {
     uint64_t evicted;
     uint64_t recentlyEvicted;
 };
+
+// Whether the descriptor `name` of the directory leads to a file under
+// /dev/shm, which the mappings name as shared memory.
+bool isDevShm(int directory, const char* name)
+{
+    char target[32];
+    ssize_t length = readlinkat(directory, name, target, sizeof(target));
+    return length >= 9 && std::string_view(target, static_cast<size_t>(length)).starts_with("/dev/shm/");
+}
+
+template<typename Number>
+bool readNumber(std::string_view word, Number& value, int base)
+{
+    auto [end, error] = std::from_chars(word.data(), word.data() + word.size(), value, base);
+    return error == std::errc() && end == word.data() + word.size() && !word.empty();
+}
 
 uint64_t pageUp(uint64_t bytes, uint64_t pageSize) { return (bytes + pageSize - 1) / pageSize * pageSize; }
 
@@ -124,7 +142,7 @@ void HTLinuxOwnedObjects::gather()
             int32_t pid = 0;
             const char* end = entry->d_name + std::strlen(entry->d_name);
             auto [stop, error] = std::from_chars(entry->d_name, end, pid);
-            if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices);
+                if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices, shmDevice);
         }
         closedir(proc);
     }
@@ -132,7 +150,7 @@ void HTLinuxOwnedObjects::gather()
     addSysvSegments(shmDevice, pageSize);
 }
 
-void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>& devices)
+void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>& devices, const Device& shmDevice)
 {
     char path[64];
     std::snprintf(path, sizeof(path), "/proc/%d/fd", pid);
@@ -141,6 +159,8 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
     DIR* entries = fdopendir(dup(directory.get()));
     if (entries == nullptr) return;
     std::optional<uint64_t> started;
+    // Files of other tmpfs mounts, which the process may map as files.
+    std::vector<FileKey> others;
     while (dirent* entry = readdir(entries)) {
         if (entry->d_name[0] < '0' || entry->d_name[0] > '9') continue;
         struct stat status {};
@@ -148,6 +168,8 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
         if (fstatat(directory.get(), entry->d_name, &status, 0) != 0 || !S_ISREG(status.st_mode)) continue;
         const Device device{major(status.st_dev), minor(status.st_dev)};
         if (std::find(devices.begin(), devices.end(), device) == devices.end()) continue;
+        if (device != shmDevice && !isDevShm(directory.get(), entry->d_name))
+            others.push_back({device, status.st_ino});
         if (!started) started = startTime(pid);
         HeldFile& file = heldFiles_[{device, status.st_ino}];
         if (file.ownerFd >= 0 && std::make_pair(file.ownerStart, file.owner) <= std::make_pair(*started, pid)) continue;
@@ -157,6 +179,35 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
             HeldFile{pid, *started, fd, static_cast<uint64_t>(status.st_size), static_cast<uint64_t>(status.st_blocks)};
     }
     closedir(entries);
+    if (!others.empty()) noteMappedFiles(pid, others);
+}
+
+void HTLinuxOwnedObjects::noteMappedFiles(int32_t pid, const std::vector<FileKey>& files)
+{
+    thread_local HTProcBuffer maps;
+    if (!processes_.readProcessFile(pid, "/maps", maps)) return;
+    std::string_view text = maps.view();
+    while (!text.empty()) {
+        size_t newline = text.find('\n');
+        std::string_view line = text.substr(0, newline);
+        text.remove_prefix(newline == std::string_view::npos ? text.size() : newline + 1);
+        // START-END PERMS OFFSET MAJOR:MINOR INODE PATH, the device in hex.
+        std::string_view words[5];
+        for (std::string_view& word : words) {
+            size_t blank = line.find(' ');
+            word = line.substr(0, blank);
+            line.remove_prefix(blank == std::string_view::npos ? line.size() : blank + 1);
+        }
+        const size_t colon = words[3].find(':');
+        uint32_t major = 0;
+        uint32_t minor = 0;
+        uint64_t inode = 0;
+        if (colon == std::string_view::npos || !readNumber(words[3].substr(0, colon), major, 16) ||
+            !readNumber(words[3].substr(colon + 1), minor, 16) || !readNumber(words[4], inode, 10) || inode == 0)
+            continue;
+        const FileKey key{{major, minor}, inode};
+        if (std::find(files.begin(), files.end(), key) != files.end()) heldFiles_[key].mappedAsFile = true;
+    }
 }
 
 uint64_t HTLinuxOwnedObjects::startTime(int32_t pid)
@@ -170,6 +221,7 @@ uint64_t HTLinuxOwnedObjects::startTime(int32_t pid)
 void HTLinuxOwnedObjects::addHeldFiles(uint64_t pageSize)
 {
     for (const auto& [key, file] : heldFiles_) {
+        if (file.mappedAsFile) continue;
         vm_owned_object record{};
         record.object_id = htFileObjectId(key.first.first, key.first.second, key.second);
         record.virtual_size = pageUp(file.size, pageSize);

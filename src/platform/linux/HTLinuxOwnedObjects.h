@@ -26,6 +26,10 @@ class HTLinuxProcessTable;
 // them, so that the charge does not move as helpers come and go. A System V
 // segment is owned by its creator while that process lives.
 //
+// A tmpfs file outside the kernel's own tmpfs and /dev/shm that a holder
+// also maps (a journal under /run, say) is left to its mappings, which
+// name it as a mapped file.
+//
 // Every process's descriptors are read once, on the first question of a
 // run; without root only the caller's own processes can be read. An
 // object's resident and swapped pages come from cachestat, or, on a kernel
@@ -48,12 +52,17 @@ private:
         int ownerFd = -1;
         uint64_t size = 0;
         uint64_t blocks = 0;
+        // Mapped by a holder as an ordinary file: its mappings account
+        // for it, under "mapped file".
+        bool mappedAsFile = false;
     };
     using FileKey = std::pair<Device, uint64_t>;
 
     void gather();
     // Reads the descriptors of `pid`, noting the tmpfs files it holds.
-    void readDescriptors(int32_t pid, const std::vector<Device>& devices);
+    void readDescriptors(int32_t pid, const std::vector<Device>& devices, const Device& shmDevice);
+    // Marks the files of `files` that `pid` maps.
+    void noteMappedFiles(int32_t pid, const std::vector<FileKey>& files);
     void addHeldFiles(uint64_t pageSize);
     void addSysvSegments(const Device& shmDevice, uint64_t pageSize);
     // The start time of `pid`, in clock ticks after boot; the largest
