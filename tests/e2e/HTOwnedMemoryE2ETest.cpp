@@ -45,6 +45,15 @@ TEST_F(HTOwnedMemoryE2ETest, MemoryHeldButNotMappedIsItsHoldersOwn)
         EXPECT_GE(figure(process, kOwned, "swapped"), 8 * kMiB);
     }
     EXPECT_GE(number(process, "heft"), files);
+
+    // Without root, a process of the caller's own still shows what it holds, and heft says what it could not see.
+    if (const std::string why = whyNobodyCannotRun(); why.empty()) {
+        HTLayoutChild nobodys({"memfd", n(8 * kMiB), "0"}, 65534);
+        ASSERT_TRUE(nobodys.ready());
+        const Outcome run = runHeftAsNobody({"-f", "bytes", nobodys.pidString()});
+        EXPECT_THAT(run.standardOutput, testing::ContainsRegex("8388608 B .* Owned physical heft"));
+        EXPECT_THAT(run.standardError, testing::HasSubstr("Unable to read the open files of "));
+    }
     if (!shmIsTmpfs) GTEST_SKIP() << "/dev/shm is no tmpfs here; its file was not checked";
 }
 

@@ -1,5 +1,7 @@
 #include "platform/linux/HTLinuxOwnedObjects.h"
 
+#include "base/HTNoticeLog.h"
+#include "base/HTStringFormat.h"
 #include "platform/linux/HTFileDescriptor.h"
 #include "platform/linux/HTLinuxProcessTable.h"
 #include "platform/linux/HTLinuxRegionInfo.h"
@@ -142,12 +144,17 @@ void HTLinuxOwnedObjects::gather()
             int32_t pid = 0;
             const char* end = entry->d_name + std::strlen(entry->d_name);
             auto [stop, error] = std::from_chars(entry->d_name, end, pid);
-                if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices, shmDevice);
+            if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices, shmDevice);
         }
         closedir(proc);
     }
     addHeldFiles(pageSize);
     addSysvSegments(shmDevice, pageSize);
+    if (unreadable_ > 0)
+        HTNoticeLog::standardError().add(
+            "Unable to read the open files of %s (that needs root): shared memory they hold without mapping it is "
+            "not seen",
+            0, htStringWithFormat("%zu process%s", unreadable_, unreadable_ == 1 ? "" : "es"));
 }
 
 void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>& devices, const Device& shmDevice)
@@ -155,7 +162,10 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
     char path[64];
     std::snprintf(path, sizeof(path), "/proc/%d/fd", pid);
     HTFileDescriptor directory(open(path, O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!directory.isOpen()) return;
+    if (!directory.isOpen()) {
+        if (errno == EACCES) ++unreadable_;
+        return;
+    }
     DIR* entries = fdopendir(dup(directory.get()));
     if (entries == nullptr) return;
     std::optional<uint64_t> started;
@@ -168,8 +178,7 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
         if (fstatat(directory.get(), entry->d_name, &status, 0) != 0 || !S_ISREG(status.st_mode)) continue;
         const Device device{major(status.st_dev), minor(status.st_dev)};
         if (std::find(devices.begin(), devices.end(), device) == devices.end()) continue;
-        if (device != shmDevice && !isDevShm(directory.get(), entry->d_name))
-            others.push_back({device, status.st_ino});
+        if (device != shmDevice && !isDevShm(directory.get(), entry->d_name)) others.push_back({device, status.st_ino});
         if (!started) started = startTime(pid);
         HeldFile& file = heldFiles_[{device, status.st_ino}];
         if (file.ownerFd >= 0 && std::make_pair(file.ownerStart, file.owner) <= std::make_pair(*started, pid)) continue;

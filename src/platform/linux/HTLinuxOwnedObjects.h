@@ -31,7 +31,8 @@ class HTLinuxProcessTable;
 // name it as a mapped file.
 //
 // Every process's descriptors are read once, on the first question of a
-// run; without root only the caller's own processes can be read. An
+// run; without root only the caller's own processes can be read, and
+// standard error says how many could not. An
 // object's resident and swapped pages come from cachestat, or, on a kernel
 // without it, from mincore on a read-only mapping of heft's own, which
 // faults nothing in; a System V segment's from /proc/sysvipc/shm.
@@ -73,4 +74,6 @@ private:
     std::once_flag gathered_;
     std::map<FileKey, HeldFile> heldFiles_;
     std::unordered_map<int32_t, std::vector<vm_owned_object>> byOwner_;
+    // Processes whose descriptors the caller may not read.
+    size_t unreadable_ = 0;
 };
