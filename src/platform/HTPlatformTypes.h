@@ -302,6 +302,10 @@ inline constexpr uint64_t VM_KERN_SITE_WIRED = 0x100;
 inline constexpr uint64_t VM_KERN_SITE_HIDE = 0x200;
 inline constexpr uint64_t VM_KERN_SITE_NAMED = 0x400;  // the record carries its own name
 inline constexpr uint64_t VM_KERN_SITE_ZONE = 0x800;   // `zone` indexes the zone names
+// Memory the kernel holds for no process that is neither wired nor free to
+// drop, but may be swapped (shared memory whose holders are gone): `size`
+// bytes in memory and swap, `mapped` of them in swap.
+inline constexpr uint64_t HT_KERN_SITE_SWAPPABLE = 0x1000;
 
 // Tags the kernel's own accounting gives special meaning.
 inline constexpr uint64_t VM_KERN_MEMORY_KALLOC = 13;

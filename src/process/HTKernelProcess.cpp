@@ -127,7 +127,12 @@ std::shared_ptr<HTMemoryRegion> siteRegion(const mach_memory_info_t& info, size_
     // counted elsewhere (as the processes' own page tables); memory that
     // user processes wired is theirs; and what is not wired can be paged
     // out.
-    if ((info.flags & VM_KERN_SITE_ZONE) || !wired || hidden || userWired) {
+    if ((info.flags & HT_KERN_SITE_SWAPPABLE) && !hidden) {
+        // Written memory with nowhere else to go: dirty, or in swap.
+        const uint64_t swapped = std::min(info.mapped, value);
+        region->setDirtySize(value - swapped);
+        region->setSwappedSize(swapped);
+    } else if ((info.flags & VM_KERN_SITE_ZONE) || !wired || hidden || userWired) {
         region->setCleanNonSpecSize(value);
         if (hidden)
             region->setDetailedName("(hidden)");

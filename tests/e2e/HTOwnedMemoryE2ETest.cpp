@@ -57,6 +57,18 @@ TEST_F(HTOwnedMemoryE2ETest, MemoryHeldButNotMappedIsItsHoldersOwn)
     if (!shmIsTmpfs) GTEST_SKIP() << "/dev/shm is no tmpfs here; its file was not checked";
 }
 
+TEST_F(HTOwnedMemoryE2ETest, SegmentOfAnExitedCreatorThatNobodyMapsIsInTheKernelsReport)
+{
+    if (geteuid() != 0) GTEST_SKIP() << "the kernel's report needs root";
+    const Outcome created = runProgram(HEFT_LAYOUT_PROGRAM, {"heft-layout", "sysv", n(8 * kMiB), "exit"});
+    ASSERT_EQ(created.status, 0) << created.standardError;
+    SegmentRemoval segment{std::stoi(created.standardOutput)};
+    const std::string path = directory_.file("kernel.json");
+    ASSERT_EQ(runHeft({"-f", "bytes", "-j", path, "0"}).status, 0);
+    ASSERT_TRUE(loadReport(path, report_));
+    EXPECT_GE(figure(processIn(report_, 0), "System V shared memory of exited processes", "dirty"), 8 * kMiB);
+}
+
 TEST_F(HTOwnedMemoryE2ETest, MemoryMappedByAnotherCountsOnceAndIsChargedToItsOwner)
 {
     ASSERT_TRUE(layOutAndMeasure({"memfd", n(32 * kMiB), "0"}));

@@ -18,6 +18,7 @@ inline void scriptKernel(HTFakePlatform& platform, const HTScenarioLine& line)
     static const std::map<std::string, uint64_t> kWords = {{"tag", VM_KERN_SITE_TAG}, {"kmod", VM_KERN_SITE_KMOD},
         {"code", VM_KERN_SITE_KERNEL}, {"counter", VM_KERN_SITE_COUNTER}, {"wired", VM_KERN_SITE_WIRED},
         {"hide", VM_KERN_SITE_HIDE}, {"named", VM_KERN_SITE_NAMED}, {"zone", VM_KERN_SITE_ZONE},
+        {"swappable", HT_KERN_SITE_SWAPPABLE},
         {"failure", KERN_FAILURE}, {"noaccess", HT_KERN_ERRNO_BASE | EACCES},
         {"notpermitted", HT_KERN_ERRNO_BASE | EPERM}};
     // clang-format on

@@ -6,6 +6,7 @@
 #include "platform/linux/HTModulesParser.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcText.h"
+#include "platform/linux/HTShmemParsers.h"
 #include "platform/linux/HTSlabinfoParser.h"
 #include "platform/linux/HTVmallocinfoParser.h"
 
@@ -23,6 +24,9 @@ constexpr uint64_t kTagStack = 8;
 constexpr uint64_t kTagCpu = 9;
 constexpr uint64_t kTagGuestPageTables = 10;
 constexpr uint64_t kTagPageTables = 11;
+// A tag beyond the kernel's own, for shared memory whose holders are gone.
+constexpr uint64_t kTagOrphanedSegments = 0x1001;
+constexpr std::string_view kOrphanedSegmentsName = "System V shared memory of exited processes";
 
 struct TagSite {
     std::string_view field;
@@ -140,8 +144,31 @@ kern_return_t HTLinuxKernelMemory::memoryInfo(std::vector<mach_zone_name_t>& nam
     addAllocationSites(allocations, addresses, sites);
     addModuleSites(htParseModules(modules.view()), sites);
     addTagSites(fields, stacksCountedElsewhere, sites);
+    addOrphanedSegments(sites);
     addCounters(fields, sites);
     return KERN_SUCCESS;
+}
+
+void HTLinuxKernelMemory::addOrphanedSegments(std::vector<mach_memory_info_t>& sites) const
+{
+    // A kernel without System V IPC has no such file.
+    HTProcBuffer text;
+    if (!text.readFile(AT_FDCWD, path("proc/sysvipc/shm").c_str())) return;
+    uint64_t resident = 0;
+    uint64_t swapped = 0;
+    for (const HTSysvSegment& segment : htParseSysvShm(text.view())) {
+        // Mapped, the segment is its mappers'; with its creator alive, the
+        // creator's own.
+        const std::string creator = path("proc/") + std::to_string(segment.cpid);
+        if (segment.nattch != 0 || access(creator.c_str(), F_OK) == 0) continue;
+        resident += segment.rss;
+        swapped += segment.swap;
+    }
+    if (resident + swapped == 0) return;
+    mach_memory_info_t site = siteRecord(VM_KERN_SITE_TAG | VM_KERN_SITE_NAMED | HT_KERN_SITE_SWAPPABLE,
+                                         kTagOrphanedSegments, resident + swapped, kOrphanedSegmentsName);
+    site.mapped = swapped;
+    sites.push_back(site);
 }
 
 HTSymbolAddresses HTLinuxKernelMemory::findAddresses(const std::vector<HTVmallocCaller>& callers,

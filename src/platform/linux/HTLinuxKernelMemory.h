@@ -10,7 +10,9 @@
 // - a hidden module site a module of /proc/modules;
 // - tag sites for the kernel's stacks, per-CPU memory, page tables and the
 //   memory that processes locked, from /proc/meminfo;
-// - a counter every /proc/meminfo figure.
+// - a counter every /proc/meminfo figure;
+// - a tag site of its own for the System V segments that belong to nobody
+//   (/proc/sysvipc/shm), in memory or in swap.
 // Every record carries its own name. Each byte the kernel holds counts once
 // among the sites that are neither hidden nor user wired: slab memory in
 // the zones, vmalloc memory in its code sites. Sites whose memory is
@@ -59,6 +61,9 @@ private:
     static void addModuleSites(const std::vector<HTModuleLine>& modules, std::vector<mach_memory_info_t>& sites);
     static void addTagSites(const std::vector<HTMeminfoField>& fields, bool stacksCountedElsewhere,
                             std::vector<mach_memory_info_t>& sites);
+    // System V segments that nobody maps and whose creator has exited:
+    // shared memory that no process shows.
+    void addOrphanedSegments(std::vector<mach_memory_info_t>& sites) const;
     static void addCounters(const std::vector<HTMeminfoField>& fields, std::vector<mach_memory_info_t>& sites);
     // The addresses of the functions the sites name, and of the symbol that
     // tells vmalloc stacks.
