@@ -69,6 +69,34 @@ TEST_F(HTOwnedMemoryE2ETest, SegmentOfAnExitedCreatorThatNobodyMapsIsInTheKernel
     EXPECT_GE(figure(processIn(report_, 0), "System V shared memory of exited processes", "dirty"), 8 * kMiB);
 }
 
+TEST_F(HTOwnedMemoryE2ETest, SharedMemoryOfTheWholeMachineAgreesWithTheKernelsShmem)
+{
+    struct statfs shm {};
+    if (geteuid() != 0) GTEST_SKIP() << "heft -a needs root";
+    if (statfs("/dev/shm", &shm) != 0 || shm.f_type != kTmpfsMagic) GTEST_SKIP() << "/dev/shm is no tmpfs here";
+    // 600 MiB of shared memory: a memfd and a System V segment held unmapped, a /dev/shm file mapped, not held.
+    const std::string file = "/dev/shm/heft-e2e-shmem-" + std::to_string(getpid());
+    std::ofstream(file).close();
+    ASSERT_EQ(truncate(file.c_str(), 200 * kMiB), 0) << std::strerror(errno);
+    HTLayoutChild holder(
+        {"memfd", n(200 * kMiB), "0", "sysv", n(200 * kMiB), "file", file, n(200 * kMiB), n(200 * kMiB)});
+    unlink(file.c_str());
+    ASSERT_TRUE(holder.ready());
+    SegmentRemoval segment{static_cast<int>(holder.value(1))};
+    const std::string path = directory_.file("all.json");
+    ASSERT_EQ(runHeft({"-a", "-f", "bytes", "-j", path}).status, 0);
+    const uint64_t shmem = kernelField(readFile("/proc/meminfo"), "Shmem");
+    ASSERT_TRUE(loadReport(path, report_));
+
+    // What is in memory of the shared memory heft reports: mapped, owned and unmapped, and belonging to nobody.
+    uint64_t reported = 0;
+    for (const char* category : {"shared memory", kOwned, "System V shared memory of exited processes"}) {
+        const rapidjson::Value* row = member(member(&report_, "summary"), category);
+        reported += number(row, "dirty") - number(row, "swapped") + number(row, "clean");
+    }
+    EXPECT_NEAR(static_cast<double>(reported), static_cast<double>(shmem), 0.05 * static_cast<double>(shmem));
+}
+
 TEST_F(HTOwnedMemoryE2ETest, MemoryMappedByAnotherCountsOnceAndIsChargedToItsOwner)
 {
     ASSERT_TRUE(layOutAndMeasure({"memfd", n(32 * kMiB), "0"}));
