@@ -2,6 +2,7 @@
 
 #include "e2e/HTE2ESupport.h"
 
+#include <sys/mount.h>
 #include <sys/shm.h>
 #include <sys/vfs.h>
 
@@ -55,6 +56,24 @@ TEST_F(HTOwnedMemoryE2ETest, MemoryHeldButNotMappedIsItsHoldersOwn)
         EXPECT_THAT(run.standardError, testing::HasSubstr("Unable to read the open files of "));
     }
     if (!shmIsTmpfs) GTEST_SKIP() << "/dev/shm is no tmpfs here; its file was not checked";
+}
+
+TEST_F(HTOwnedMemoryE2ETest, FileOfATmpfsThatItsHolderMapsIsAMappedFile)
+{
+    // A tmpfs of the test's own: one file there held and mapped (as a journal under /run is), one held alone.
+    const std::string mount = directory_.file("tmpfs");
+    if (geteuid() != 0 || mkdir(mount.c_str(), 0700) != 0 || ::mount("none", mount.c_str(), "tmpfs", 0, nullptr) != 0)
+        GTEST_SKIP() << "mounting a tmpfs needs root";
+    const bool measured =
+        layOutAndMeasure({"heldfile", mount + "/mapped", n(4 * kMiB), "tmpfile", mount + "/held", n(2 * kMiB)});
+    const pid_t pid = child_->pid();
+    child_.reset();
+    umount(mount.c_str());
+    ASSERT_TRUE(measured);
+    const rapidjson::Value* process = processIn(report_, pid);
+    EXPECT_EQ(figure(process, kOwned, "dirty"), 2 * kMiB);
+    // Listed with -v, a file's mappings are a row of its own.
+    EXPECT_EQ(figure(process, "mapped file " + mount + "/mapped", "dirty"), 4 * kMiB);
 }
 
 TEST_F(HTOwnedMemoryE2ETest, SegmentOfAnExitedCreatorThatNobodyMapsIsInTheKernelsReport)

@@ -16,7 +16,8 @@
  *   exit-main           the main thread exits; a worker prints its id once it is a zombie
  *   memfd SIZE OUT      a memfd of SIZE written bytes, the first OUT paged out, then unmapped and held: FD
  *   sysv SIZE           a System V segment of SIZE written bytes, then detached: SHMID
- *   tmpfile PATH SIZE   PATH created with SIZE bytes written, then deleted and held open: FD */
+ *   tmpfile PATH SIZE   PATH created with SIZE bytes written, then deleted and held open: FD
+ *   heldfile PATH SIZE  PATH created with SIZE bytes written through a shared mapping, held open and mapped: FD */
 #define _GNU_SOURCE
 #include <errno.h>
 #include <fcntl.h>
@@ -214,10 +215,15 @@ int main(int argc, char** argv)
             touch(segment, NUMBER(1), 1);
             shmdt(segment);
             printf("%d\n", id);
-        } else if (IS("tmpfile", 2)) {
-            int fd = open(argv[i + 1], O_RDWR | O_CREAT | O_EXCL, 0600);
-            need(fd >= 0 && unlink(argv[i + 1]) == 0, argv[i + 1]);
+        } else if (IS("tmpfile", 2) || IS("heldfile", 2)) {
+            int fd = open(argv[i + 1], O_RDWR | O_CREAT | O_EXCL, 0600), held = IS("heldfile", 2);
+            need(fd >= 0 && (held || unlink(argv[i + 1]) == 0), argv[i + 1]);
             writeMapped(fd, NUMBER(2), 0);
+            if (held) {
+                char* mapped = mmap(NULL, NUMBER(2), PROT_READ, MAP_SHARED, fd, 0);
+                need(mapped != MAP_FAILED, "mmap");
+                touch(mapped, NUMBER(2), 0);
+            }
             printf("%d\n", fd);
         } else if (IS("tree", 0)) {
             tree();
