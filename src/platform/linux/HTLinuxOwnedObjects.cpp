@@ -166,12 +166,13 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
         if (errno == EACCES) ++unreadable_;
         return;
     }
-    DIR* entries = fdopendir(dup(directory.get()));
-    if (entries == nullptr) return;
+    // The listing takes a descriptor of its own; the first stays for fstatat.
+    HTDirectoryListing entries = htListDirectory(HTFileDescriptor(fcntl(directory.get(), F_DUPFD_CLOEXEC, 0)));
+    if (!entries) return;
     std::optional<uint64_t> started;
     // Files of other tmpfs mounts, which the process may map as files.
     std::vector<FileKey> others;
-    while (dirent* entry = readdir(entries)) {
+    while (dirent* entry = readdir(entries.get())) {
         if (entry->d_name[0] < '0' || entry->d_name[0] > '9') continue;
         struct stat status {};
         // The descriptor's link leads to the open file itself.
@@ -184,10 +185,15 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
         if (file.ownerFd >= 0 && std::make_pair(file.ownerStart, file.owner) <= std::make_pair(*started, pid)) continue;
         int fd = -1;
         std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), fd);
-        file =
-            HeldFile{pid, *started, fd, static_cast<uint64_t>(status.st_size), static_cast<uint64_t>(status.st_blocks)};
+        // An older holder takes the file over; whether some holder maps it
+        // stays as it was.
+        file = HeldFile{pid,
+                        *started,
+                        fd,
+                        static_cast<uint64_t>(status.st_size),
+                        static_cast<uint64_t>(status.st_blocks),
+                        file.mappedAsFile};
     }
-    closedir(entries);
     if (!others.empty()) noteMappedFiles(pid, others);
 }
 
