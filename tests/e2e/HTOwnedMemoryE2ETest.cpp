@@ -58,14 +58,20 @@ TEST_F(HTOwnedMemoryE2ETest, MemoryHeldButNotMappedIsItsHoldersOwn)
     if (!shmIsTmpfs) GTEST_SKIP() << "/dev/shm is no tmpfs here; its file was not checked";
 }
 
-TEST_F(HTOwnedMemoryE2ETest, FileOfATmpfsThatItsHolderMapsIsAMappedFile)
+TEST_F(HTOwnedMemoryE2ETest, FilesOfATmpfsAreTheirHoldersTheirMappersOrNobodys)
 {
-    // A tmpfs of the test's own: one file there held and mapped (as a journal under /run is), one held alone.
+    // A tmpfs of the test's own: a file held and mapped (as a journal under /run is), one held alone, one mapped
+    // alone, and one that nobody holds or maps.
     const std::string mount = directory_.file("tmpfs");
     if (geteuid() != 0 || mkdir(mount.c_str(), 0700) != 0 || ::mount("none", mount.c_str(), "tmpfs", 0, nullptr) != 0)
         GTEST_SKIP() << "mounting a tmpfs needs root";
-    const bool measured =
-        layOutAndMeasure({"heldfile", mount + "/mapped", n(4 * kMiB), "tmpfile", mount + "/held", n(2 * kMiB)});
+    for (const auto& [name, size] : {std::pair{"/mapped-alone", 1 * kMiB}, {"/nobodys", 3 * kMiB}}) {
+        std::ofstream(mount + name) << std::string(size, 'x');
+    }
+    const bool measured = layOutAndMeasure({"heldfile", mount + "/mapped", n(4 * kMiB), "tmpfile", mount + "/held",
+                                            n(2 * kMiB), "file", mount + "/mapped-alone", n(kMiB), "0"});
+    const std::string kernelPath = directory_.file("kernel.json");
+    const Outcome kernel = runHeft({"-f", "bytes", "-j", kernelPath, "0"});
     const pid_t pid = child_->pid();
     child_.reset();
     umount(mount.c_str());
@@ -74,6 +80,11 @@ TEST_F(HTOwnedMemoryE2ETest, FileOfATmpfsThatItsHolderMapsIsAMappedFile)
     EXPECT_EQ(figure(process, kOwned, "dirty"), 2 * kMiB);
     // Listed with -v, a file's mappings are a row of its own.
     EXPECT_EQ(figure(process, "mapped file " + mount + "/mapped", "dirty"), 4 * kMiB);
+
+    // The kernel's report holds the one file that belongs to nobody.
+    ASSERT_EQ(kernel.status, 0) << kernel.standardError;
+    ASSERT_TRUE(loadReport(kernelPath, report_));
+    EXPECT_EQ(figure(processIn(report_, 0), "tmpfs files no process holds or maps (" + mount + ")", "dirty"), 3 * kMiB);
 }
 
 TEST_F(HTOwnedMemoryE2ETest, SegmentOfAnExitedCreatorThatNobodyMapsIsInTheKernelsReport)
@@ -109,9 +120,13 @@ TEST_F(HTOwnedMemoryE2ETest, SharedMemoryOfTheWholeMachineAgreesWithTheKernelsSh
 
     // What is in memory of the shared memory heft reports: mapped, owned and unmapped, and belonging to nobody.
     uint64_t reported = 0;
-    for (const char* category : {"shared memory", kOwned, "System V shared memory of exited processes"}) {
-        const rapidjson::Value* row = member(member(&report_, "summary"), category);
-        reported += number(row, "dirty") - number(row, "swapped") + number(row, "clean");
+    const rapidjson::Value* summary = member(&report_, "summary");
+    ASSERT_TRUE(summary != nullptr && summary->IsObject());
+    for (const auto& [name, row] : summary->GetObject()) {
+        const std::string category = name.GetString();
+        if (category == "shared memory" || category == kOwned || category.starts_with("System V shared memory of") ||
+            category.starts_with("tmpfs files no process holds"))
+            reported += number(&row, "dirty") - number(&row, "swapped") + number(&row, "clean");
     }
     EXPECT_NEAR(static_cast<double>(reported), static_cast<double>(shmem), 0.05 * static_cast<double>(shmem));
 }

@@ -195,5 +195,10 @@ TEST(HTShmemParsers, SystemVSegmentsAndTmpfsMounts)
                          "25 24 0:23 / /dev/shm rw,relatime shared:4 - tmpfs tmpfs rw\n"
                          "26 24 0:x / /run rw - tmpfs tmpfs rw\n"
                          "27 24 259:1 / /tmp rw master:1 - tmpfs none rw";
-    EXPECT_EQ(htParseTmpfsDevices(mounts), (std::vector<std::pair<uint32_t, uint32_t>>{{0, 23}, {259, 1}}));
+    const std::vector<HTTmpfsMount> tmpfs = htParseTmpfsMounts(mounts);
+    ASSERT_EQ(tmpfs.size(), 2u);
+    EXPECT_EQ(tmpfs[0].device, std::make_pair(0u, 23u));
+    EXPECT_EQ(tmpfs[0].mountPoint, "/dev/shm");
+    EXPECT_EQ(tmpfs[1].device, std::make_pair(259u, 1u));
+    EXPECT_EQ(tmpfs[1].mountPoint, "/tmp");
 }

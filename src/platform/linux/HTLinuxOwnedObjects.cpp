@@ -129,6 +129,12 @@ int HTLinuxOwnedObjects::ownedObjects(int32_t pid, void* oldp, size_t* oldlenp)
     return 0;
 }
 
+const std::map<HTLinuxOwnedObjects::FileKey, uint64_t>& HTLinuxOwnedObjects::heldFileBytes()
+{
+    std::call_once(gathered_, [this] { gather(); });
+    return heldFileBytes_;
+}
+
 void HTLinuxOwnedObjects::gather()
 {
     const uint64_t pageSize = static_cast<uint64_t>(sysconf(_SC_PAGESIZE));
@@ -136,7 +142,7 @@ void HTLinuxOwnedObjects::gather()
     std::vector<Device> devices = {shmDevice};
     HTProcBuffer mountinfo;
     if (mountinfo.readFile(AT_FDCWD, "/proc/self/mountinfo"))
-        for (const Device& device : htParseTmpfsDevices(mountinfo.view())) devices.push_back(device);
+        for (const HTTmpfsMount& mount : htParseTmpfsMounts(mountinfo.view())) devices.push_back(mount.device);
 
     // Every process, kernel threads too: theirs are empty.
     if (DIR* proc = opendir("/proc")) {
@@ -236,6 +242,7 @@ uint64_t HTLinuxOwnedObjects::startTime(int32_t pid)
 void HTLinuxOwnedObjects::addHeldFiles(uint64_t pageSize)
 {
     for (const auto& [key, file] : heldFiles_) {
+        heldFileBytes_[key] = file.blocks * 512;
         if (file.mappedAsFile) continue;
         vm_owned_object record{};
         record.object_id = htFileObjectId(key.first.first, key.first.second, key.second);

@@ -40,12 +40,17 @@ class HTLinuxOwnedObjects {
 public:
     explicit HTLinuxOwnedObjects(HTLinuxProcessTable& processes) : processes_(processes) {}
 
+    using Device = std::pair<uint32_t, uint32_t>;
+    using FileKey = std::pair<Device, uint64_t>;
+
     // The objects `pid` owns, sysctl-style: a 64-bit count and that many
     // records, or the size of that with a null `oldp`. 0, or -1 and errno.
     int ownedObjects(int32_t pid, void* oldp, size_t* oldlenp);
+    // The tmpfs files that some process holds, each with the bytes it has
+    // in memory and swap.
+    const std::map<FileKey, uint64_t>& heldFileBytes();
 
 private:
-    using Device = std::pair<uint32_t, uint32_t>;
     // A tmpfs file some process holds, with the holder that owns it so far.
     struct HeldFile {
         int32_t owner = 0;
@@ -57,7 +62,6 @@ private:
         // for it, under "mapped file".
         bool mappedAsFile = false;
     };
-    using FileKey = std::pair<Device, uint64_t>;
 
     void gather();
     // Reads the descriptors of `pid`, noting the tmpfs files it holds.
@@ -73,6 +77,7 @@ private:
     HTLinuxProcessTable& processes_;
     std::once_flag gathered_;
     std::map<FileKey, HeldFile> heldFiles_;
+    std::map<FileKey, uint64_t> heldFileBytes_;
     std::unordered_map<int32_t, std::vector<vm_owned_object>> byOwner_;
     // Processes whose descriptors the caller may not read.
     size_t unreadable_ = 0;

@@ -2,6 +2,7 @@
 
 #include "platform/HTMachErrorText.h"
 #include "platform/linux/HTLinuxProgramRunner.h"
+#include "platform/linux/HTLinuxUnheldTmpfs.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
 
@@ -193,7 +194,9 @@ kern_return_t HTLinuxPlatform::mach_memory_info(std::vector<mach_zone_name_t>& n
                                                 std::vector<mach_zone_info_t>& zones,
                                                 std::vector<mach_memory_info_t>& sites)
 {
-    return kernel_.memoryInfo(names, zones, sites);
+    kern_return_t result = kernel_.memoryInfo(names, zones, sites);
+    if (result == KERN_SUCCESS) HTLinuxUnheldTmpfs::addSites(owned_, sites);
+    return result;
 }
 
 std::vector<HTLoadedModule> HTLinuxPlatform::OSKextCopyLoadedKextInfo() { return kernel_.loadedModules(); }

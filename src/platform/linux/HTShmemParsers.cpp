@@ -59,15 +59,17 @@ std::vector<HTSysvSegment> htParseSysvShm(std::string_view text)
     return segments;
 }
 
-std::vector<std::pair<uint32_t, uint32_t>> htParseTmpfsDevices(std::string_view text)
+std::vector<HTTmpfsMount> htParseTmpfsMounts(std::string_view text)
 {
-    std::vector<std::pair<uint32_t, uint32_t>> devices;
+    std::vector<HTTmpfsMount> mounts;
     while (!text.empty()) {
         std::string_view line = nextLine(text);
         // ID PARENT MAJOR:MINOR ROOT MOUNTPOINT OPTIONS [TAGS...] - TYPE ...
         nextWord(line);
         nextWord(line);
         std::string_view device = nextWord(line);
+        nextWord(line);
+        std::string_view mountPoint = nextWord(line);
         size_t separator = line.find(" - ");
         if (separator == std::string_view::npos) continue;
         std::string_view rest = line.substr(separator + 3);
@@ -78,7 +80,7 @@ std::vector<std::pair<uint32_t, uint32_t>> htParseTmpfsDevices(std::string_view 
         if (colon == std::string_view::npos || !readNumber(device.substr(0, colon), major) ||
             !readNumber(device.substr(colon + 1), minor))
             continue;
-        devices.emplace_back(major, minor);
+        mounts.push_back({{major, minor}, mountPoint});
     }
-    return devices;
+    return mounts;
 }

@@ -24,6 +24,13 @@ struct HTSysvSegment {
 // or not made of numbers is skipped.
 std::vector<HTSysvSegment> htParseSysvShm(std::string_view text);
 
-// The devices (major, minor) of the tmpfs mounts that /proc/PID/mountinfo
-// lists: the file systems whose files are shared memory.
-std::vector<std::pair<uint32_t, uint32_t>> htParseTmpfsDevices(std::string_view text);
+// A tmpfs mount of /proc/PID/mountinfo: a file system whose files are
+// shared memory.
+struct HTTmpfsMount {
+    std::pair<uint32_t, uint32_t> device;  // major, minor
+    // Points into the parsed text; escaped as mountinfo escapes it (a
+    // blank is \040).
+    std::string_view mountPoint;
+};
+
+std::vector<HTTmpfsMount> htParseTmpfsMounts(std::string_view text);
