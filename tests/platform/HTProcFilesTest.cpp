@@ -201,4 +201,13 @@ TEST(HTShmemParsers, SystemVSegmentsAndTmpfsMounts)
     EXPECT_EQ(tmpfs[0].mountPoint, "/dev/shm");
     EXPECT_EQ(tmpfs[1].device, std::make_pair(259u, 1u));
     EXPECT_EQ(tmpfs[1].mountPoint, "/tmp");
+
+    // A maps line names its file by a hexadecimal device and a decimal inode; anonymous memory names none.
+    const auto file = htParseMapsFileLine("7f00a000-7f00b000 rw-s 00000000 00:1b 68     /dev/shm/x (deleted)");
+    ASSERT_TRUE(file.has_value());
+    EXPECT_EQ(file->range, "7f00a000-7f00b000");
+    EXPECT_EQ(file->device, std::make_pair(0u, 27u));
+    EXPECT_EQ(file->inode, 68u);
+    EXPECT_FALSE(htParseMapsFileLine("7f00c000-7f00d000 rw-p 00000000 00:00 0 ").has_value());
+    EXPECT_FALSE(htParseMapsFileLine("7f00c000-7f00d000 rw-p 00000000 0x:00 5 /f").has_value());
 }

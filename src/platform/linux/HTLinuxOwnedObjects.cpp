@@ -7,6 +7,7 @@
 #include "platform/linux/HTLinuxRegionInfo.h"
 #include "platform/linux/HTProcBuffer.h"
 #include "platform/linux/HTProcStatParser.h"
+#include "platform/linux/HTProcText.h"
 #include "platform/linux/HTShmemParsers.h"
 
 #include <dirent.h>
@@ -19,7 +20,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <charconv>
 #include <cstdio>
 #include <cstring>
 #include <limits>
@@ -52,13 +52,6 @@ bool isDevShm(int directory, const char* name)
     char target[32];
     ssize_t length = readlinkat(directory, name, target, sizeof(target));
     return length >= 9 && std::string_view(target, static_cast<size_t>(length)).starts_with("/dev/shm/");
-}
-
-template<typename Number>
-bool readNumber(std::string_view word, Number& value, int base)
-{
-    auto [end, error] = std::from_chars(word.data(), word.data() + word.size(), value, base);
-    return error == std::errc() && end == word.data() + word.size() && !word.empty();
 }
 
 uint64_t pageUp(uint64_t bytes, uint64_t pageSize) { return (bytes + pageSize - 1) / pageSize * pageSize; }
@@ -144,16 +137,7 @@ void HTLinuxOwnedObjects::gather()
     if (mountinfo.readFile(AT_FDCWD, "/proc/self/mountinfo"))
         for (const HTTmpfsMount& mount : htParseTmpfsMounts(mountinfo.view())) devices.push_back(mount.device);
 
-    // Every process, kernel threads too: theirs are empty.
-    if (DIR* proc = opendir("/proc")) {
-        while (dirent* entry = readdir(proc)) {
-            int32_t pid = 0;
-            const char* end = entry->d_name + std::strlen(entry->d_name);
-            auto [stop, error] = std::from_chars(entry->d_name, end, pid);
-            if (error == std::errc() && stop == end && pid > 0) readDescriptors(pid, devices, shmDevice);
-        }
-        closedir(proc);
-    }
+    HTLinuxProcessTable::forEachPid([&](int32_t pid) { readDescriptors(pid, devices, shmDevice); });
     addHeldFiles(pageSize);
     addSysvSegments(shmDevice, pageSize);
     if (unreadable_ > 0)
@@ -189,8 +173,7 @@ void HTLinuxOwnedObjects::readDescriptors(int32_t pid, const std::vector<Device>
         if (!started) started = startTime(pid);
         HeldFile& file = heldFiles_[{device, status.st_ino}];
         if (file.ownerFd >= 0 && std::make_pair(file.ownerStart, file.owner) <= std::make_pair(*started, pid)) continue;
-        int fd = -1;
-        std::from_chars(entry->d_name, entry->d_name + std::strlen(entry->d_name), fd);
+        const int fd = htNumber<int>(entry->d_name).value_or(-1);
         // An older holder takes the file over; whether some holder maps it
         // stays as it was.
         file = HeldFile{pid,
@@ -209,24 +192,9 @@ void HTLinuxOwnedObjects::noteMappedFiles(int32_t pid, const std::vector<FileKey
     if (!processes_.readProcessFile(pid, "/maps", maps)) return;
     std::string_view text = maps.view();
     while (!text.empty()) {
-        size_t newline = text.find('\n');
-        std::string_view line = text.substr(0, newline);
-        text.remove_prefix(newline == std::string_view::npos ? text.size() : newline + 1);
-        // START-END PERMS OFFSET MAJOR:MINOR INODE PATH, the device in hex.
-        std::string_view words[5];
-        for (std::string_view& word : words) {
-            size_t blank = line.find(' ');
-            word = line.substr(0, blank);
-            line.remove_prefix(blank == std::string_view::npos ? line.size() : blank + 1);
-        }
-        const size_t colon = words[3].find(':');
-        uint32_t major = 0;
-        uint32_t minor = 0;
-        uint64_t inode = 0;
-        if (colon == std::string_view::npos || !readNumber(words[3].substr(0, colon), major, 16) ||
-            !readNumber(words[3].substr(colon + 1), minor, 16) || !readNumber(words[4], inode, 10) || inode == 0)
-            continue;
-        const FileKey key{{major, minor}, inode};
+        std::optional<HTMapsFileLine> mapping = htParseMapsFileLine(htTakeLine(text));
+        if (!mapping) continue;
+        const FileKey key{mapping->device, mapping->inode};
         if (std::find(files.begin(), files.end(), key) != files.end()) heldFiles_[key].mappedAsFile = true;
     }
 }

@@ -209,6 +209,15 @@ bool HTLinuxProcessTable::readBsdInfo(int32_t pid, proc_bsdinfo& info)
     return true;
 }
 
+void HTLinuxProcessTable::forEachPid(const std::function<void(int32_t pid)>& callback)
+{
+    HTDirectoryListing dir = htListDirectory(HTFileDescriptor(::open("/proc", O_RDONLY | O_DIRECTORY | O_CLOEXEC)));
+    if (!dir) return;
+    int32_t pid = 0;
+    while (dirent* entry = ::readdir(dir.get()))
+        if (pidFromName(entry->d_name, pid)) callback(pid);
+}
+
 int HTLinuxProcessTable::listAllPids(int32_t* buffer, int bufferSize)
 {
     if (!procFd_.isOpen()) {

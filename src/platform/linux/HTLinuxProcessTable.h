@@ -10,6 +10,7 @@
 
 #include <cstddef>
 #include <cstdint>
+#include <functional>
 #include <mutex>
 #include <string_view>
 
@@ -23,6 +24,9 @@ public:
     // their own; kernel threads are left out. With a null buffer: an upper
     // bound of that number.
     int listAllPids(int32_t* buffer, int bufferSize);
+    // Calls `callback` with the pid of every entry of /proc, kernel threads
+    // (whose files are empty) among them.
+    static void forEachPid(const std::function<void(int32_t pid)>& callback);
     // The record of a process (or of the kernel for pid 0); false with
     // errno, ESRCH for a process that is gone or a kernel thread.
     bool readBsdInfo(int32_t pid, proc_bsdinfo& info);

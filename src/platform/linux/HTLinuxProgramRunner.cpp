@@ -1,7 +1,7 @@
 #include "platform/linux/HTLinuxProgramRunner.h"
 
-#include "platform/linux/HTFileDescriptor.h"
 #include "platform/linux/HTProcBuffer.h"
+#include "platform/linux/HTProcText.h"
 
 #include <fcntl.h>
 #include <sys/ptrace.h>
@@ -9,7 +9,6 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <charconv>
 #include <csignal>
 #include <cstdio>
 #include <string_view>
@@ -27,19 +26,14 @@ bool isThread(pid_t pid)
 {
     char path[64];
     std::snprintf(path, sizeof(path), "/proc/%d/status", static_cast<int>(pid));
-    HTFileDescriptor fd(open(path, O_RDONLY | O_CLOEXEC));
-    if (fd.get() < 0) return false;
-    char buffer[512];
-    ssize_t length = read(fd.get(), buffer, sizeof(buffer));
-    if (length <= 0) return false;
-    std::string_view text(buffer, static_cast<size_t>(length));
-    size_t at = text.find("\nTgid:");
-    if (at == std::string_view::npos) return false;
-    text.remove_prefix(at + 6);
-    while (!text.empty() && (text.front() == '\t' || text.front() == ' ')) text.remove_prefix(1);
-    pid_t tgid = 0;
-    auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), tgid);
-    return error == std::errc() && tgid != pid;
+    thread_local HTProcBuffer status;
+    if (!status.readFile(AT_FDCWD, path)) return false;
+    std::string_view text = status.view();
+    while (!text.empty()) {
+        std::string_view line = htTakeLine(text);
+        if (htTakeWord(line) == "Tgid:") return htNumber<pid_t>(htTakeWord(line)).value_or(pid) != pid;
+    }
+    return false;
 }
 
 // The child's side of the start: waits until heft has seized it, then runs

@@ -1,10 +1,12 @@
 #pragma once
 
 // Parsing of the files that say where shared memory lives: the System V
-// segments of /proc/sysvipc/shm and the tmpfs mounts of
-// /proc/self/mountinfo. Pure functions from bytes to records.
+// segments of /proc/sysvipc/shm, the tmpfs mounts of /proc/self/mountinfo
+// and the files that /proc/PID/maps maps. Pure functions from bytes to
+// records.
 
 #include <cstdint>
+#include <optional>
 #include <string_view>
 #include <utility>
 #include <vector>
@@ -34,3 +36,16 @@ struct HTTmpfsMount {
 };
 
 std::vector<HTTmpfsMount> htParseTmpfsMounts(std::string_view text);
+
+// A line of /proc/PID/maps that maps a file (inode not 0).
+struct HTMapsFileLine {
+    // "START-END", as /proc/PID/map_files names the mapping; points into
+    // the parsed text.
+    std::string_view range;
+    std::pair<uint32_t, uint32_t> device;  // major, minor
+    uint64_t inode = 0;
+};
+
+// The mapping of a maps line; nullopt for anonymous memory or a line that
+// is no maps line.
+std::optional<HTMapsFileLine> htParseMapsFileLine(std::string_view line);
